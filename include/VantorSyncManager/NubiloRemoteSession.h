@@ -1,0 +1,92 @@
+// One authenticated conversation with the user's WebDAV share: the member
+// account, the WebDAV session, the layout of the sync area, the locking
+// parameters and lock owner text, and the set of resources held locked.
+// A session is driven from one thread; cancel() may be called from any.
+#pragma once
+
+#include <atomic>
+#include <cstdint>
+#include <memory>
+#include <optional>
+#include <set>
+#include <string>
+
+#include "VantorSyncManager/DavTransaction.h"
+#include "VantorSyncManager/Export.h"
+#include "VantorSyncManager/MemberAccount.h"
+#include "VantorSyncManager/Value.h"
+
+class TesselSession;
+
+class VSM_EXPORT NubiloRemoteSession {
+ public:
+  // Writes the member name into configuration under "Name", creates the
+  // account and initialises a session. Raises what initialisation raises.
+  static std::unique_ptr<NubiloRemoteSession> sessionWithUsername(const std::string& username,
+                                                                  const std::string& password,
+                                                                  vtc::Dictionary& configuration);
+  // A session for the account stored in preferences; raises
+  // NubiloLoginFailureException when none is stored.
+  static std::unique_ptr<NubiloRemoteSession> sessionFromPreferencesWithConfiguration(
+      const vtc::Dictionary& configuration);
+
+  // initWithVTMemberAccount:configuration: validates the credentials (with
+  // retries), opens the WebDAV session and finds or creates the sync area.
+  // Raises NubiloLoginFailureException, NubiloNetworkFailureException or
+  // NubiloTransactionFailureException; std::invalid_argument when the
+  // configuration lacks "sync_path" or "host_name". No partly initialised
+  // session is ever returned.
+  NubiloRemoteSession(std::shared_ptr<MemberAccount> account, const vtc::Dictionary& configuration);
+
+  // Unlocks every resource still held, then releases the members.
+  ~NubiloRemoteSession();
+
+  NubiloRemoteSession(const NubiloRemoteSession&) = delete;
+  NubiloRemoteSession& operator=(const NubiloRemoteSession&) = delete;
+
+  // Whether the clients and schemas collections exist (created if needed).
+  bool createSyncPaths();
+  // Deletes the whole sync area under a lock of its parent; raises
+  // NubiloLockFailureException when that parent is locked.
+  bool removeSyncPaths();
+  void cancel() { _isCancelled = true; }
+  bool isCancelled() const { return _isCancelled; }
+  const std::string& eventUUID() const { return _sessionUUID; }
+
+  // Writes the message-trace records of one failed or retried transaction.
+  void messageTraceTransactionFailure(const DavTransaction& transaction, bool finalRetry,
+                                      int64_t retryCount, const std::string& message);
+
+  // Read access for callers and tests.
+  TesselSession& tesselSession() { return *_TesselSession; }
+  const vtc::Dictionary& configuration() const { return _configuration; }
+  const std::string& syncPath() const { return _syncPath; }
+  const std::string& clientsPath() const { return _clientsPath; }
+  const std::string& schemasPath() const { return _schemasPath; }
+  const std::string& syncNamespace() const { return _syncNamespace; }
+  int64_t lockDuration() const { return _lockDuration; }
+  int64_t maxLockAttempts() const { return _maxLockAttempts; }
+  int64_t lockAcquireSleepInterval() const { return _lockAcquireSleepInterval; }
+  const std::set<std::string>& lockedResources() const { return _lockedResources; }
+  const std::string& lockOwnerFormatString() const { return _lockOwnerFormatString; }
+  const std::optional<std::string>& respondingServer() const { return _respondingServer; }
+
+ protected:
+  std::shared_ptr<MemberAccount> _vantorAccount;
+  std::unique_ptr<TesselSession> _TesselSession;
+  vtc::Dictionary _configuration;
+  std::string _syncPath;
+  std::string _clientsPath;
+  std::string _schemasPath;
+  std::string _syncNamespace;
+  size_t _namespaceLength = 0;
+  int64_t _lockDuration = 0;
+  int64_t _maxLockAttempts = 0;
+  int64_t _lockAcquireSleepInterval = 0;
+  std::set<std::string> _lockedResources;
+  vtc::Dictionary _clientsInfo;
+  std::string _lockOwnerFormatString;
+  std::optional<std::string> _respondingServer;
+  std::atomic<bool> _isCancelled{false};
+  std::string _sessionUUID;
+};

@@ -1,0 +1,12 @@
+// Umbrella header of the library.
+#pragma once
+
+#include "VantorSyncManager/DavTransaction.h"
+#include "VantorSyncManager/Diagnostics.h"
+#include "VantorSyncManager/Log.h"
+#include "VantorSyncManager/MemberAccount.h"
+#include "VantorSyncManager/NubiloException.h"
+#include "VantorSyncManager/NubiloRemoteSession.h"
+#include "VantorSyncManager/PublicNames.h"
+#include "VantorSyncManager/StringAdditions.h"
+#include "VantorSyncManager/Value.h"

@@ -1,0 +1,218 @@
+// _VTCLog and initVTCLogger. The three process-wide statics are never freed;
+// the once-guard and the lazy open are deliberately unsynchronised (a second
+// initialisation in a race only repeats the same work).
+#include <fcntl.h>
+#include <pthread.h>
+#include <sys/stat.h>
+#include <syslog.h>
+#include <unistd.h>
+
+#include <cstdarg>
+#include <cstdio>
+#include <algorithm>
+#include <cstring>
+#include <ctime>
+#include <string>
+#include <vector>
+
+#include "common/Clock.h"
+#include "common/Logging.h"
+#include "platform/fs/LocalPaths.h"
+#include "platform/prefs/PreferenceFiles.h"
+#include "platform/workspace/ApplicationLookup.h"
+
+namespace {
+
+bool loggerInited = false;
+int32_t currentLogLevel = 0;
+int32_t logFile = 0;
+
+constexpr const char* kLogPath = "~/Library/Logs/Sync/nubilosync.log";
+constexpr const char* kPreferenceDomain = "com.korvo.VantorSync";
+constexpr off_t kRollSize = 4194305;  // more than 4 MiB
+
+int levelFromWord(const std::string& word) {
+  if (strcasecmp(word.c_str(), "debug") == 0) return 3;
+  if (strcasecmp(word.c_str(), "info") == 0) return 2;
+  if (strcasecmp(word.c_str(), "warn") == 0) return 1;
+  if (strcasecmp(word.c_str(), "error") == 0) return 0;
+  // "verbose" silences everything, errors included; kept as configured.
+  if (strcasecmp(word.c_str(), "verbose") == 0) return -1;
+  return 1;
+}
+
+const char* levelWord(int level) {
+  switch (level) {
+    case 0: return "Error";
+    case 1: return "Warning";
+    case 2: return "Info";
+    case 3: return "Debug";
+    default: return "????";
+  }
+}
+
+std::string rolledPath(const std::string& path) {
+  return path.substr(0, path.size() - std::strlen("log")) + "0.log";
+}
+
+void rollIfLarge() {
+  std::string path = vtc::log::logFilePath();
+  struct stat st {};
+  if (::stat(path.c_str(), &st) != 0 || st.st_size < kRollSize) return;
+  std::string old = rolledPath(path);
+  ::unlink(old.c_str());                       // failure ignored
+  std::rename(path.c_str(), old.c_str());      // failure ignored
+}
+
+// Replaces every byte that does not belong to a well-formed UTF-8 sequence
+// with '?', in place.
+void sanitizeUtf8(char* s, size_t n) {
+  auto* p = reinterpret_cast<unsigned char*>(s);
+  size_t i = 0;
+  while (i < n) {
+    unsigned char c = p[i];
+    size_t len = c < 0x80 ? 1 : (c >> 5) == 0x6 ? 2 : (c >> 4) == 0xE ? 3 : (c >> 3) == 0x1E ? 4 : 0;
+    bool ok = len > 0 && i + len <= n && !(len == 2 && c < 0xC2);
+    for (size_t k = 1; ok && k < len; ++k) ok = (p[i + k] & 0xC0) == 0x80;
+    if (!ok) {
+      p[i++] = '?';
+      continue;
+    }
+    i += len;
+  }
+}
+
+std::string timestamp() {
+  auto now = vtc::currentClock().now();
+  auto ms = std::chrono::duration_cast<std::chrono::milliseconds>(now.time_since_epoch()).count();
+  std::time_t secs = static_cast<std::time_t>(ms / 1000);
+  std::tm tm{};
+  localtime_r(&secs, &tm);
+  char buf[64];
+  size_t n = std::strftime(buf, sizeof buf, "%Y-%m-%d %H:%M:%S", &tm);
+  std::snprintf(buf + n, sizeof buf - n, ":%03d", static_cast<int>(ms % 1000));
+  return buf;
+}
+
+const char* lastPathComponent(const char* file) {
+  if (!file) return "";
+  const char* slash = std::strrchr(file, '/');
+  return slash ? slash + 1 : file;
+}
+
+// The C entry point's "%@" takes a const char*: turn every "%@" into "%s" and
+// let vsnprintf do the rest.
+std::string cFormat(const char* format) {
+  std::string out;
+  for (const char* p = format; *p; ++p) {
+    out += *p;
+    if (*p != '%') continue;
+    ++p;
+    if (!*p) break;
+    if (*p == '%') {
+      out += '%';
+      continue;
+    }
+    while (*p && std::strchr("-+ #0'.0123456789*hlLqjzt", *p)) out += *p++;
+    if (!*p) break;
+    out += (*p == '@') ? 's' : *p;
+  }
+  return out;
+}
+
+}  // namespace
+
+extern "C" VSM_EXPORT void initVTCLogger(void) {
+  if (loggerInited) return;
+  setlogmask(0xFF);
+  vtc::Value level = vtc::prefs::copyAppValue("LoggingLevel", kPreferenceDomain);
+  if (level.isNone()) {
+    // A computer with the internal bug-reporting tool installed logs Info.
+    if (vtc::workspace::applicationInstalled("Ticketer.app")) currentLogLevel = 2;
+  } else {
+    currentLogLevel = levelFromWord(level.isString() ? level.string() : level.description());
+  }
+  vtc::Value roll = vtc::prefs::copyAppValue("RollLogs", kPreferenceDomain);
+  if (roll.isNone() || roll.boolean()) rollIfLarge();
+  loggerInited = true;
+  setlogmask(0xFF);
+}
+
+extern "C" VSM_EXPORT void _VTCLog(const char* file, int line, const char* function, int level,
+                                   const char* format, ...) {
+  initVTCLogger();
+  if (currentLogLevel < level) return;
+  va_list args;
+  va_start(args, format);
+  std::string fmt = cFormat(format ? format : "");
+  va_list copy;
+  va_copy(copy, args);
+  int len = std::vsnprintf(nullptr, 0, fmt.c_str(), copy);
+  va_end(copy);
+  std::string message(static_cast<size_t>(len > 0 ? len : 0), '\0');
+  if (len > 0) std::vsnprintf(message.data(), message.size() + 1, fmt.c_str(), args);
+  va_end(args);
+  vtc::log::writeLine(file, line, function, level, message);
+}
+
+namespace vtc::log {
+
+bool wants(int level) {
+  initVTCLogger();
+  return currentLogLevel >= level;
+}
+
+std::string logFilePath() { return paths::expandTilde(kLogPath); }
+
+void writeLine(const char* file, int line, const char* function, int level,
+               std::string_view message) {
+  if (logFile == 0) {
+    std::string path = logFilePath();
+    std::string folder = path.substr(0, path.find_last_of('/'));
+    paths::makeDirectories(folder, 0755);  // a failure shows up as a failed open
+    int fd = ::open(path.c_str(), O_RDWR | O_APPEND | O_CREAT | O_CLOEXEC, 0600);
+    if (fd == 0) return;
+    logFile = fd;  // -1 when the open failed: lines are dropped from now on
+  }
+  std::string stamp = timestamp();
+  unsigned thread = static_cast<unsigned>(static_cast<uint64_t>(pthread_self()) & 0xFFFFFFFFu);
+  char head[512];
+  int headLen;
+  if (currentLogLevel == 3) {
+    headLen = std::snprintf(head, sizeof head, "%s|%s:%i %s|%x|%s|", stamp.c_str(),
+                            lastPathComponent(file), line, function ? function : "", thread,
+                            levelWord(level));
+  } else {
+    headLen = std::snprintf(head, sizeof head, "%s|%x|%s|", stamp.c_str(), thread,
+                            levelWord(level));
+  }
+  if (headLen < 0) return;
+  size_t h = std::min(static_cast<size_t>(headLen), sizeof head - 1);
+  size_t total = h + message.size() + 1;
+
+  // Short lines are assembled on the stack, longer ones on the heap.
+  char small[256];
+  std::vector<char> large;
+  char* buf = small;
+  if (total > sizeof small) {
+    large.resize(total);
+    buf = large.data();
+  }
+  std::memcpy(buf, head, h);
+  std::memcpy(buf + h, message.data(), message.size());
+  buf[total - 1] = '\n';
+  sanitizeUtf8(buf, total);
+  if (logFile >= 0) {
+    ssize_t ignored = ::write(logFile, buf, total);  // one write per line, no retry
+    (void)ignored;
+  }
+}
+
+void resetForTesting() {
+  if (logFile > 0) ::close(logFile);
+  logFile = 0;
+  loggerInited = false;
+  currentLogLevel = 0;
+}
+
+}  // namespace vtc::log

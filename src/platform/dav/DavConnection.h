@@ -1,0 +1,86 @@
+// One neon session to one server: credentials, TLS with the system's CA
+// store, time-outs, the lock store, and the capture of each request's status
+// and headers. Every request of a session travels over its one persistent
+// connection. Not thread-safe: callers serialise (TesselSession's monitor).
+#pragma once
+
+#include <cstdint>
+#include <functional>
+#include <optional>
+#include <string>
+
+#include <ne_locks.h>
+#include <ne_request.h>
+#include <ne_session.h>
+
+#include "VantorSyncManager/DavTransaction.h"
+#include "VantorSyncManager/Value.h"
+
+namespace vtc {
+
+struct DavEndpoint {
+  std::string scheme;
+  std::string host;
+  int32_t port = 0;
+  bool operator==(const DavEndpoint&) const = default;
+};
+
+class DavConnection {
+ public:
+  DavConnection(DavEndpoint endpoint, std::string user, std::string password,
+                std::string userAgent);
+  ~DavConnection();
+  DavConnection(const DavConnection&) = delete;
+  DavConnection& operator=(const DavConnection&) = delete;
+
+  const DavEndpoint& endpoint() const { return endpoint_; }
+  ne_session* session() const { return session_; }
+  ne_lock_store* lockStore() const { return locks_; }
+
+  // Read and connect time-out in seconds (neon's resolution).
+  void setReadTimeout(int seconds);
+
+  // Runs `run`, which issues one logical request through session() (neon
+  // may send it more than once for authentication) and returns neon's result
+  // code, and maps the outcome onto a transaction: result code, HTTP status of
+  // the final answer, completion state and response headers.
+  DavTransaction perform(const std::string& method, const std::string& path,
+                         const std::function<int()>& run);
+
+  // Header lines ("Name: value\r\n") sent with every request of the next
+  // perform() only.
+  void setExtraHeaders(std::string headers) { extraHeaders_ = std::move(headers); }
+
+  // The status of the last answer seen (kNoHTTPStatus when none).
+  int lastStatus() const { return capture_.status; }
+
+ private:
+  struct Capture {
+    int status = kNoHTTPStatus;
+    std::optional<Dictionary> headers;
+  };
+  static void onCreateRequest(ne_request* req, void* userdata, const char* method,
+                              const char* requri);
+  static void onPreSend(ne_request* req, void* userdata, ne_buffer* header);
+  static int onPostSend(ne_request* req, void* userdata, const ne_status* status);
+  static int onAuthenticate(void* userdata, const char* realm, int attempt, char* username,
+                            char* password);
+
+  DavEndpoint endpoint_;
+  std::string user_;
+  std::string password_;
+  ne_session* session_ = nullptr;
+  ne_lock_store* locks_ = nullptr;
+  Capture capture_;
+  std::string extraHeaders_;
+};
+
+// Dispatches a request and turns a non-2xx answer into NE_ERROR. The caller
+// still owns and destroys the request.
+int dispatchExpectingSuccess(ne_request* request);
+
+// Maps neon's result and the final HTTP status onto a transaction's outcome.
+void applyOutcome(DavTransaction& transaction, int neonResult, int httpStatus,
+                  const std::string& method);
+
+}  // namespace vtc

@@ -1,0 +1,116 @@
+// The WebDAV session to the user's share: every remote request of the library
+// goes through one of these operations, all synchronous, each returning a
+// DavTransaction. Paths are unescaped server paths. Held locks live in neon's
+// lock store, so later requests under a locked resource carry its token.
+// Not thread-safe: callers that share a session serialise on monitor().
+#pragma once
+
+#include <cstdint>
+#include <memory>
+#include <mutex>
+#include <optional>
+#include <string>
+#include <vector>
+
+#include "VantorSyncManager/DavTransaction.h"
+#include "VantorSyncManager/MemberAccount.h"
+#include "VantorSyncManager/Value.h"
+
+namespace vtc {
+class DavConnection;
+// Keys of listing entries and attribute dictionaries beside kNBURI,
+// kNBLastModified (a date) and kNBContentLength (an integer).
+inline constexpr const char* kDavETag = "DAV:getetag";
+inline constexpr const char* kDavIsCollection = "isCollection";
+inline constexpr const char* kDavLockDiscovery = "DAV:lockdiscovery";
+// Default duration of the plain lockResourceAtPath, in seconds.
+inline constexpr int kDefaultLockSeconds = 240;
+}  // namespace vtc
+
+class TesselSession {
+ public:
+  // _initWithCredentials:owner:host:port:scheme:
+  TesselSession(std::shared_ptr<MemberAccount> account, std::string owner, std::string host,
+                int32_t port, std::string scheme);
+  ~TesselSession();
+  TesselSession(const TesselSession&) = delete;
+  TesselSession& operator=(const TesselSession&) = delete;
+
+  void setIsSynchronous(bool synchronous) { synchronous_ = synchronous; }
+  void _setReadTimeOut(int32_t seconds);
+
+  // The monitor of this session object; re-entrant.
+  std::recursive_mutex& monitor() { return monitor_; }
+
+  // Collections. _makeCollectionsAtPaths creates every path (and missing
+  // parents); it succeeds when all of them exist afterwards.
+  DavTransaction _makeCollectionsAtPaths(const std::vector<std::string>& paths);
+  DavTransaction makeCollectionAtPath(const std::string& path,
+                                      bool includingIntermediateCollections);
+  DavTransaction deleteResourceAtPath(const std::string& path);
+
+  // Locks (depth 0, exclusive, write). A lock of a missing resource fails as
+  // not found (result 104, HTTP 404) instead of leaving a lock-null resource.
+  DavTransaction lockResourceAtPath(const std::string& path);
+  DavTransaction unlockResourceAtPath(const std::string& path);
+  DavTransaction _lockResourceAtPath(const std::string& path, double duration,
+                                     const std::string& owner);
+  DavTransaction _relockResourceAtPath(const std::string& path, double duration,
+                                       const std::string& owner);
+  DavTransaction _unlockResourceAtPath(const std::string& path);
+
+  // PROPFIND: props are full names ("DAV:getetag", namespace + local name);
+  // an empty list asks for all properties. The result maps each resource's
+  // unescaped path to a dictionary from full property name to text.
+  DavTransaction _issuePropFindAtPath(const std::string& path, int32_t depth,
+                                      const std::vector<std::string>& props,
+                                      bool includingParent);
+  DavTransaction _issuePropFindAtPath(const std::string& path, int32_t depth,
+                                      const std::vector<std::string>& props);
+  // PROPPATCH of local names in one namespace; a value equal to
+  // kNBRemoveProp removes the property.
+  DavTransaction _issuePropPatchAtPath(const std::string& path, const vtc::Dictionary& props,
+                                       const std::string& nameSpace);
+
+  // GET. The result is the body as data, or nothing when it went to
+  // localDestination. A range is sent unless both ends are 0.
+  DavTransaction getDataAtPath(const std::string& path, std::optional<vtc::Date> ifModifiedSince,
+                               int64_t rangeStart, int64_t rangeEnd,
+                               const std::optional<std::string>& localDestination);
+  DavTransaction getDataAtPath(const std::string& path);
+  DavTransaction putData(const vtc::Bytes& data, const std::string& path);
+  DavTransaction putLocalFileAtPath(const std::string& localPath, const std::string& path);
+
+  // MOVE; without overwrite an existing target answers HTTP 412.
+  DavTransaction moveResourceAtPath(const std::string& source, const std::string& destination,
+                                    bool allowingOverwrite);
+  DavTransaction moveResourceAtPath(const std::string& source, const std::string& destination);
+
+  // Attributes: kNBURI, kNBLastModified, kNBContentLength, vtc::kDavETag,
+  // vtc::kDavIsCollection; extended ones add vtc::kDavLockDiscovery, an array
+  // of active locks with "owner" (the owner XML, whole), "token", "depth",
+  // "timeout", "scope" and the fields of a sync lock owner record
+  // ("lock-user", "clientid", "clientname", "acquiredate").
+  DavTransaction basicAttributesAtPath(const std::string& path);
+  DavTransaction extendedAttributesAtPath(const std::string& path);
+  // The members of a collection (not the collection itself), as an array of
+  // attribute dictionaries.
+  DavTransaction listCollectionAtPath(const std::string& path);
+
+  const std::string& owner() const { return owner_; }
+  bool isSynchronous() const { return synchronous_; }
+  // Whether this session holds a lock on path in its lock store.
+  bool holdsLockOnPath(const std::string& path) const;
+
+ private:
+  DavTransaction propfind(const std::string& path, int32_t depth,
+                          const std::vector<std::string>& props, bool includingParent);
+  DavTransaction attributes(const std::string& path, int32_t depth, bool withLocks);
+  DavTransaction mkcol(const std::string& path);
+
+  std::shared_ptr<MemberAccount> account_;
+  std::shared_ptr<vtc::DavConnection> connection_;
+  std::string owner_;
+  bool synchronous_ = true;
+  std::recursive_mutex monitor_;
+};

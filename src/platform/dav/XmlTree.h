@@ -1,0 +1,48 @@
+// A small element tree built from a response body by neon's XML parser, so
+// that multistatus answers are read whole (no length cut on property values).
+#pragma once
+
+#include <memory>
+#include <string>
+#include <string_view>
+#include <vector>
+
+#include <ne_xml.h>
+
+namespace vtc {
+
+struct XmlElement {
+  std::string ns;  // namespace URI, "" when none
+  std::string name;
+  std::string text;  // character data directly inside this element
+  std::vector<std::unique_ptr<XmlElement>> children;
+
+  const XmlElement* child(std::string_view ns, std::string_view name) const;
+  std::vector<const XmlElement*> childrenNamed(std::string_view ns, std::string_view name) const;
+  // The text of this element and all its descendants, in document order.
+  std::string allText() const;
+  // The element's children serialised as XML, namespaces declared inline.
+  std::string innerXml() const;
+};
+
+// Collects every element of a document into a tree. Push it onto a parser
+// before the parser sees the document; root() is valid afterwards.
+class XmlTreeBuilder {
+ public:
+  explicit XmlTreeBuilder(ne_xml_parser* parser);
+  const XmlElement* root() const { return root_.get(); }
+
+ private:
+  static int startElement(void* userdata, int parent, const char* nspace, const char* name,
+                          const char** atts);
+  static int characters(void* userdata, int state, const char* cdata, size_t len);
+  static int endElement(void* userdata, int state, const char* nspace, const char* name);
+
+  std::unique_ptr<XmlElement> root_;
+  std::vector<XmlElement*> stack_;
+};
+
+// The text with &, <, > and quotes escaped for XML content and attributes.
+std::string xmlEscape(std::string_view text);
+
+}  // namespace vtc

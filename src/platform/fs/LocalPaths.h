@@ -1,0 +1,27 @@
+// Local folders of the user: the home folder and the XDG folders that stand
+// in for the caches, application-support and temporary folders.
+#pragma once
+
+#include <string>
+#include <string_view>
+
+namespace vtc::paths {
+
+// $HOME, or the password database's home folder when $HOME is unset.
+std::string homeDirectory();
+
+// "~" or "~/..." expanded against homeDirectory(); other paths unchanged.
+std::string expandTilde(std::string_view path);
+
+// a + "/" + b, without doubling a slash at the seam.
+std::string join(std::string_view a, std::string_view b);
+
+std::string cachesDirectory();              // $XDG_CACHE_HOME or ~/.cache
+std::string applicationSupportDirectory();  // $XDG_DATA_HOME or ~/.local/share
+std::string temporaryDirectory();           // $TMPDIR or /tmp
+
+// Creates path and its missing parents with the given mode; true when the
+// folder exists afterwards.
+bool makeDirectories(const std::string& path, int mode = 0755);
+
+}  // namespace vtc::paths

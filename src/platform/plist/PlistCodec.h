@@ -1,0 +1,34 @@
+// The one property-list layer: vtc::Value to and from libplist, XML and binary
+// encodings, and property-list files written atomically.
+#pragma once
+
+#include <optional>
+#include <string>
+
+#include <plist/plist.h>
+
+#include "VantorSyncManager/Value.h"
+
+namespace vtc::plist {
+
+// A new libplist tree for the value; the caller frees it with plist_free.
+// A none value has no property-list form and yields nullptr.
+::plist_t toPlist(const Value& value);
+
+// The value of a libplist node (a none value for a null node or a UID).
+Value fromPlist(::plist_t node);
+
+// Parses XML or binary property-list bytes; nullopt when they are neither.
+std::optional<Value> parse(ByteView bytes);
+
+std::string toXml(const Value& value);
+Bytes toBinary(const Value& value);
+
+// nullopt when the file is absent or is not a property list.
+std::optional<Value> readFile(const std::string& path);
+
+// Writes an XML property list to a temporary file beside path, flushes it and
+// renames it over path. On failure path is unchanged and false is returned.
+bool writeFileAtomically(const std::string& path, const Value& value, int mode = 0644);
+
+}  // namespace vtc::plist

@@ -1,0 +1,29 @@
+#include <gtest/gtest.h>
+
+#include <cstring>
+
+#include "VantorSyncManager/PublicNames.h"
+#include "common/ResultCodes.h"
+
+TEST(PublicNames, FailureNamesEqualTheirOwnNames) {
+  EXPECT_STREQ(NubiloLoginFailureException, "NubiloLoginFailureException");
+  EXPECT_STREQ(NubiloMinglerFailureException, "NubiloMinglerFailureException");
+  EXPECT_STREQ(NubiloSyncCancelledByUser, "User Cancelled");
+  EXPECT_STREQ(kLastSyncDateChangedNotification, "com.korvo.VantorSync.lastSyncDateChanged");
+  EXPECT_STREQ(_SMUserAgentBase, "VantorClient/%@/%@/%@");
+  EXPECT_EQ(kCurrentConfigVersion, 251);
+  EXPECT_EQ(kAutoConfigVersion, -1);
+}
+
+TEST(PublicNames, VersionStringHasTwoBlanksAndEndsWithLineFeed) {
+  EXPECT_EQ(VantorSyncManagerVersionNumber, 488.5);
+  EXPECT_STREQ(VantorSyncManagerVersionString,
+               "@(#)PROGRAM:VantorSyncManager  PROJECT:NubiloSyncClient-488.5\n");
+}
+
+TEST(PublicNames, ResultCodesAreNamedOrShownAsNumbers) {
+  EXPECT_EQ(vtc::resultCodeName(kNBSuccess), "kNBSuccess");
+  EXPECT_EQ(vtc::resultCodeName(151), "kNBServiceBusy");
+  EXPECT_EQ(vtc::resultCodeName(42), "42");
+  EXPECT_EQ(vtc::resultCodeName(111), "111");
+}

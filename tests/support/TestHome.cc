@@ -1,0 +1,25 @@
+#include "support/TestHome.h"
+
+#include <stdlib.h>
+
+#include <filesystem>
+
+namespace vtc::test {
+
+TestHome::TestHome() {
+  char tmpl[] = "/tmp/vsm-home-XXXXXX";
+  path_ = mkdtemp(tmpl);
+  if (const char* home = getenv("HOME")) previous_ = home;
+  setenv("HOME", path_.c_str(), 1);
+  unsetenv("XDG_CACHE_HOME");
+  unsetenv("XDG_DATA_HOME");
+}
+
+TestHome::~TestHome() {
+  if (previous_) setenv("HOME", previous_->c_str(), 1);
+  else unsetenv("HOME");
+  std::error_code ignored;
+  std::filesystem::remove_all(path_, ignored);
+}
+
+}  // namespace vtc::test
