@@ -9,4 +9,5 @@
 #include "VantorSyncManager/NubiloRemoteSession.h"
 #include "VantorSyncManager/PublicNames.h"
 #include "VantorSyncManager/StringAdditions.h"
+#include "VantorSyncManager/SyncEngineChange.h"
 #include "VantorSyncManager/Value.h"
