@@ -21,7 +21,8 @@ inline constexpr int32_t kNoHTTPStatus = -1;
 class VSM_EXPORT DavTransaction {
  public:
   DavTransaction() = default;
-  DavTransaction(std::string method, std::string path) : method_(std::move(method)), path_(std::move(path)) {}
+  DavTransaction(std::string method, std::string path)
+      : method_(std::move(method)), path_(std::move(path)) {}
 
   bool isSuccessful() const { return successful_; }
   int32_t errorType() const { return errorType_; }

@@ -26,9 +26,17 @@ std::atomic<Sleeper*> gSleeper{&gSystemSleeper};
 
 }  // namespace
 
-Clock& currentClock() { return *gClock.load(); }
-Sleeper& currentSleeper() { return *gSleeper.load(); }
-void installClock(Clock* clock) { gClock.store(clock ? clock : &gSystemClock); }
-void installSleeper(Sleeper* sleeper) { gSleeper.store(sleeper ? sleeper : &gSystemSleeper); }
+Clock& currentClock() {
+  return *gClock.load();
+}
+Sleeper& currentSleeper() {
+  return *gSleeper.load();
+}
+void installClock(Clock* clock) {
+  gClock.store(clock ? clock : &gSystemClock);
+}
+void installSleeper(Sleeper* sleeper) {
+  gSleeper.store(sleeper ? sleeper : &gSystemSleeper);
+}
 
 }  // namespace vtc

@@ -28,10 +28,14 @@ std::string printfOne(const std::string& spec, const FormatArg& arg, char conv) 
     case 'i':
     case 'c': {
       int64_t v = 0;
-      if (auto* s = std::get_if<int64_t>(&arg.v)) v = *s;
-      else if (auto* u = std::get_if<uint64_t>(&arg.v)) v = static_cast<int64_t>(*u);
-      else if (auto* d = std::get_if<double>(&arg.v)) v = static_cast<int64_t>(*d);
-      else if (auto* t = std::get_if<FormatArg::Text>(&arg.v)) return t->text;
+      if (auto* s = std::get_if<int64_t>(&arg.v))
+        v = *s;
+      else if (auto* u = std::get_if<uint64_t>(&arg.v))
+        v = static_cast<int64_t>(*u);
+      else if (auto* d = std::get_if<double>(&arg.v))
+        v = static_cast<int64_t>(*d);
+      else if (auto* t = std::get_if<FormatArg::Text>(&arg.v))
+        return t->text;
       if (conv == 'c') {
         full += 'c';
         n = std::snprintf(buf, sizeof buf, full.c_str(), static_cast<int>(v));
@@ -46,10 +50,14 @@ std::string printfOne(const std::string& spec, const FormatArg& arg, char conv) 
     case 'X':
     case 'o': {
       uint64_t v = 0;
-      if (auto* u = std::get_if<uint64_t>(&arg.v)) v = *u;
-      else if (auto* s = std::get_if<int64_t>(&arg.v)) v = static_cast<uint64_t>(*s);
-      else if (auto* d = std::get_if<double>(&arg.v)) v = static_cast<uint64_t>(*d);
-      else if (auto* t = std::get_if<FormatArg::Text>(&arg.v)) return t->text;
+      if (auto* u = std::get_if<uint64_t>(&arg.v))
+        v = *u;
+      else if (auto* s = std::get_if<int64_t>(&arg.v))
+        v = static_cast<uint64_t>(*s);
+      else if (auto* d = std::get_if<double>(&arg.v))
+        v = static_cast<uint64_t>(*d);
+      else if (auto* t = std::get_if<FormatArg::Text>(&arg.v))
+        return t->text;
       full += "ll";
       full += conv;
       n = std::snprintf(buf, sizeof buf, full.c_str(), static_cast<unsigned long long>(v));
@@ -64,10 +72,14 @@ std::string printfOne(const std::string& spec, const FormatArg& arg, char conv) 
     case 'a':
     case 'A': {
       double v = 0;
-      if (auto* d = std::get_if<double>(&arg.v)) v = *d;
-      else if (auto* s = std::get_if<int64_t>(&arg.v)) v = static_cast<double>(*s);
-      else if (auto* u = std::get_if<uint64_t>(&arg.v)) v = static_cast<double>(*u);
-      else if (auto* t = std::get_if<FormatArg::Text>(&arg.v)) return t->text;
+      if (auto* d = std::get_if<double>(&arg.v))
+        v = *d;
+      else if (auto* s = std::get_if<int64_t>(&arg.v))
+        v = static_cast<double>(*s);
+      else if (auto* u = std::get_if<uint64_t>(&arg.v))
+        v = static_cast<double>(*u);
+      else if (auto* t = std::get_if<FormatArg::Text>(&arg.v))
+        return t->text;
       full += conv;
       n = std::snprintf(buf, sizeof buf, full.c_str(), v);
       break;
@@ -82,10 +94,14 @@ std::string printfOne(const std::string& spec, const FormatArg& arg, char conv) 
     case 's':
     default: {
       std::string text;
-      if (auto* t = std::get_if<FormatArg::Text>(&arg.v)) text = t->text;
-      else if (auto* s = std::get_if<int64_t>(&arg.v)) text = std::to_string(*s);
-      else if (auto* u = std::get_if<uint64_t>(&arg.v)) text = std::to_string(*u);
-      else if (auto* d = std::get_if<double>(&arg.v)) text = std::to_string(*d);
+      if (auto* t = std::get_if<FormatArg::Text>(&arg.v))
+        text = t->text;
+      else if (auto* s = std::get_if<int64_t>(&arg.v))
+        text = std::to_string(*s);
+      else if (auto* u = std::get_if<uint64_t>(&arg.v))
+        text = std::to_string(*u);
+      else if (auto* d = std::get_if<double>(&arg.v))
+        text = std::to_string(*d);
       if (spec == "%") return text;
       full += 's';
       int len = std::snprintf(nullptr, 0, full.c_str(), text.c_str());
@@ -124,8 +140,10 @@ std::string formatArgs(std::string_view fmt, std::span<const FormatArg> args) {
     }
     if (fmt[i + 1] == '@') {
       const FormatArg& a = take();
-      if (auto* t = std::get_if<FormatArg::Text>(&a.v)) out += t->text;
-      else out += printfOne("%", a, 's');
+      if (auto* t = std::get_if<FormatArg::Text>(&a.v))
+        out += t->text;
+      else
+        out += printfOne("%", a, 's');
       ++i;
       continue;
     }
@@ -136,8 +154,7 @@ std::string formatArgs(std::string_view fmt, std::span<const FormatArg> args) {
     while (j < fmt.size() && std::isdigit(static_cast<unsigned char>(fmt[j]))) spec += fmt[j++];
     if (j < fmt.size() && fmt[j] == '.') {
       spec += fmt[j++];
-      while (j < fmt.size() && std::isdigit(static_cast<unsigned char>(fmt[j])))
-        spec += fmt[j++];
+      while (j < fmt.size() && std::isdigit(static_cast<unsigned char>(fmt[j]))) spec += fmt[j++];
     }
     // length modifiers are dropped: the argument's own type decides
     while (j < fmt.size() && std::strchr("hlLqjzt", fmt[j])) ++j;

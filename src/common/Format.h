@@ -19,23 +19,34 @@
 namespace vtc {
 
 // Text forms used by "%@".
-inline std::string textOf(const std::string& s) { return s; }
-inline std::string textOf(std::string_view s) { return std::string(s); }
-inline std::string textOf(const char* s) { return s ? s : "(null)"; }
-inline std::string textOf(const Value& v) { return v.isString() ? v.string() : v.description(); }
-inline std::string textOf(const Dictionary& d) { return d.description(); }
+inline std::string textOf(const std::string& s) {
+  return s;
+}
+inline std::string textOf(std::string_view s) {
+  return std::string(s);
+}
+inline std::string textOf(const char* s) {
+  return s ? s : "(null)";
+}
+inline std::string textOf(const Value& v) {
+  return v.isString() ? v.string() : v.description();
+}
+inline std::string textOf(const Dictionary& d) {
+  return d.description();
+}
 std::string textOf(const std::vector<std::string>& list);
 std::string textOf(const std::set<std::string>& set);
 template <typename T>
-  requires std::is_arithmetic_v<T>
-std::string textOf(T v) {
-  if constexpr (std::is_same_v<T, bool>) return v ? "1" : "0";
-  else return std::to_string(v);
+requires std::is_arithmetic_v<T> std::string textOf(T v) {
+  if constexpr (std::is_same_v<T, bool>)
+    return v ? "1" : "0";
+  else
+    return std::to_string(v);
 }
 template <typename T>
-  requires requires(const T& t) {
-    { t.description() } -> std::convertible_to<std::string>;
-  }
+requires requires(const T& t) {
+  { t.description() } -> std::convertible_to<std::string>;
+}
 std::string textOf(const T& t) {
   return t.description();
 }

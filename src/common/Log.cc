@@ -7,9 +7,9 @@
 #include <syslog.h>
 #include <unistd.h>
 
+#include <algorithm>
 #include <cstdarg>
 #include <cstdio>
-#include <algorithm>
 #include <cstring>
 #include <ctime>
 #include <string>
@@ -43,11 +43,16 @@ int levelFromWord(const std::string& word) {
 
 const char* levelWord(int level) {
   switch (level) {
-    case 0: return "Error";
-    case 1: return "Warning";
-    case 2: return "Info";
-    case 3: return "Debug";
-    default: return "????";
+    case 0:
+      return "Error";
+    case 1:
+      return "Warning";
+    case 2:
+      return "Info";
+    case 3:
+      return "Debug";
+    default:
+      return "????";
   }
 }
 
@@ -60,8 +65,8 @@ void rollIfLarge() {
   struct stat st {};
   if (::stat(path.c_str(), &st) != 0 || st.st_size < kRollSize) return;
   std::string old = rolledPath(path);
-  ::unlink(old.c_str());                       // failure ignored
-  std::rename(path.c_str(), old.c_str());      // failure ignored
+  ::unlink(old.c_str());                   // failure ignored
+  std::rename(path.c_str(), old.c_str());  // failure ignored
 }
 
 // Replaces every byte that does not belong to a well-formed UTF-8 sequence
@@ -71,7 +76,11 @@ void sanitizeUtf8(char* s, size_t n) {
   size_t i = 0;
   while (i < n) {
     unsigned char c = p[i];
-    size_t len = c < 0x80 ? 1 : (c >> 5) == 0x6 ? 2 : (c >> 4) == 0xE ? 3 : (c >> 3) == 0x1E ? 4 : 0;
+    size_t len = c < 0x80           ? 1
+                 : (c >> 5) == 0x6  ? 2
+                 : (c >> 4) == 0xE  ? 3
+                 : (c >> 3) == 0x1E ? 4
+                                    : 0;
     bool ok = len > 0 && i + len <= n && !(len == 2 && c < 0xC2);
     for (size_t k = 1; ok && k < len; ++k) ok = (p[i + k] & 0xC0) == 0x80;
     if (!ok) {
@@ -162,7 +171,9 @@ bool wants(int level) {
   return currentLogLevel >= level;
 }
 
-std::string logFilePath() { return paths::expandTilde(kLogPath); }
+std::string logFilePath() {
+  return paths::expandTilde(kLogPath);
+}
 
 void writeLine(const char* file, int line, const char* function, int level,
                std::string_view message) {
@@ -183,8 +194,8 @@ void writeLine(const char* file, int line, const char* function, int level,
                             lastPathComponent(file), line, function ? function : "", thread,
                             levelWord(level));
   } else {
-    headLen = std::snprintf(head, sizeof head, "%s|%x|%s|", stamp.c_str(), thread,
-                            levelWord(level));
+    headLen =
+        std::snprintf(head, sizeof head, "%s|%x|%s|", stamp.c_str(), thread, levelWord(level));
   }
   if (headLen < 0) return;
   size_t h = std::min(static_cast<size_t>(headLen), sizeof head - 1);

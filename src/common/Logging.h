@@ -28,11 +28,11 @@ void resetForTesting();
 
 }  // namespace vtc::log
 
-#define VTC_LOG(level, ...)                                                            \
-  do {                                                                                 \
-    if (::vtc::log::wants(level))                                                      \
-      ::vtc::log::writeLine(__FILE__, __LINE__, __PRETTY_FUNCTION__, (level),          \
-                            ::vtc::format(__VA_ARGS__));                               \
+#define VTC_LOG(level, ...)                                                   \
+  do {                                                                        \
+    if (::vtc::log::wants(level))                                             \
+      ::vtc::log::writeLine(__FILE__, __LINE__, __PRETTY_FUNCTION__, (level), \
+                            ::vtc::format(__VA_ARGS__));                      \
   } while (0)
 
 #define VTC_LOG_ERROR(...) VTC_LOG(::vtc::log::kError, __VA_ARGS__)

@@ -36,7 +36,8 @@ void installMessageTraceSink(MessageTraceSink sink) {
 std::string journalFieldName(const std::string& key) {
   std::string out;
   out.reserve(key.size());
-  for (char c : key) out += c == '.' ? '_' : static_cast<char>(std::toupper(static_cast<unsigned char>(c)));
+  for (char c : key)
+    out += c == '.' ? '_' : static_cast<char>(std::toupper(static_cast<unsigned char>(c)));
   return out;
 }
 
@@ -44,9 +45,9 @@ std::string journalFieldName(const std::string& key) {
 
 extern "C" VSM_EXPORT void VTCMessageTrace(const char* domain, const char* signature,
                                            const char* signature2, const char* signature3,
-                                           const char* result, const char* uuid,
-                                           const char* value, const char* value2,
-                                           const char* message, const char* event) {
+                                           const char* result, const char* uuid, const char* value,
+                                           const char* value2, const char* message,
+                                           const char* event) {
   // The record's keys in the order they are set. Domain and signature are
   // always set: a null one fails the chain and nothing is logged.
   struct Field {

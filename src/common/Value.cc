@@ -17,13 +17,14 @@ const Dictionary kEmptyDictionary;
 const Value kNoneValue;
 
 // Leading integer of a string, as a property-list reader reads "42abc".
-int64_t leadingInteger(const std::string& s) { return std::strtoll(s.c_str(), nullptr, 10); }
+int64_t leadingInteger(const std::string& s) {
+  return std::strtoll(s.c_str(), nullptr, 10);
+}
 
 bool needsQuotes(const std::string& s) {
   if (s.empty()) return true;
   for (unsigned char c : s) {
-    if (!(std::isalnum(c) || c == '_' || c == '.' || c == '/' || c == '$' || c == ':' ||
-          c == '-'))
+    if (!(std::isalnum(c) || c == '_' || c == '.' || c == '/' || c == '$' || c == ':' || c == '-'))
       return true;
   }
   return false;
@@ -44,7 +45,9 @@ std::string quoted(const std::string& s) {
   return out;
 }
 
-std::string indent(int level) { return std::string(static_cast<size_t>(level) * 4, ' '); }
+std::string indent(int level) {
+  return std::string(static_cast<size_t>(level) * 4, ' ');
+}
 
 std::string describe(const Value& v, int level);
 
@@ -114,7 +117,9 @@ Value::Value(std::string_view s) : v_(std::string(s)) {}
 Value::Value(Array a) : v_(std::make_unique<Array>(std::move(a))) {}
 Value::Value(Dictionary d) : v_(std::make_unique<Dictionary>(std::move(d))) {}
 
-Value::Value(const Value& other) { *this = other; }
+Value::Value(const Value& other) {
+  *this = other;
+}
 Value::Value(Value&& other) noexcept : v_(std::move(other.v_)) {}
 Value::~Value() = default;
 
@@ -142,15 +147,24 @@ Value& Value::operator=(Value&& other) noexcept {
 
 Value::Kind Value::kind() const {
   switch (v_.index()) {
-    case 0: return Kind::None;
-    case 1: return Kind::String;
-    case 2: return Kind::Integer;
-    case 3: return Kind::Real;
-    case 4: return Kind::Boolean;
-    case 5: return Kind::Date;
-    case 6: return Kind::Data;
-    case 7: return Kind::Array;
-    default: return Kind::Dictionary;
+    case 0:
+      return Kind::None;
+    case 1:
+      return Kind::String;
+    case 2:
+      return Kind::Integer;
+    case 3:
+      return Kind::Real;
+    case 4:
+      return Kind::Boolean;
+    case 5:
+      return Kind::Date;
+    case 6:
+      return Kind::Data;
+    case 7:
+      return Kind::Array;
+    default:
+      return Kind::Dictionary;
   }
 }
 
@@ -219,25 +233,35 @@ Array& Value::mutableArray() {
 }
 
 Dictionary& Value::mutableDictionary() {
-  if (!std::holds_alternative<std::unique_ptr<Dictionary>>(v_))
-    v_ = std::make_unique<Dictionary>();
+  if (!std::holds_alternative<std::unique_ptr<Dictionary>>(v_)) v_ = std::make_unique<Dictionary>();
   return *std::get<std::unique_ptr<Dictionary>>(v_);
 }
 
-std::string Value::description() const { return describe(*this, 0); }
+std::string Value::description() const {
+  return describe(*this, 0);
+}
 
 bool operator==(const Value& a, const Value& b) {
   if (a.kind() != b.kind()) return false;
   switch (a.kind()) {
-    case Value::Kind::None: return true;
-    case Value::Kind::String: return a.string() == b.string();
-    case Value::Kind::Integer: return a.integer() == b.integer();
-    case Value::Kind::Real: return a.real() == b.real();
-    case Value::Kind::Boolean: return a.boolean() == b.boolean();
-    case Value::Kind::Date: return a.date() == b.date();
-    case Value::Kind::Data: return a.data() == b.data();
-    case Value::Kind::Array: return a.array() == b.array();
-    case Value::Kind::Dictionary: return a.dictionary() == b.dictionary();
+    case Value::Kind::None:
+      return true;
+    case Value::Kind::String:
+      return a.string() == b.string();
+    case Value::Kind::Integer:
+      return a.integer() == b.integer();
+    case Value::Kind::Real:
+      return a.real() == b.real();
+    case Value::Kind::Boolean:
+      return a.boolean() == b.boolean();
+    case Value::Kind::Date:
+      return a.date() == b.date();
+    case Value::Kind::Data:
+      return a.data() == b.data();
+    case Value::Kind::Array:
+      return a.array() == b.array();
+    case Value::Kind::Dictionary:
+      return a.dictionary() == b.dictionary();
   }
   return false;
 }
@@ -294,7 +318,9 @@ std::vector<std::string> Dictionary::keys() const {
   return out;
 }
 
-std::string Dictionary::description() const { return describeDictionary(*this, 0); }
+std::string Dictionary::description() const {
+  return describeDictionary(*this, 0);
+}
 
 void Dictionary::reindex() {
   index_.clear();

@@ -31,8 +31,8 @@ const std::string& requiredString(const vtc::Dictionary& configuration, const ch
 std::unique_ptr<NubiloRemoteSession> NubiloRemoteSession::sessionWithUsername(
     const std::string& username, const std::string& password, vtc::Dictionary& configuration) {
   configuration.set("Name", vtc::Value(username));
-  auto account = MemberAccount::accountWithName(username, password,
-                                                configuration.get("user_agent").string());
+  auto account =
+      MemberAccount::accountWithName(username, password, configuration.get("user_agent").string());
   return std::make_unique<NubiloRemoteSession>(std::move(account), configuration);
 }
 
@@ -122,10 +122,10 @@ NubiloRemoteSession::NubiloRemoteSession(std::shared_ptr<MemberAccount> account,
   _clientsInfo.clear();
 
   // The result still holds one "%@": the acquire date, stamped per lock.
-  _lockOwnerFormatString = vtc::format(
-      kLockOwnerTemplate, _syncNamespace, stringByXMLQuoting(vtc::textOf(name)),
-      _configuration.get("ClientGuid"),
-      stringByXMLQuoting(vtc::textOf(_configuration.get("ClientName"))), "%@");
+  _lockOwnerFormatString =
+      vtc::format(kLockOwnerTemplate, _syncNamespace, stringByXMLQuoting(vtc::textOf(name)),
+                  _configuration.get("ClientGuid"),
+                  stringByXMLQuoting(vtc::textOf(_configuration.get("ClientName"))), "%@");
 
   // A failure here surfaces at the first request that needs the collections.
   createSyncPaths();

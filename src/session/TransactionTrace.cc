@@ -16,8 +16,8 @@ void NubiloRemoteSession::messageTraceTransactionFailure(const DavTransaction& t
   const std::string uuid = vtc::makeUUIDString();
   const std::string count = std::to_string(retryCount);
 
-  VTCMessageTrace("com.korvo.sync.nubilosession.retrytransaction", method.c_str(), nullptr,
-                  nullptr, "noop", uuid.c_str(), count.c_str(), nullptr, message.c_str(),
+  VTCMessageTrace("com.korvo.sync.nubilosession.retrytransaction", method.c_str(), nullptr, nullptr,
+                  "noop", uuid.c_str(), count.c_str(), nullptr, message.c_str(),
                   _sessionUUID.c_str());
   VTCMessageTrace("com.korvo.sync.nubilosession.retrytransaction.errorcode", code.c_str(),
                   http == vtc::kNoHTTPStatus ? nullptr : httpText.c_str(), nullptr, "noop",

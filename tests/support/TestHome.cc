@@ -16,8 +16,10 @@ TestHome::TestHome() {
 }
 
 TestHome::~TestHome() {
-  if (previous_) setenv("HOME", previous_->c_str(), 1);
-  else unsetenv("HOME");
+  if (previous_)
+    setenv("HOME", previous_->c_str(), 1);
+  else
+    unsetenv("HOME");
   std::error_code ignored;
   std::filesystem::remove_all(path_, ignored);
 }

@@ -126,23 +126,49 @@ void applyOutcome(DavTransaction& t, int neonResult, int status, const std::stri
 
   int32_t code;
   switch (status) {
-    case 207: code = 150; break;  // a multistatus answer that reports failures
-    case 400: code = 107; break;
-    case 401: code = 101; break;
-    case 404: code = 104; break;
-    case 405: code = 105; break;  // MKCOL of an existing collection
-    case 407: code = 109; break;
-    case 409: code = 104; break;  // a missing parent
-    case 412: code = 105; break;  // MOVE without overwrite onto an existing target
+    case 207:
+      code = 150;
+      break;  // a multistatus answer that reports failures
+    case 400:
+      code = 107;
+      break;
+    case 401:
+      code = 101;
+      break;
+    case 404:
+      code = 104;
+      break;
+    case 405:
+      code = 105;
+      break;  // MKCOL of an existing collection
+    case 407:
+      code = 109;
+      break;
+    case 409:
+      code = 104;
+      break;  // a missing parent
+    case 412:
+      code = 105;
+      break;  // MOVE without overwrite onto an existing target
     case 423:
-    case 424: code = 153; break;
-    case 503: code = 151; break;
-    case 507: code = 102; break;
+    case 424:
+      code = 153;
+      break;
+    case 503:
+      code = 151;
+      break;
+    case 507:
+      code = 102;
+      break;
     default:
-      if (status / 100 == 3) code = 152;
-      else if (status / 100 == 5) code = 108;
-      else if (status / 100 == 2) code = 153;  // answered 2xx, but unusable
-      else code = 100;
+      if (status / 100 == 3)
+        code = 152;
+      else if (status / 100 == 5)
+        code = 108;
+      else if (status / 100 == 2)
+        code = 153;  // answered 2xx, but unusable
+      else
+        code = 100;
   }
   if (neonResult == NE_PROXYAUTH) code = 109;
   t.setOutcome(false, code, status, state);

@@ -80,7 +80,8 @@ Array readActiveLocks(const XmlElement& lockDiscovery) {
   Array locks;
   for (const XmlElement* active : lockDiscovery.childrenNamed(kDav, "activelock")) {
     Dictionary lock;
-    if (const XmlElement* scope = active->child(kDav, "lockscope"); scope && !scope->children.empty())
+    if (const XmlElement* scope = active->child(kDav, "lockscope");
+        scope && !scope->children.empty())
       lock.set("scope", Value(scope->children.front()->name));
     if (const XmlElement* depth = active->child(kDav, "depth"))
       lock.set("depth", Value(trim(depth->allText())));

@@ -93,8 +93,9 @@ DavTransaction MemberAccount::credentialsAreValid() {
   std::string escaped = vtc::davpath::escape(checkPath_);
   static const ne_propname kResourceType[] = {{"DAV:", "resourcetype"}, {nullptr, nullptr}};
   DavTransaction t = conn->perform("PROPFIND", checkPath_, [&] {
-    return ne_simple_propfind(conn->session(), escaped.c_str(), NE_DEPTH_ZERO, kResourceType,
-                              [](void*, const ne_uri*, const ne_prop_result_set*) {}, nullptr);
+    return ne_simple_propfind(
+        conn->session(), escaped.c_str(), NE_DEPTH_ZERO, kResourceType,
+        [](void*, const ne_uri*, const ne_prop_result_set*) {}, nullptr);
   });
   const int status = t.httpStatusCode();
   if (t.transactionState() == vtc::kTransactionCompleted &&

@@ -13,7 +13,9 @@ TesselSession::TesselSession(std::shared_ptr<MemberAccount> account, std::string
 
 TesselSession::~TesselSession() = default;
 
-void TesselSession::_setReadTimeOut(int32_t seconds) { connection_->setReadTimeout(seconds); }
+void TesselSession::_setReadTimeOut(int32_t seconds) {
+  connection_->setReadTimeout(seconds);
+}
 
 DavTransaction TesselSession::mkcol(const std::string& path) {
   std::string escaped = vtc::davpath::escape(path);

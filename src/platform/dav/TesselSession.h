@@ -63,8 +63,7 @@ class TesselSession {
   // an empty list asks for all properties. The result maps each resource's
   // unescaped path to a dictionary from full property name to text.
   DavTransaction _issuePropFindAtPath(const std::string& path, int32_t depth,
-                                      const std::vector<std::string>& props,
-                                      bool includingParent);
+                                      const std::vector<std::string>& props, bool includingParent);
   DavTransaction _issuePropFindAtPath(const std::string& path, int32_t depth,
                                       const std::vector<std::string>& props);
   // PROPPATCH of local names in one namespace; a value equal to

@@ -29,7 +29,9 @@ void forgetLock(vtc::DavConnection& conn, struct ne_lock* lock) {
   ne_lock_destroy(lock);
 }
 
-long lockSeconds(double duration) { return std::max(1L, std::lround(duration)); }
+long lockSeconds(double duration) {
+  return std::max(1L, std::lround(duration));
+}
 
 DavTransaction notHeld(const std::string& method, const std::string& path) {
   DavTransaction t(method, path);
@@ -53,8 +55,8 @@ DavTransaction TesselSession::_lockResourceAtPath(const std::string& path, doubl
   lock->owner = ne_strdup(owner.c_str());
   // Without If-Match the server would lock a missing resource into being.
   connection_->setExtraHeaders("If-Match: *\r\n");
-  DavTransaction t = connection_->perform(
-      "LOCK", path, [&] { return ne_lock(connection_->session(), lock); });
+  DavTransaction t =
+      connection_->perform("LOCK", path, [&] { return ne_lock(connection_->session(), lock); });
   if (t.isSuccessful()) {
     if (struct ne_lock* old = findLock(*connection_, escaped)) forgetLock(*connection_, old);
     ne_lockstore_add(connection_->lockStore(), lock);
@@ -95,8 +97,8 @@ DavTransaction TesselSession::_unlockResourceAtPath(const std::string& path) {
   std::string escaped = vtc::davpath::escape(path);
   struct ne_lock* lock = findLock(*connection_, escaped);
   if (!lock) return notHeld("UNLOCK", path);
-  DavTransaction t = connection_->perform(
-      "UNLOCK", path, [&] { return ne_unlock(connection_->session(), lock); });
+  DavTransaction t =
+      connection_->perform("UNLOCK", path, [&] { return ne_unlock(connection_->session(), lock); });
   if (t.isSuccessful() || t.httpStatusCode() / 100 == 4) forgetLock(*connection_, lock);
   return t;
 }

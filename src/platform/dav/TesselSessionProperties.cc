@@ -18,8 +18,8 @@
 
 namespace {
 
-const std::vector<std::string> kBasicProperties = {
-    "DAV:getlastmodified", "DAV:getcontentlength", "DAV:getetag", "DAV:resourcetype"};
+const std::vector<std::string> kBasicProperties = {"DAV:getlastmodified", "DAV:getcontentlength",
+                                                   "DAV:getetag", "DAV:resourcetype"};
 
 // Sends one PROPFIND and, when a multistatus answer was parsed, hands its
 // entries (valid only during the call) to onParsed.
@@ -61,7 +61,8 @@ vtc::Dictionary attributesOf(const vtc::PropfindEntry& entry) {
       a.set(kNBLastModified, vtc::Value(std::chrono::system_clock::from_time_t(t)));
   }
   if (const vtc::Value* length = entry.properties.find("DAV:getcontentlength"))
-    a.set(kNBContentLength, vtc::Value(static_cast<long long>(std::atoll(length->string().c_str()))));
+    a.set(kNBContentLength,
+          vtc::Value(static_cast<long long>(std::atoll(length->string().c_str()))));
   if (const vtc::Value* etag = entry.properties.find(vtc::kDavETag)) a.set(vtc::kDavETag, *etag);
   const vtc::Value* type = entry.properties.find("DAV:resourcetype");
   a.set(vtc::kDavIsCollection,
@@ -113,8 +114,8 @@ DavTransaction TesselSession::_issuePropPatchAtPath(const std::string& path,
   size_t i = 0;
   for (const auto& [name, value] : props) {
     const bool remove = value.isString() && value.string() == kNBRemoveProp;
-    ops.push_back({&names[i], remove ? ne_propremove : ne_propset,
-                   remove ? nullptr : values[i].c_str()});
+    ops.push_back(
+        {&names[i], remove ? ne_propremove : ne_propset, remove ? nullptr : values[i].c_str()});
     ++i;
   }
   ops.push_back({nullptr, ne_propset, nullptr});
@@ -123,8 +124,7 @@ DavTransaction TesselSession::_issuePropPatchAtPath(const std::string& path,
   });
 }
 
-DavTransaction TesselSession::attributes(const std::string& path, int32_t depth,
-                                         bool withLocks) {
+DavTransaction TesselSession::attributes(const std::string& path, int32_t depth, bool withLocks) {
   std::vector<std::string> props = kBasicProperties;
   if (withLocks) props.push_back(vtc::kDavLockDiscovery);
   const std::string self = vtc::davpath::canonical(path);

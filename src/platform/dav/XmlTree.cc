@@ -72,6 +72,8 @@ int XmlTreeBuilder::endElement(void* userdata, int, const char*, const char*) {
   return 0;
 }
 
-std::string xmlEscape(std::string_view text) { return stringByXMLQuoting(text); }
+std::string xmlEscape(std::string_view text) {
+  return stringByXMLQuoting(text);
+}
 
 }  // namespace vtc

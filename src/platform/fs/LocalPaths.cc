@@ -35,19 +35,25 @@ std::string join(std::string_view a, std::string_view b) {
   if (a.empty()) return std::string(b);
   if (b.empty()) return std::string(a);
   std::string out(a);
-  if (out.back() == '/' && b.front() == '/') out.pop_back();
-  else if (out.back() != '/' && b.front() != '/') out += '/';
+  if (out.back() == '/' && b.front() == '/')
+    out.pop_back();
+  else if (out.back() != '/' && b.front() != '/')
+    out += '/';
   out.append(b);
   return out;
 }
 
-std::string cachesDirectory() { return envOr("XDG_CACHE_HOME", join(homeDirectory(), ".cache")); }
+std::string cachesDirectory() {
+  return envOr("XDG_CACHE_HOME", join(homeDirectory(), ".cache"));
+}
 
 std::string applicationSupportDirectory() {
   return envOr("XDG_DATA_HOME", join(homeDirectory(), ".local/share"));
 }
 
-std::string temporaryDirectory() { return envOr("TMPDIR", "/tmp"); }
+std::string temporaryDirectory() {
+  return envOr("TMPDIR", "/tmp");
+}
 
 bool makeDirectories(const std::string& path, int mode) {
   if (path.empty()) return false;

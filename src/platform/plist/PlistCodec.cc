@@ -36,9 +36,9 @@ using PlistPtr = std::unique_ptr<void, PlistFree>;
     case Value::Kind::Boolean:
       return plist_new_bool(value.boolean() ? 1 : 0);
     case Value::Kind::Date: {
-      auto us = std::chrono::duration_cast<std::chrono::microseconds>(
-                    value.date().time_since_epoch())
-                    .count();
+      auto us =
+          std::chrono::duration_cast<std::chrono::microseconds>(value.date().time_since_epoch())
+              .count();
       int64_t sec = us / 1000000;
       int64_t usec = us % 1000000;
       if (usec < 0) {
@@ -182,8 +182,10 @@ bool writeFileAtomically(const std::string& path, const Value& value, int mode) 
   size_t done = 0;
   while (ok && done < xml.size()) {
     ssize_t n = ::write(fd, xml.data() + done, xml.size() - done);
-    if (n <= 0) ok = false;
-    else done += static_cast<size_t>(n);
+    if (n <= 0)
+      ok = false;
+    else
+      done += static_cast<size_t>(n);
   }
   ok = ok && fsync(fd) == 0;
   ok = (::close(fd) == 0) && ok;

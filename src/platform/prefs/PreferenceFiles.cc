@@ -21,8 +21,7 @@ std::string byHostIdentifier() {
   std::ifstream in("/etc/machine-id");
   std::string id;
   std::getline(in, id);
-  while (!id.empty() && (id.back() == ' ' || id.back() == '\n' || id.back() == '\r'))
-    id.pop_back();
+  while (!id.empty() && (id.back() == ' ' || id.back() == '\n' || id.back() == '\r')) id.pop_back();
   return id;
 }
 

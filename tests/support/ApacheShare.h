@@ -1,0 +1,71 @@
+// A private Apache httpd WebDAV share for one test (or the demo): its own
+// configuration under a temporary folder, one Basic-auth user, a lock
+// database, keep-alive, an access log that records the client port, and an
+// X-Responding-Server header on every answer. Started in the foreground on a
+// free 127.0.0.1 port, stopped by its PID.
+#pragma once
+
+#include <sys/types.h>
+
+#include <string>
+#include <vector>
+
+#include "VantorSyncManager/Value.h"
+
+namespace vtc::test {
+
+struct AccessEntry {
+  int clientPort = 0;
+  std::string method;
+  std::string path;  // decoded URL path
+  int status = 0;
+};
+
+class ApacheShare {
+ public:
+  struct Options {
+    std::string user = "alice";
+    std::string password = "wonderland";
+    std::string respondingServer = "dav-test-1";
+  };
+
+  ApacheShare();
+  explicit ApacheShare(Options options);
+  ~ApacheShare();
+  ApacheShare(const ApacheShare&) = delete;
+  ApacheShare& operator=(const ApacheShare&) = delete;
+
+  int port() const { return port_; }
+  pid_t pid() const { return pid_; }
+  const Options& options() const { return options_; }
+  // The folder on disk that the share serves.
+  const std::string& documentRoot() const { return documentRoot_; }
+  // The disk path of a server path.
+  std::string diskPath(const std::string& serverPath) const;
+
+  // A session configuration for this share (the keys a session reads).
+  Dictionary configuration() const;
+
+  // The requests the server has logged so far (Apache writes its access log
+  // as each request finishes).
+  std::vector<AccessEntry> accessEntries() const;
+
+  static const char* const kSyncPath;
+  static const char* const kSyncNamespace;
+
+ private:
+  void writeConfiguration();
+  void start();
+  void stop();
+
+  Options options_;
+  std::string root_;
+  std::string documentRoot_;
+  int port_ = 0;
+  pid_t pid_ = -1;
+};
+
+// A TCP port on 127.0.0.1 that nothing listens on right now.
+int freeLoopbackPort();
+
+}  // namespace vtc::test

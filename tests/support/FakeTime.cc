@@ -1,0 +1,36 @@
+#include "support/FakeTime.h"
+
+namespace vtc::test {
+
+FakeTime::FakeTime() : now_(std::chrono::system_clock::now()) {
+  installClock(this);
+  installSleeper(this);
+}
+
+FakeTime::~FakeTime() {
+  installClock(nullptr);
+  installSleeper(nullptr);
+}
+
+Date FakeTime::now() const {
+  std::lock_guard<std::mutex> lock(mutex_);
+  return now_;
+}
+
+void FakeTime::sleepFor(Seconds duration) {
+  std::lock_guard<std::mutex> lock(mutex_);
+  sleeps_.push_back(duration.count());
+  now_ += std::chrono::duration_cast<Date::duration>(duration);
+}
+
+void FakeTime::advance(Seconds duration) {
+  std::lock_guard<std::mutex> lock(mutex_);
+  now_ += std::chrono::duration_cast<Date::duration>(duration);
+}
+
+std::vector<double> FakeTime::sleeps() const {
+  std::lock_guard<std::mutex> lock(mutex_);
+  return sleeps_;
+}
+
+}  // namespace vtc::test

@@ -1,0 +1,35 @@
+#include "support/TraceCapture.h"
+
+namespace vtc::test {
+
+TraceCapture::TraceCapture() {
+  installMessageTraceSink([this](const MessageTraceRecord& r) {
+    std::lock_guard<std::mutex> lock(mutex_);
+    records_.push_back(r);
+    return 0;
+  });
+}
+
+TraceCapture::~TraceCapture() {
+  installMessageTraceSink({});
+}
+
+std::vector<MessageTraceRecord> TraceCapture::records() const {
+  std::lock_guard<std::mutex> lock(mutex_);
+  return records_;
+}
+
+std::vector<MessageTraceRecord> TraceCapture::withDomain(const std::string& domain) const {
+  std::vector<MessageTraceRecord> out;
+  for (const auto& r : records())
+    if (field(r, "COM_KORVO_MESSAGE_DOMAIN") == domain) out.push_back(r);
+  return out;
+}
+
+std::string TraceCapture::field(const MessageTraceRecord& record, const std::string& key) {
+  for (const auto& [k, v] : record)
+    if (k == key) return v;
+  return {};
+}
+
+}  // namespace vtc::test
