@@ -1,0 +1,144 @@
+// The text log: levels from the preferences, line forms, rolling, and the
+// C entry point.
+#include <gtest/gtest.h>
+
+#include <sys/stat.h>
+#include <unistd.h>
+
+#include <filesystem>
+#include <fstream>
+#include <sstream>
+
+#include "common/Logging.h"
+#include "platform/fs/LocalPaths.h"
+#include "platform/plist/PlistCodec.h"
+#include "platform/prefs/PreferenceFiles.h"
+#include "support/TestHome.h"
+
+namespace {
+
+class Log : public ::testing::Test {
+ protected:
+  vtc::test::TestHome home;
+
+  void SetUp() override { vtc::log::resetForTesting(); }
+  void TearDown() override { vtc::log::resetForTesting(); }
+
+  void setPreference(const std::string& key, vtc::Value value, bool perHost = false) {
+    std::string file = perHost ? vtc::prefs::perHostFile("com.korvo.VantorSync")
+                               : vtc::prefs::perUserFile("com.korvo.VantorSync");
+    vtc::paths::makeDirectories(file.substr(0, file.find_last_of('/')));
+    vtc::Value root = vtc::plist::readFile(file).value_or(vtc::Value(vtc::Dictionary{}));
+    root.mutableDictionary().set(key, std::move(value));
+    ASSERT_TRUE(vtc::plist::writeFileAtomically(file, root));
+  }
+
+  std::vector<std::string> lines() const {
+    std::ifstream in(vtc::log::logFilePath());
+    std::vector<std::string> out;
+    for (std::string l; std::getline(in, l);) out.push_back(l);
+    return out;
+  }
+
+  void logAllLevels() {
+    for (int level = -1; level <= 4; ++level) VTC_LOG(level, "level %d", level);
+  }
+};
+
+// The level word and message after the timestamp and thread fields.
+std::string tail(const std::string& line, int fields) {
+  size_t pos = 0;
+  for (int i = 0; i < fields; ++i) pos = line.find('|', pos) + 1;
+  return line.substr(pos);
+}
+
+TEST_F(Log, WithoutAConfiguredLevelOnlyErrorsAreWrittenShort) {
+  logAllLevels();
+  auto l = lines();
+  ASSERT_EQ(l.size(), 2u);
+  EXPECT_EQ(tail(l[0], 2), "????|level -1");
+  EXPECT_EQ(tail(l[1], 2), "Error|level 0");
+  // yyyy-MM-dd HH:mm:ss:SSS|thread|word|message
+  EXPECT_EQ(l[1].find('|'), 23u);
+  EXPECT_EQ(l[1][19], ':');
+  struct stat st {};
+  ASSERT_EQ(::stat(vtc::log::logFilePath().c_str(), &st), 0);
+  EXPECT_EQ(st.st_mode & 0777, 0600u);
+}
+
+TEST_F(Log, DebugInAnyCaseWritesTheLongFormAndThePerHostValueWins) {
+  setPreference("LoggingLevel", vtc::Value("error"));
+  setPreference("LoggingLevel", vtc::Value("DeBuG"), /*perHost=*/true);
+  VTC_LOG_INFO("hello %@", "there");
+  auto l = lines();
+  ASSERT_EQ(l.size(), 1u);
+  EXPECT_NE(l[0].find("|log_test.cc:"), std::string::npos) << l[0];
+  EXPECT_NE(l[0].find("TestBody()|"), std::string::npos) << l[0];
+  EXPECT_EQ(tail(l[0], 3), "Info|hello there");
+}
+
+TEST_F(Log, LevelWords) {
+  struct Case {
+    const char* word;
+    size_t written;  // of the levels -1..4
+  } cases[] = {      // "verbose" is -1: only a call made at level -1 itself gets through
+               {"verbose", 1},
+               {"warn", 3},
+               {"gibberish", 3},
+               {"info", 4},
+               {"error", 2}};
+  for (const Case& c : cases) {
+    vtc::log::resetForTesting();
+    std::filesystem::remove(vtc::log::logFilePath());
+    setPreference("LoggingLevel", vtc::Value(c.word));
+    logAllLevels();
+    EXPECT_EQ(lines().size(), c.written) << c.word;
+  }
+}
+
+TEST_F(Log, RollsOnlyPastFourMebibytesAndOnlyOncePerProcess) {
+  std::string path = vtc::log::logFilePath();
+  vtc::paths::makeDirectories(path.substr(0, path.find_last_of('/')));
+  std::string rolled = path.substr(0, path.size() - 3) + "0.log";
+  auto makeLog = [&](size_t size) {
+    std::ofstream(path, std::ios::trunc) << std::string(size, 'x');
+  };
+  makeLog(4194304);
+  VTC_LOG_ERROR("first");
+  EXPECT_FALSE(std::filesystem::exists(rolled));
+
+  vtc::log::resetForTesting();
+  std::ofstream(rolled) << "old generation";
+  makeLog(4194305);
+  VTC_LOG_ERROR("second");
+  EXPECT_EQ(std::filesystem::file_size(rolled), 4194305u);  // replaced the old generation
+  EXPECT_EQ(lines().size(), 1u);
+
+  vtc::log::resetForTesting();
+  setPreference("RollLogs", vtc::Value(false));
+  makeLog(4194305);
+  VTC_LOG_ERROR("third");
+  EXPECT_GT(std::filesystem::file_size(path), 4194305u);
+}
+
+TEST_F(Log, TheCEntryPointTakesCStringsAndLongLinesStayWhole) {
+  setPreference("LoggingLevel", vtc::Value("info"));
+  std::string big(1000, 'y');
+  _VTCLog("/src/a/Caller.m", 12, "-[Caller run]", 2, "%@ and %d: %@", "text", 5, big.c_str());
+  _VTCLog("/src/a/Caller.m", 13, "-[Caller run]", 1, "%@", nullptr);
+  auto l = lines();
+  ASSERT_EQ(l.size(), 2u);
+  EXPECT_EQ(tail(l[0], 2), "Info|text and 5: " + big);
+  EXPECT_EQ(tail(l[1], 2), "Warning|(null)");
+}
+
+TEST_F(Log, AnUncreatableFolderDropsLinesSilently) {
+  // A plain file where the log folder should be.
+  vtc::paths::makeDirectories(home.path() + "/Library/Logs");
+  std::ofstream(home.path() + "/Library/Logs/Sync") << "in the way";
+  VTC_LOG_ERROR("dropped");
+  VTC_LOG_ERROR("dropped too");
+  EXPECT_TRUE(std::filesystem::is_regular_file(home.path() + "/Library/Logs/Sync"));
+}
+
+}  // namespace
