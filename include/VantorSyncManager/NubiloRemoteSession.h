@@ -6,10 +6,12 @@
 
 #include <atomic>
 #include <cstdint>
+#include <functional>
 #include <memory>
 #include <optional>
 #include <set>
 #include <string>
+#include <vector>
 
 #include "VantorSyncManager/DavTransaction.h"
 #include "VantorSyncManager/Export.h"
@@ -17,6 +19,9 @@
 #include "VantorSyncManager/Value.h"
 
 class TesselSession;
+namespace vtc {
+struct RetryTexts;
+}
 
 class VSM_EXPORT NubiloRemoteSession {
  public:
@@ -57,6 +62,62 @@ class VSM_EXPORT NubiloRemoteSession {
   void messageTraceTransactionFailure(const DavTransaction& transaction, bool finalRetry,
                                       int64_t retryCount, const std::string& message);
 
+  // Requests with retry. Each is issued once; a time-out (106) is tried once
+  // more and that second answer returned as it is; for the gets a 404 is
+  // tried once more after a pause (2 s, or 30 s for the path-only form).
+  // A network failure (103) raises NubiloNetworkFailureException; every other
+  // failure is returned for the caller to judge.
+  DavTransaction _issuePropFindWithRetryAtPath(const std::string& path, int32_t depth,
+                                               const std::vector<std::string>& props,
+                                               bool includingParent);
+  DavTransaction _issuePropFindWithRetryAtPath(const std::string& path, int32_t depth,
+                                               const std::vector<std::string>& props);
+  DavTransaction _issuePropPatchWithRetryAtPath(const std::string& path,
+                                                const vtc::Dictionary& props,
+                                                const std::string& nameSpace);
+  DavTransaction getDataWithRetryAtPath(const std::string& path,
+                                        std::optional<vtc::Date> ifModifiedSince,
+                                        int64_t rangeStart, int64_t rangeEnd,
+                                        const std::optional<std::string>& localDestination);
+  DavTransaction getDataWithRetryAtPath(const std::string& path);
+  DavTransaction putDataWithRetry(const vtc::Bytes& data, const std::string& path);
+  DavTransaction moveResourceWithRetryAtPath(const std::string& source,
+                                             const std::string& destination,
+                                             bool allowingOverwrite);
+  DavTransaction moveResourceWithRetryAtPath(const std::string& source,
+                                             const std::string& destination);
+
+  // Whether the dataclass's entity tag differs from previousETag (or cannot
+  // be read). Weak and strong forms of one tag are the same tag.
+  bool eTagChangedForDataclass(const std::string& dataclass, const std::string& previousETag);
+
+  // Lock primitives. A lock is retried with a randomised, doubling pause of
+  // at most 90 s and raises NubiloLockFailureException (with the resource's
+  // attributes as information), NubiloNetworkFailureException or
+  // NubiloResourceNotFoundException; a refused relock raises
+  // NubiloRelockFailureException; a failed unlock is logged, never raised.
+  void _lockResourceAtPath(const std::string& path);
+  void _relockResourceAtPath(const std::string& path);
+  void _unlockResourceAtPath(const std::string& path);
+
+  // Named locks. Those without a client argument use the configuration's
+  // "guid". lockClient raises NubiloClientRegistrationException for a client
+  // that does not exist.
+  void lockClient();
+  void lockClient(const std::string& guid);
+  void unlockClient();
+  void unlockClient(const std::string& guid);
+  void relockClient();
+  void relockClient(const std::string& guid);
+  void lockClients();
+  void unlockClients();
+  void relockClients();
+  void lockDataclass(const std::string& dataclass);
+  void unlockDataclass(const std::string& dataclass);
+  void relockDataclass(const std::string& dataclass);
+  void lockDataclasses();
+  void unlockDataclasses();
+
   // Read access for callers and tests.
   TesselSession& tesselSession() { return *_TesselSession; }
   const vtc::Dictionary& configuration() const { return _configuration; }
@@ -72,6 +133,12 @@ class VSM_EXPORT NubiloRemoteSession {
   const std::optional<std::string>& respondingServer() const { return _respondingServer; }
 
  protected:
+  DavTransaction retrying(const vtc::RetryTexts& texts, const std::string& subject,
+                          const std::function<DavTransaction()>& issue);
+  std::string lockOwnerText() const;
+  std::string clientPath(const std::string& guid) const;
+  std::string dataclassLockPath(const std::string& dataclass) const;
+
   std::shared_ptr<MemberAccount> _vantorAccount;
   std::unique_ptr<TesselSession> _TesselSession;
   vtc::Dictionary _configuration;

@@ -176,6 +176,12 @@ void ApacheShare::stop() {
   pid_ = -1;
 }
 
+void ApacheShare::forgetLocks() {
+  for (const auto& entry : std::filesystem::directory_iterator(root_ + "/var"))
+    if (entry.path().filename().string().starts_with("DavLock"))
+      std::filesystem::remove(entry.path());
+}
+
 std::string ApacheShare::diskPath(const std::string& serverPath) const {
   return documentRoot_ + serverPath;
 }

@@ -50,13 +50,18 @@ class ApacheShare {
   // as each request finishes).
   std::vector<AccessEntry> accessEntries() const;
 
+  // Stops the server (by PID) before the end of the test: later requests
+  // find nothing listening.
+  void stop();
+  // Makes the server forget every lock it holds, as a lock that timed out.
+  void forgetLocks();
+
   static const char* const kSyncPath;
   static const char* const kSyncNamespace;
 
  private:
   void writeConfiguration();
   void start();
-  void stop();
 
   Options options_;
   std::string root_;
