@@ -5,16 +5,15 @@
 
 #include <cctype>
 #include <cstdio>
-#include <mutex>
 
 #include "VantorSyncManager/Diagnostics.h"
+#include "common/Seam.h"
 
 namespace vtc {
 
 namespace {
 
-std::mutex gSinkMutex;
-MessageTraceSink gSink;
+Seam<int(const MessageTraceRecord&)> gSink;
 
 int sendToJournal(const MessageTraceRecord& record) {
   std::vector<std::string> lines;
@@ -28,10 +27,7 @@ int sendToJournal(const MessageTraceRecord& record) {
 
 }  // namespace
 
-void installMessageTraceSink(MessageTraceSink sink) {
-  std::lock_guard<std::mutex> lock(gSinkMutex);
-  gSink = std::move(sink);
-}
+void installMessageTraceSink(MessageTraceSink sink) { gSink.install(std::move(sink)); }
 
 std::string journalFieldName(const std::string& key) {
   std::string out;
@@ -81,11 +77,7 @@ extern "C" VSM_EXPORT void VTCMessageTrace(const char* domain, const char* signa
   if (status == 0) {
     record.emplace_back("PRIORITY", "6");
     record.emplace_back("MESSAGE", message ? message : "");
-    vtc::MessageTraceSink sink;
-    {
-      std::lock_guard<std::mutex> lock(vtc::gSinkMutex);
-      sink = vtc::gSink;
-    }
+    auto sink = vtc::gSink.current();
     status = sink ? sink(record) : vtc::sendToJournal(record);
   }
   if (status != 0) std::fprintf(stderr, "asl_log() or its precursors failed: %d\n", status);

@@ -3,8 +3,8 @@
 #include <ne_basic.h>
 #include <ne_props.h>
 
-#include <mutex>
 
+#include "common/Seam.h"
 #include "platform/dav/DavConnection.h"
 #include "platform/dav/DavPaths.h"
 #include "platform/dav/StoredAccount.h"
@@ -12,21 +12,13 @@
 namespace vtc {
 
 namespace {
-std::mutex gLookupMutex;
-StoredAccountLookup gLookup;
+Seam<std::optional<StoredCredentials>()> gLookup;
 }  // namespace
 
-void setStoredAccountLookup(StoredAccountLookup lookup) {
-  std::lock_guard<std::mutex> lock(gLookupMutex);
-  gLookup = std::move(lookup);
-}
+void setStoredAccountLookup(StoredAccountLookup lookup) { gLookup.install(std::move(lookup)); }
 
 std::optional<StoredCredentials> lookUpStoredAccount() {
-  StoredAccountLookup lookup;
-  {
-    std::lock_guard<std::mutex> lock(gLookupMutex);
-    lookup = gLookup;
-  }
+  auto lookup = gLookup.current();
   return lookup ? lookup() : std::nullopt;
 }
 

@@ -4,29 +4,20 @@
 #include <ifaddrs.h>
 #include <netinet/in.h>
 
-#include <mutex>
 
 #include "VantorSyncManager/Diagnostics.h"
+#include "common/Seam.h"
 
 namespace vtc::network {
 
 namespace {
-std::mutex gMutex;
-AddressSource gSource;
+Seam<std::optional<std::vector<std::string>>()> gSource;
 }  // namespace
 
-void installAddressSource(AddressSource source) {
-  std::lock_guard<std::mutex> lock(gMutex);
-  gSource = std::move(source);
-}
+void installAddressSource(AddressSource source) { gSource.install(std::move(source)); }
 
 std::optional<std::vector<std::string>> ipv4Addresses() {
-  AddressSource source;
-  {
-    std::lock_guard<std::mutex> lock(gMutex);
-    source = gSource;
-  }
-  if (source) return source();
+  if (auto source = gSource.current()) return source();
   ifaddrs* list = nullptr;
   if (getifaddrs(&list) != 0) return std::nullopt;
   std::vector<std::string> out;
