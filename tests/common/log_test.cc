@@ -11,8 +11,7 @@
 
 #include "common/Logging.h"
 #include "platform/fs/LocalPaths.h"
-#include "platform/plist/PlistCodec.h"
-#include "platform/prefs/PreferenceFiles.h"
+#include "platform/prefs/PreferenceStore.h"
 #include "support/TestHome.h"
 
 namespace {
@@ -25,12 +24,10 @@ class Log : public ::testing::Test {
   void TearDown() override { vtc::log::resetForTesting(); }
 
   void setPreference(const std::string& key, vtc::Value value, bool perHost = false) {
-    std::string file = perHost ? vtc::prefs::perHostFile("com.korvo.VantorSync")
-                               : vtc::prefs::perUserFile("com.korvo.VantorSync");
-    vtc::paths::makeDirectories(file.substr(0, file.find_last_of('/')));
-    vtc::Value root = vtc::plist::readFile(file).value_or(vtc::Value(vtc::Dictionary{}));
-    root.mutableDictionary().set(key, std::move(value));
-    ASSERT_TRUE(vtc::plist::writeFileAtomically(file, root));
+    auto scope = perHost ? vtc::prefs::Scope::CurrentHost : vtc::prefs::Scope::AnyHost;
+    auto& store = vtc::prefs::PreferenceStore::shared();
+    store.setValue(key, std::move(value), "com.korvo.VantorSync", scope);
+    ASSERT_TRUE(store.synchronize("com.korvo.VantorSync", scope));
   }
 
   std::vector<std::string> lines() const {

@@ -4,6 +4,8 @@
 
 #include <filesystem>
 
+#include "platform/prefs/PreferenceStore.h"
+
 namespace vtc::test {
 
 TestHome::TestHome() {
@@ -13,6 +15,7 @@ TestHome::TestHome() {
   setenv("HOME", path_.c_str(), 1);
   unsetenv("XDG_CACHE_HOME");
   unsetenv("XDG_DATA_HOME");
+  prefs::PreferenceStore::shared().resetForTesting();  // preferences belong to a home
 }
 
 TestHome::~TestHome() {
@@ -20,6 +23,7 @@ TestHome::~TestHome() {
     setenv("HOME", previous_->c_str(), 1);
   else
     unsetenv("HOME");
+  prefs::PreferenceStore::shared().resetForTesting();
   std::error_code ignored;
   std::filesystem::remove_all(path_, ignored);
 }

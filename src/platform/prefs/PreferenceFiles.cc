@@ -3,19 +3,9 @@
 #include <fstream>
 
 #include "platform/fs/LocalPaths.h"
-#include "platform/plist/PlistCodec.h"
+#include "platform/prefs/PreferenceStore.h"
 
 namespace vtc::prefs {
-
-namespace {
-
-Value valueInFile(const std::string& path, std::string_view key) {
-  std::optional<Value> root = plist::readFile(path);
-  if (!root || !root->isDictionary()) return {};
-  return root->dictionary().get(key);
-}
-
-}  // namespace
 
 std::string byHostIdentifier() {
   std::ifstream in("/etc/machine-id");
@@ -35,9 +25,7 @@ std::string perHostFile(std::string_view domain) {
 }
 
 Value copyAppValue(std::string_view key, std::string_view domain) {
-  Value v = valueInFile(perHostFile(domain), key);
-  if (!v.isNone()) return v;
-  return valueInFile(perUserFile(domain), key);
+  return PreferenceStore::shared().copyAppValue(key, domain);
 }
 
 }  // namespace vtc::prefs
