@@ -4,6 +4,7 @@
 
 #include <filesystem>
 
+#include "common/Logging.h"
 #include "platform/prefs/PreferenceStore.h"
 
 namespace vtc::test {
@@ -15,7 +16,9 @@ TestHome::TestHome() {
   setenv("HOME", path_.c_str(), 1);
   unsetenv("XDG_CACHE_HOME");
   unsetenv("XDG_DATA_HOME");
-  prefs::PreferenceStore::shared().resetForTesting();  // preferences belong to a home
+  // Preferences and the log belong to a home.
+  prefs::PreferenceStore::shared().resetForTesting();
+  log::resetForTesting();
 }
 
 TestHome::~TestHome() {
@@ -24,6 +27,7 @@ TestHome::~TestHome() {
   else
     unsetenv("HOME");
   prefs::PreferenceStore::shared().resetForTesting();
+  log::resetForTesting();
   std::error_code ignored;
   std::filesystem::remove_all(path_, ignored);
 }
