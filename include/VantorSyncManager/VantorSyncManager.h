@@ -10,4 +10,6 @@
 #include "VantorSyncManager/PublicNames.h"
 #include "VantorSyncManager/StringAdditions.h"
 #include "VantorSyncManager/SyncEngineChange.h"
+#include "VantorSyncManager/VTCConfiguration.h"
+#include "VantorSyncManager/VTCPrefsCenter.h"
 #include "VantorSyncManager/Value.h"

@@ -2,7 +2,9 @@
 
 namespace vtc::test {
 
-FakeTime::FakeTime() : now_(std::chrono::system_clock::now()) {
+// Starts on a whole second, as dates in XML property lists are kept.
+FakeTime::FakeTime()
+    : now_(std::chrono::floor<std::chrono::seconds>(std::chrono::system_clock::now())) {
   installClock(this);
   installSleeper(this);
 }

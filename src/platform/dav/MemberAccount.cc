@@ -3,26 +3,9 @@
 #include <ne_basic.h>
 #include <ne_props.h>
 
-
-#include "common/Seam.h"
 #include "platform/dav/DavConnection.h"
 #include "platform/dav/DavPaths.h"
-#include "platform/dav/StoredAccount.h"
-
-namespace vtc {
-
-namespace {
-Seam<std::optional<StoredCredentials>()> gLookup;
-}  // namespace
-
-void setStoredAccountLookup(StoredAccountLookup lookup) { gLookup.install(std::move(lookup)); }
-
-std::optional<StoredCredentials> lookUpStoredAccount() {
-  auto lookup = gLookup.current();
-  return lookup ? lookup() : std::nullopt;
-}
-
-}  // namespace vtc
+#include "platform/secrets/StoredAccount.h"
 
 MemberAccount::MemberAccount(std::string name, std::string password, std::string applicationID)
     : name_(std::move(name)),
@@ -40,9 +23,11 @@ std::shared_ptr<MemberAccount> MemberAccount::accountWithName(std::string name,
 
 std::shared_ptr<MemberAccount> MemberAccount::accountFromPreferencesWithApplicationID(
     const std::string& applicationID) {
-  std::optional<vtc::StoredCredentials> stored = vtc::lookUpStoredAccount();
-  if (!stored) return nullptr;
-  return accountWithName(stored->name, stored->password, applicationID);
+  std::optional<std::string> name = vtc::storedMemberName();
+  if (!name) return nullptr;
+  std::optional<std::string> password = vtc::storedPassword(*name);
+  if (!password) return nullptr;
+  return accountWithName(*name, *password, applicationID);
 }
 
 void MemberAccount::setServer(std::string scheme, std::string host, int32_t port,

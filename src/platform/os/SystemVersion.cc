@@ -1,0 +1,47 @@
+#include "platform/os/SystemVersion.h"
+
+#include <fstream>
+#include <mutex>
+
+namespace vtc::os {
+
+namespace {
+
+std::mutex gMutex;
+std::string gReleaseFile;
+
+// The value of KEY=value or KEY="value" in the release file.
+std::optional<std::string> releaseField(const std::string& key) {
+  std::string path;
+  {
+    std::lock_guard<std::mutex> lock(gMutex);
+    path = gReleaseFile.empty() ? "/etc/os-release" : gReleaseFile;
+  }
+  std::ifstream in(path);
+  for (std::string line; std::getline(in, line);) {
+    if (!line.starts_with(key + "=")) continue;
+    std::string value = line.substr(key.size() + 1);
+    if (value.size() >= 2 && (value.front() == '"' || value.front() == '\'') &&
+        value.back() == value.front())
+      value = value.substr(1, value.size() - 2);
+    if (value.empty()) return std::nullopt;
+    return value;
+  }
+  return std::nullopt;
+}
+
+}  // namespace
+
+std::optional<std::string> productVersion() {
+  return releaseField("VERSION_ID");
+}
+std::optional<std::string> buildVersion() {
+  return releaseField("BUILD_ID");
+}
+
+void setReleaseFileForTesting(std::string path) {
+  std::lock_guard<std::mutex> lock(gMutex);
+  gReleaseFile = std::move(path);
+}
+
+}  // namespace vtc::os

@@ -1,0 +1,185 @@
+// VTCPrefsCenter on real preference files, a private session bus and a real
+// Secret Service.
+#include <gtest/gtest.h>
+
+#include <sys/wait.h>
+#include <unistd.h>
+
+#include <filesystem>
+#include <fstream>
+#include <sstream>
+
+#include "VantorSyncManager/NubiloException.h"
+#include "VantorSyncManager/NubiloRemoteSession.h"
+#include "VantorSyncManager/PublicNames.h"
+#include "VantorSyncManager/VTCPrefsCenter.h"
+#include "common/Logging.h"
+#include "platform/prefs/PreferenceStore.h"
+#include "platform/secrets/CredentialStore.h"
+#include "support/ApacheShare.h"
+#include "support/FakeTime.h"
+#include "support/SessionBus.h"
+#include "support/TestHome.h"
+
+using vtc::prefs::PreferenceStore;
+using vtc::prefs::Scope;
+
+namespace {
+
+class PrefsCenter : public ::testing::Test {
+ protected:
+  vtc::test::TestHome home;
+  vtc::test::FakeTime time;
+  VTCPrefsCenter& prefs = VTCPrefsCenter::defaultCenter();
+
+  vtc::Value perHost(const std::string& key) {
+    PreferenceStore::shared().synchronize(kVantorDefaultsKey, Scope::CurrentHost);
+    return PreferenceStore::shared().copyValue(key, kVantorDefaultsKey, Scope::CurrentHost);
+  }
+  void setPerHost(const std::string& key, vtc::Value v) {
+    PreferenceStore::shared().setValue(key, std::move(v), kVantorDefaultsKey, Scope::CurrentHost);
+  }
+  std::string logText() {
+    std::ifstream in(vtc::log::logFilePath());
+    std::stringstream s;
+    s << in.rdbuf();
+    return s.str();
+  }
+};
+
+TEST_F(PrefsCenter, FailuresCountUpAndASuccessClearsEveryGuard) {
+  prefs.setSyncSuccessful(false, "Contacts");
+  prefs.setSyncSuccessful(false, "Contacts");
+  EXPECT_EQ(prefs.failedSyncCountForDataclass("Contacts"), 2);
+  EXPECT_FALSE(prefs.lastSuccessfulSyncDateForDataclass("Contacts"));
+  EXPECT_EQ(prefs.lastAttemptedSyncDateForDataclass("Contacts"), time.now());
+  setPerHost("etag.Contacts", vtc::Value("\"t\""));
+  prefs.setDownloadedAnchorClog(vtc::Value(12), "Contacts");
+  prefs.setDownloadedAnchorClog(vtc::Value(12), "Calendars");
+
+  time.advance(vtc::Seconds(5));
+  prefs.setSyncSuccessful(true, "Contacts");
+  EXPECT_EQ(prefs.lastSuccessfulSyncDateForDataclass("Contacts"), time.now());
+  for (const char* key :
+       {"FailedCount.Contacts", "etag.Contacts", "anchorClog.Contacts", "anchorCount.Contacts"})
+    EXPECT_TRUE(perHost(key).isNone()) << key;
+  EXPECT_EQ(perHost("anchorClog.Calendars").integer(), 12);  // other dataclasses untouched
+}
+
+TEST_F(PrefsCenter, RepeatedAnchorsAreCounted) {
+  std::vector<int64_t> counts;
+  for (int anchor : {12, 12, 12, 13}) {
+    prefs.setDownloadedAnchorClog(vtc::Value(anchor), "Bookmarks");
+    counts.push_back(prefs.repeatedDownloadCountForDataclass("Bookmarks"));
+  }
+  EXPECT_EQ(counts, (std::vector<int64_t>{0, 1, 2, 0}));
+  EXPECT_EQ(perHost("anchorClog.Bookmarks").integer(), 13);
+}
+
+TEST_F(PrefsCenter, AnExpiredFailedTagIsNotBelievedButKept) {
+  setPerHost("etag.Contacts", vtc::Value("\"abc\""));
+  setPerHost("etagTTL.Contacts", vtc::Value(time.now() + std::chrono::seconds(10)));
+  EXPECT_EQ(prefs.failedETagForDataclass("Contacts"), "\"abc\"");
+  time.advance(vtc::Seconds(11));
+  EXPECT_FALSE(prefs.failedETagForDataclass("Contacts"));
+  EXPECT_EQ(perHost("etag.Contacts").string(), "\"abc\"");
+}
+
+TEST_F(PrefsCenter, ModesDefaultToSixAndAreSeenAcrossProcessesAfterAResync) {
+  EXPECT_EQ(prefs.syncModeForDataclass("Contacts"), 6);
+  prefs.setSyncMode(2, "Contacts");
+  EXPECT_EQ(prefs.syncModeForDataclass("Contacts"), 2);
+  pid_t child = ::fork();
+  if (child == 0) {
+    PreferenceStore::shared().resetForTesting();
+    VTCPrefsCenter::defaultCenter().setSyncMode(4, "Contacts");
+    ::_exit(0);
+  }
+  ::waitpid(child, nullptr, 0);
+  EXPECT_EQ(prefs.syncModeForDataclass("Contacts"), 2);
+  EXPECT_EQ(prefs.synchronizedSyncModeForDataclass("Contacts"), 4);
+}
+
+TEST_F(PrefsCenter, TheSyncSwitchReadsStringsNumbersAndBooleans) {
+  struct Case {
+    vtc::Value stored;
+    bool on;
+  } cases[] = {{vtc::Value(), false},     {vtc::Value("YES"), true}, {vtc::Value("yes"), false},
+               {vtc::Value("1"), true},   {vtc::Value(1), true},     {vtc::Value(true), true},
+               {vtc::Value(false), false}};
+  for (const Case& c : cases) {
+    setPerHost("ShouldSyncWithServer", c.stored);
+    EXPECT_EQ(prefs.syncTurnedOn(), c.on) << c.stored.description();
+  }
+  prefs.setSyncTurnedOn(true);
+  EXPECT_EQ(perHost("ShouldSyncWithServer"), vtc::Value(true));
+}
+
+TEST_F(PrefsCenter, QueuedDataclassesAreFilesThatAClearingReadRemoves) {
+  std::string folder = home.path() + "/.cache/com.korvo.nubilo.queueddataclasses";
+  EXPECT_TRUE(prefs.queueDataclasses({}));
+  EXPECT_FALSE(std::filesystem::exists(folder));
+  EXPECT_FALSE(prefs.getQueuedDataclasses(false));
+  EXPECT_TRUE(prefs.queueDataclasses({"Contacts", "Calendars", "Contacts"}));
+  EXPECT_EQ(prefs.getQueuedDataclasses(false), (std::vector<std::string>{"Calendars", "Contacts"}));
+  EXPECT_EQ(prefs.getQueuedDataclasses(true), (std::vector<std::string>{"Calendars", "Contacts"}));
+  EXPECT_EQ(prefs.getQueuedDataclasses(true), std::vector<std::string>{});
+}
+
+TEST_F(PrefsCenter, AResetKeepsTheLogLevel) {
+  setPerHost("LoggingLevel", vtc::Value("debug"));
+  prefs.setClientGuid("G");
+  prefs.resetPreferences();
+  EXPECT_EQ(PreferenceStore::shared().copyKeyList(kVantorDefaultsKey, Scope::CurrentHost),
+            std::vector<std::string>{"LoggingLevel"});
+  EXPECT_FALSE(prefs.clientGuid());
+}
+
+TEST_F(PrefsCenter, TheLastSuccessfulSyncDateIsAnnouncedOnTheSessionBus) {
+  vtc::test::SessionBus bus;
+  vtc::test::NotificationListener listener;
+  EXPECT_FALSE(prefs.lastSuccessfulSyncDate());
+  prefs.setLastSuccessfulSyncDate(time.now());
+  auto got = listener.waitFor(std::chrono::milliseconds(1000));
+  ASSERT_EQ(got.size(), 1u);
+  EXPECT_EQ(got[0].name, "com.korvo.VantorSync.lastSyncDateChanged");
+  EXPECT_EQ(prefs.lastSuccessfulSyncDate(), time.now());
+}
+
+TEST_F(PrefsCenter, ASessionOpensFromStoredPreferencesAndTheKeyringAlone) {
+  vtc::test::SessionBus bus;
+  bus.startKeyring();
+  vtc::test::ApacheShare share;
+  PreferenceStore::shared().setValue("KitbagMember", vtc::Value("alice"), kVantorDefaultsKey,
+                                     Scope::AnyHost);
+  ASSERT_TRUE(vtc::secrets::storeGenericPassword("Kitbag", "alice", "Nubilo", "wonderland"));
+  EXPECT_EQ(prefs.username(), "alice");
+  EXPECT_EQ(prefs.objectForKey("Password"), vtc::Value("wonderland"));
+  auto session =
+      NubiloRemoteSession::sessionFromPreferencesWithConfiguration(share.configuration());
+  EXPECT_TRUE(std::filesystem::is_directory(
+      share.diskPath(std::string(vtc::test::ApacheShare::kSyncPath) + "/Clients")));
+}
+
+TEST_F(PrefsCenter, WithoutASecretServiceTheLoginFailsAndTheLogSaysHowToStoreThePassword) {
+  vtc::test::SessionBus bus;  // no keyring on it
+  PreferenceStore::shared().setValue("KitbagMember", vtc::Value("alice"), kVantorDefaultsKey,
+                                     Scope::AnyHost);
+  vtc::Dictionary config{
+      {"user_agent", "VantorClient/-/-/488"}, {"sync_path", "/s"}, {"host_name", "127.0.0.1"}};
+  try {
+    NubiloRemoteSession::sessionFromPreferencesWithConfiguration(config);
+    FAIL() << "no exception";
+  } catch (const NubiloException& e) {
+    EXPECT_EQ(e.name(), NubiloLoginFailureException);
+    EXPECT_EQ(e.reason(), "Failed to obtain credentials");
+  }
+  std::string log = logText();
+  EXPECT_NE(log.find("secret-tool store --label=Nubilo service Kitbag account alice"),
+            std::string::npos)
+      << log;
+  EXPECT_NE(log.find("Failed to obtain credentials from Preferences for VantorClient/-/-/488"),
+            std::string::npos);
+}
+
+}  // namespace
