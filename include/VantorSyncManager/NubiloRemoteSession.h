@@ -118,6 +118,43 @@ class VSM_EXPORT NubiloRemoteSession {
   void lockDataclasses();
   void unlockDataclasses();
 
+  // Dataclass registry: one collection per dataclass under the schemas
+  // collection, whose sync-namespace properties are its record.
+  // getDataclassInfo registers an unknown dataclass; it raises
+  // NubiloAccountExpiredException (402) or NubiloTransactionFailureException.
+  vtc::Dictionary getDataclassInfo(const std::string& dataclass);
+  vtc::Array getAllDataclassInfo();
+  std::vector<std::string> dataclassNames();
+  void dumpDataclasses();
+  bool registerDataclass(const std::string& dataclass);
+  bool unregisterDataclass(const std::string& dataclass);
+  // Empties the dataclass: moved aside in one request, or deleted changelog
+  // by changelog when the move is refused. Always false.
+  bool resetDataclass(const std::string& dataclass);
+  bool setInfoForDataclass(const vtc::Dictionary& properties, const std::string& dataclass);
+  bool validPropertiesForDataclass(const std::string& dataclass);
+  vtc::Dictionary calculatePropertiesForDataclass(const std::string& dataclass);
+  std::vector<std::string> changeLogVersionsForDataclass(const std::string& dataclass);
+  int64_t calculateStorageConsumedForDataclass(const std::string& dataclass);
+
+  // Client registry: one resource per client under the clients collection.
+  bool registerClient(const std::string& guid, const std::string& name);
+  bool unregisterClient(const std::string& guid);
+  vtc::Dictionary getClientInfo(const std::string& guid);
+  vtc::Dictionary getClientInfo();
+  vtc::Array getAllClientInfo();
+  bool setInfoForClient(const vtc::Dictionary& properties, const std::string& guid);
+  bool patchClientInfo(const vtc::Dictionary& properties);
+  void setStatus(const std::string& status, const std::string& guid, const std::string& dataclass);
+  void setOtherClientStatus(const std::string& status, const std::string& dataclass);
+  void setAllClientStatus(const std::string& status, const std::string& dataclass);
+  // The dataclass's own status; none removes it.
+  void setStatus(const std::optional<std::string>& status, const std::string& dataclass);
+
+  // Changelog paths.
+  std::string changeLogPathForDataclass(const std::string& dataclass, int64_t index) const;
+  bool changeLogExistsForDataclass(const std::string& dataclass, int64_t index);
+
   // Read access for callers and tests.
   TesselSession& tesselSession() { return *_TesselSession; }
   const vtc::Dictionary& configuration() const { return _configuration; }
@@ -138,6 +175,8 @@ class VSM_EXPORT NubiloRemoteSession {
   std::string lockOwnerText() const;
   std::string clientPath(const std::string& guid) const;
   std::string dataclassLockPath(const std::string& dataclass) const;
+  std::string dataclassPath(const std::string& dataclass) const;
+  vtc::Dictionary recordFromProperties(const vtc::Dictionary& properties) const;
 
   std::shared_ptr<MemberAccount> _vantorAccount;
   std::unique_ptr<TesselSession> _TesselSession;

@@ -2,10 +2,17 @@
 
 #include <algorithm>
 #include <cctype>
+#include <charconv>
 #include <cstdio>
 #include <cstring>
 
 namespace vtc {
+
+std::string shortestText(double v) {
+  char buf[64];
+  auto [end, ec] = std::to_chars(buf, buf + sizeof buf, v);
+  return ec == std::errc() ? std::string(buf, end) : std::to_string(v);
+}
 
 std::string textOf(const std::vector<std::string>& list) {
   std::string out = "(";
@@ -101,7 +108,7 @@ std::string printfOne(const std::string& spec, const FormatArg& arg, char conv) 
       else if (auto* u = std::get_if<uint64_t>(&arg.v))
         text = std::to_string(*u);
       else if (auto* d = std::get_if<double>(&arg.v))
-        text = std::to_string(*d);
+        text = shortestText(*d);
       if (spec == "%") return text;
       full += 's';
       int len = std::snprintf(nullptr, 0, full.c_str(), text.c_str());

@@ -19,6 +19,7 @@ TEST(Format, ObjectPlaceholderTakesAnythingWithATextForm) {
   EXPECT_EQ(vtc::format("%@", std::optional<std::string>()), "(null)");
   EXPECT_EQ(vtc::format("%@", std::set<std::string>{"b", "a"}), "(a, b)");
   EXPECT_EQ(vtc::format("%@ and %@", "one"), "one and (null)");  // missing arguments
+  EXPECT_EQ(vtc::format("VantorSyncClient-%@", 488.5), "VantorSyncClient-488.5");
 }
 
 TEST(Format, PrintfConversionsFollowTheArgumentsType) {

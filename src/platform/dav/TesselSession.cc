@@ -1,6 +1,8 @@
 #include "platform/dav/TesselSession.h"
 
+#include <ne_207.h>
 #include <ne_basic.h>
+#include <ne_locks.h>
 
 #include "platform/dav/DavConnection.h"
 #include "platform/dav/DavPaths.h"
@@ -63,7 +65,19 @@ DavTransaction TesselSession::moveResourceAtPath(const std::string& source,
   std::string from = vtc::davpath::escape(source);
   std::string to = vtc::davpath::escape(destination);
   return connection_->perform("MOVE", source, [&] {
-    return ne_move(connection_->session(), allowingOverwrite ? 1 : 0, from.c_str(), to.c_str());
+    ne_session* session = connection_->session();
+    ne_request* req = ne_request_create(session, "MOVE", from.c_str());
+    // A move takes the source out of its collection as well as adding the
+    // target to another: both parents' locks must be presented (neon's own
+    // MOVE presents only the target's).
+    ne_lock_using_resource(req, from.c_str(), NE_DEPTH_INFINITE);
+    ne_lock_using_parent(req, from.c_str());
+    ne_lock_using_resource(req, to.c_str(), NE_DEPTH_INFINITE);
+    ne_lock_using_parent(req, to.c_str());
+    ne_print_request_header(req, "Destination", "%s://%s%s", ne_get_scheme(session),
+                            ne_get_server_hostport(session), to.c_str());
+    ne_add_request_header(req, "Overwrite", allowingOverwrite ? "T" : "F");
+    return ne_simple_request(session, req);
   });
 }
 
