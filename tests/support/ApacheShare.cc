@@ -18,6 +18,7 @@
 #include <sstream>
 #include <stdexcept>
 #include <thread>
+#include <vector>
 
 namespace vtc::test {
 
@@ -114,9 +115,18 @@ void ApacheShare::writeConfiguration() {
     << "DefaultRuntimeDir " << root_ << "/run\n"
     << "ErrorLog " << root_ << "/logs/error.log\n"
     << "LogLevel warn\n";
-  for (const char* m : {"mpm_event", "authn_core", "authn_file", "authz_core", "authz_user",
-                        "auth_basic", "dav", "dav_fs", "dav_lock", "headers"}) {
+  std::vector<const char*> modules = {"mpm_event",  "authn_core", "authn_file", "authz_core",
+                                      "authz_user", "auth_basic", "dav",        "dav_fs",
+                                      "dav_lock",   "headers"};
+  if (options_.tls) modules.insert(modules.end(), {"socache_shmcb", "ssl"});
+  for (const char* m : modules)
     c << "LoadModule " << m << "_module " << kModules << "/mod_" << m << ".so\n";
+  if (options_.tls) {
+    makeCertificates();
+    c << "SSLEngine on\n"
+      << "SSLCertificateFile " << root_ << "/tls/server.pem\n"
+      << "SSLCertificateKeyFile " << root_ << "/tls/server.key\n"
+      << "SSLSessionCache shmcb:" << root_ << "/run/ssl_scache(512000)\n";
   }
   if (::geteuid() == 0) c << "User www-data\nGroup www-data\n";
   c << "StartServers 1\nServerLimit 1\nThreadsPerChild 16\nMaxRequestWorkers 16\n"
@@ -132,6 +142,24 @@ void ApacheShare::writeConfiguration() {
     << "  AuthUserFile " << root_ << "/htpasswd\n  Require valid-user\n"
     << "</Directory>\n";
   writeFile(root_ + "/httpd.conf", c.str());
+}
+
+// A private authority and a certificate for 127.0.0.1 signed by it.
+void ApacheShare::makeCertificates() {
+  std::string dir = root_ + "/tls";
+  std::filesystem::create_directories(dir);
+  std::string script =
+      "cd '" + dir +
+      "' && "
+      "openssl req -x509 -newkey rsa:2048 -nodes -days 2 -subj '/CN=Share Test Authority' "
+      "-keyout ca.key -out ca.pem && "
+      "openssl req -newkey rsa:2048 -nodes -subj '/CN=127.0.0.1' -keyout server.key "
+      "-out server.csr && "
+      "printf 'subjectAltName=IP:127.0.0.1\\n' > ext.cnf && "
+      "openssl x509 -req -in server.csr -CA ca.pem -CAkey ca.key -CAcreateserial -days 2 "
+      "-extfile ext.cnf -out server.pem";
+  if (std::system((script + " >/dev/null 2>&1").c_str()) != 0)
+    throw std::runtime_error("could not make test certificates");
 }
 
 void ApacheShare::start() {
@@ -188,7 +216,7 @@ std::string ApacheShare::diskPath(const std::string& serverPath) const {
 
 Dictionary ApacheShare::configuration() const {
   return Dictionary{
-      {"host_scheme", Value("http")},
+      {"host_scheme", Value(options_.tls ? "https" : "http")},
       {"host_name", Value("127.0.0.1")},
       {"host_port", Value(port_)},
       {"sync_path", Value(kSyncPath)},

@@ -27,6 +27,9 @@ class ApacheShare {
     std::string user = "alice";
     std::string password = "wonderland";
     std::string respondingServer = "dav-test-1";
+    // Serve HTTPS with a certificate from a private authority; caFile()
+    // then names that authority's certificate.
+    bool tls = false;
   };
 
   ApacheShare();
@@ -42,6 +45,9 @@ class ApacheShare {
   const std::string& documentRoot() const { return documentRoot_; }
   // The disk path of a server path.
   std::string diskPath(const std::string& serverPath) const;
+
+  // The certificate of the authority that signed a TLS share's certificate.
+  std::string caFile() const { return root_ + "/tls/ca.pem"; }
 
   // A session configuration for this share (the keys a session reads).
   Dictionary configuration() const;
@@ -61,6 +67,7 @@ class ApacheShare {
 
  private:
   void writeConfiguration();
+  void makeCertificates();
   void start();
 
   Options options_;
