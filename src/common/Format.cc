@@ -26,10 +26,10 @@ std::string textOf(const std::set<std::string>& set) {
 
 namespace {
 
-std::string printfOne(const std::string& spec, const FormatArg& arg, char conv) {
+std::string printfOne(const std::string& directive, const FormatArg& arg, char conv) {
   char buf[512];
   int n = 0;
-  std::string full = spec;
+  std::string full = directive;
   switch (conv) {
     case 'd':
     case 'i':
@@ -109,7 +109,7 @@ std::string printfOne(const std::string& spec, const FormatArg& arg, char conv) 
         text = std::to_string(*u);
       else if (auto* d = std::get_if<double>(&arg.v))
         text = shortestText(*d);
-      if (spec == "%") return text;
+      if (directive == "%") return text;
       full += 's';
       int len = std::snprintf(nullptr, 0, full.c_str(), text.c_str());
       std::string out(static_cast<size_t>(len > 0 ? len : 0), '\0');
@@ -155,13 +155,13 @@ std::string formatArgs(std::string_view fmt, std::span<const FormatArg> args) {
       continue;
     }
     // flags, width, precision
-    std::string spec = "%";
+    std::string directive = "%";
     size_t j = i + 1;
-    while (j < fmt.size() && std::strchr("-+ #0'", fmt[j])) spec += fmt[j++];
-    while (j < fmt.size() && std::isdigit(static_cast<unsigned char>(fmt[j]))) spec += fmt[j++];
+    while (j < fmt.size() && std::strchr("-+ #0'", fmt[j])) directive += fmt[j++];
+    while (j < fmt.size() && std::isdigit(static_cast<unsigned char>(fmt[j]))) directive += fmt[j++];
     if (j < fmt.size() && fmt[j] == '.') {
-      spec += fmt[j++];
-      while (j < fmt.size() && std::isdigit(static_cast<unsigned char>(fmt[j]))) spec += fmt[j++];
+      directive += fmt[j++];
+      while (j < fmt.size() && std::isdigit(static_cast<unsigned char>(fmt[j]))) directive += fmt[j++];
     }
     // length modifiers are dropped: the argument's own type decides
     while (j < fmt.size() && std::strchr("hlLqjzt", fmt[j])) ++j;
@@ -172,9 +172,9 @@ std::string formatArgs(std::string_view fmt, std::span<const FormatArg> args) {
     char conv = fmt[j];
     if (conv == '@') {
       const FormatArg& a = take();
-      out += printfOne(spec, a, 's');
+      out += printfOne(directive, a, 's');
     } else {
-      out += printfOne(spec, take(), conv);
+      out += printfOne(directive, take(), conv);
     }
     i = j;
   }
