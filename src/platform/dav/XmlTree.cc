@@ -46,6 +46,9 @@ XmlTreeBuilder::XmlTreeBuilder(ne_xml_parser* parser) {
 int XmlTreeBuilder::startElement(void* userdata, int, const char* nspace, const char* name,
                                  const char**) {
   auto* self = static_cast<XmlTreeBuilder*>(userdata);
+  // No answer of ours nests deeply; a server that does is refused rather
+  // than allowed to exhaust the stack of the recursive readers.
+  if (self->stack_.size() >= kMaxDepth) return NE_XML_ABORT;
   auto element = std::make_unique<XmlElement>();
   element->ns = nspace ? nspace : "";
   element->name = name ? name : "";

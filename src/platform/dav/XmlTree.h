@@ -29,6 +29,8 @@ struct XmlElement {
 // before the parser sees the document; root() is valid afterwards.
 class XmlTreeBuilder {
  public:
+  static constexpr size_t kMaxDepth = 64;
+
   explicit XmlTreeBuilder(ne_xml_parser* parser);
   const XmlElement* root() const { return root_.get(); }
 
