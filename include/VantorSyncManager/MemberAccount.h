@@ -38,9 +38,10 @@ class VSM_EXPORT MemberAccount {
   void setApplicationName(std::string name) { applicationName_ = std::move(name); }
 
   // Where the account's share is. There is no built-in service host here, so
-  // the session names the server (and a path under it to check the
-  // credentials on) before the first check.
-  void setServer(std::string scheme, std::string host, int32_t port, std::string checkPath);
+  // the session names the server, a path under it to check the credentials
+  // on, and the read time-out of its requests, before the first check.
+  void setServer(std::string scheme, std::string host, int32_t port, std::string checkPath,
+                 int32_t readTimeout = 0);
 
   // A transaction whose result is a boolean: true when the server accepted
   // the credentials. A refusal (401) is a successful transaction with false.
@@ -69,5 +70,6 @@ class VSM_EXPORT MemberAccount {
   DavTransactionDelegate* delegate_ = nullptr;
   std::string scheme_, host_, checkPath_;
   int32_t port_ = 0;
+  int32_t readTimeout_ = 0;
   std::shared_ptr<vtc::DavConnection> connection_;
 };

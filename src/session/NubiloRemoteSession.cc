@@ -71,8 +71,12 @@ NubiloRemoteSession::NubiloRemoteSession(std::shared_ptr<MemberAccount> account,
   _vantorAccount->setTransactionDelegate(nullptr);
   _vantorAccount->setApplicationName("SyncWorks");
   // There is no built-in service host: the account checks its credentials
-  // on the share that the configuration names.
-  _vantorAccount->setServer(scheme, hostName, port, syncPath);
+  // on the share that the configuration names, at its root, so that the
+  // credentials then go with every request to the share (the trash of a
+  // reset lies outside the sync area) instead of being asked for again.
+  _vantorAccount->setServer(
+      scheme, hostName, port, "/",
+      static_cast<int32_t>(_configuration.get("sync_dav_timeout_seconds").integer()));
   DavTransaction check = _vantorAccount->credentialsAreValid();
 
   _lockDuration = _configuration.get("lock_duration_seconds").integer();

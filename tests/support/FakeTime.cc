@@ -16,7 +16,13 @@ FakeTime::~FakeTime() {
 
 Date FakeTime::now() const {
   std::lock_guard<std::mutex> lock(mutex_);
+  now_ += std::chrono::duration_cast<Date::duration>(step_);
   return now_;
+}
+
+void FakeTime::advanceOnEveryReading(Seconds step) {
+  std::lock_guard<std::mutex> lock(mutex_);
+  step_ = step;
 }
 
 void FakeTime::sleepFor(Seconds duration) {

@@ -17,11 +17,15 @@ class FakeTime final : public Clock, public Sleeper {
   Date now() const override;
   void sleepFor(Seconds duration) override;
   void advance(Seconds duration);
+  // Every later reading of the clock moves it on by this much first, as if
+  // each step of a long loop took that long.
+  void advanceOnEveryReading(Seconds step);
   std::vector<double> sleeps() const;
 
  private:
   mutable std::mutex mutex_;
-  Date now_;
+  mutable Date now_;
+  Seconds step_{0};
   std::vector<double> sleeps_;
 };
 

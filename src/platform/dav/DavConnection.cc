@@ -26,7 +26,7 @@ std::string canonicalHeaderName(const char* name) {
 }  // namespace
 
 DavConnection::DavConnection(DavEndpoint endpoint, std::string user, std::string password,
-                             std::string userAgent)
+                             std::string userAgent, int readTimeout)
     : endpoint_(std::move(endpoint)), user_(std::move(user)), password_(std::move(password)) {
   static const bool initialised = (ne_sock_init(), true);
   (void)initialised;
@@ -35,7 +35,6 @@ DavConnection::DavConnection(DavEndpoint endpoint, std::string user, std::string
   // Our hooks go first, so that they see every answer, including a 401 that
   // the authentication hook then turns into a retry or a failure.
   ne_hook_create_request(session_, onCreateRequest, this);
-  ne_hook_pre_send(session_, onPreSend, this);
   ne_hook_post_send(session_, onPostSend, this);
   // Basic is offered over plain HTTP too: the user chose the scheme.
   ne_add_server_auth(session_, NE_AUTH_BASIC | NE_AUTH_DIGEST, onAuthenticate, this);
@@ -43,6 +42,7 @@ DavConnection::DavConnection(DavEndpoint endpoint, std::string user, std::string
   if (!userAgent.empty()) ne_set_useragent(session_, userAgent.c_str());
   locks_ = ne_lockstore_create();
   ne_lockstore_register(locks_, session_);
+  setReadTimeout(readTimeout);
 }
 
 DavConnection::~DavConnection() {
@@ -51,15 +51,18 @@ DavConnection::~DavConnection() {
 }
 
 void DavConnection::setReadTimeout(int seconds) {
+  if (seconds <= 0 || seconds == readTimeout_) return;
+  readTimeout_ = seconds;
   ne_set_read_timeout(session_, seconds);
   ne_set_connect_timeout(session_, seconds);
+  if (used_) ne_close_connection(session_);
 }
 
 DavTransaction DavConnection::perform(const std::string& method, const std::string& path,
                                       const std::function<int()>& run) {
   capture_ = Capture{};
+  used_ = true;
   int result = run();
-  extraHeaders_.clear();
   DavTransaction t(method, path);
   applyOutcome(t, result, capture_.status, method);
   if (capture_.status != kNoHTTPStatus) t.setResponseHeaders(capture_.headers);
@@ -72,11 +75,6 @@ DavTransaction DavConnection::perform(const std::string& method, const std::stri
 
 void DavConnection::onCreateRequest(ne_request*, void* userdata, const char*, const char*) {
   static_cast<DavConnection*>(userdata)->capture_ = Capture{};
-}
-
-void DavConnection::onPreSend(ne_request*, void* userdata, ne_buffer* header) {
-  auto* self = static_cast<DavConnection*>(userdata);
-  if (!self->extraHeaders_.empty()) ne_buffer_zappend(header, self->extraHeaders_.c_str());
 }
 
 int DavConnection::onPostSend(ne_request* req, void* userdata, const ne_status* status) {

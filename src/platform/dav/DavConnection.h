@@ -27,8 +27,9 @@ struct DavEndpoint {
 
 class DavConnection {
  public:
-  DavConnection(DavEndpoint endpoint, std::string user, std::string password,
-                std::string userAgent);
+  // readTimeout: seconds, 0 for neon's default.
+  DavConnection(DavEndpoint endpoint, std::string user, std::string password, std::string userAgent,
+                int readTimeout = 0);
   ~DavConnection();
   DavConnection(const DavConnection&) = delete;
   DavConnection& operator=(const DavConnection&) = delete;
@@ -37,7 +38,8 @@ class DavConnection {
   ne_session* session() const { return session_; }
   ne_lock_store* lockStore() const { return locks_; }
 
-  // Read and connect time-out in seconds (neon's resolution).
+  // Read and connect time-out in seconds (neon's resolution). neon applies it
+  // when it connects, so a change closes an open connection.
   void setReadTimeout(int seconds);
 
   // Runs `run`, which issues one logical request through session() (neon
@@ -46,10 +48,6 @@ class DavConnection {
   // the final answer, completion state and response headers.
   DavTransaction perform(const std::string& method, const std::string& path,
                          const std::function<int()>& run);
-
-  // Header lines ("Name: value\r\n") sent with every request of the next
-  // perform() only.
-  void setExtraHeaders(std::string headers) { extraHeaders_ = std::move(headers); }
 
   // The status of the last answer seen (kNoHTTPStatus when none).
   int lastStatus() const { return capture_.status; }
@@ -61,7 +59,6 @@ class DavConnection {
   };
   static void onCreateRequest(ne_request* req, void* userdata, const char* method,
                               const char* requri);
-  static void onPreSend(ne_request* req, void* userdata, ne_buffer* header);
   static int onPostSend(ne_request* req, void* userdata, const ne_status* status);
   static int onAuthenticate(void* userdata, const char* realm, int attempt, char* username,
                             char* password);
@@ -72,7 +69,8 @@ class DavConnection {
   ne_session* session_ = nullptr;
   ne_lock_store* locks_ = nullptr;
   Capture capture_;
-  std::string extraHeaders_;
+  int readTimeout_ = 0;
+  bool used_ = false;  // a connection may be open
 };
 
 // Dispatches a request and turns a non-2xx answer into NE_ERROR. The caller

@@ -31,20 +31,22 @@ std::shared_ptr<MemberAccount> MemberAccount::accountFromPreferencesWithApplicat
 }
 
 void MemberAccount::setServer(std::string scheme, std::string host, int32_t port,
-                              std::string checkPath) {
+                              std::string checkPath, int32_t readTimeout) {
   vtc::DavEndpoint wanted{scheme, host, port};
   if (connection_ && !(connection_->endpoint() == wanted)) connection_.reset();
   scheme_ = std::move(scheme);
   host_ = std::move(host);
   port_ = port;
   checkPath_ = checkPath.empty() ? "/" : std::move(checkPath);
+  readTimeout_ = readTimeout;
+  if (connection_) connection_->setReadTimeout(readTimeout);
 }
 
 std::shared_ptr<vtc::DavConnection> MemberAccount::connection() {
   if (host_.empty()) return nullptr;
   if (!connection_) {
-    connection_ = std::make_shared<vtc::DavConnection>(vtc::DavEndpoint{scheme_, host_, port_},
-                                                       name_, password_, applicationID_);
+    connection_ = std::make_shared<vtc::DavConnection>(
+        vtc::DavEndpoint{scheme_, host_, port_}, name_, password_, applicationID_, readTimeout_);
   }
   return connection_;
 }
@@ -54,7 +56,8 @@ std::shared_ptr<vtc::DavConnection> MemberAccount::connectionTo(const std::strin
                                                                 int32_t port) {
   vtc::DavEndpoint wanted{scheme, host, port};
   if (auto own = connection(); own && own->endpoint() == wanted) return own;
-  return std::make_shared<vtc::DavConnection>(wanted, name_, password_, applicationID_);
+  return std::make_shared<vtc::DavConnection>(wanted, name_, password_, applicationID_,
+                                              readTimeout_);
 }
 
 DavTransaction MemberAccount::credentialsAreValid() {

@@ -45,24 +45,52 @@ DavTransaction notHeld(const std::string& method, const std::string& path) {
 DavTransaction TesselSession::_lockResourceAtPath(const std::string& path, double duration,
                                                   const std::string& owner) {
   std::string escaped = vtc::davpath::escape(path);
-  struct ne_lock* lock = ne_lock_create();
-  ne_fill_server_uri(connection_->session(), &lock->uri);
-  lock->uri.path = ne_strdup(escaped.c_str());
-  lock->depth = NE_DEPTH_ZERO;
-  lock->scope = ne_lockscope_exclusive;
-  lock->type = ne_locktype_write;
-  lock->timeout = lockSeconds(duration);  // a lock without a time-out would never expire
-  lock->owner = ne_strdup(owner.c_str());
-  // Without If-Match the server would lock a missing resource into being.
-  connection_->setExtraHeaders("If-Match: *\r\n");
-  DavTransaction t =
-      connection_->perform("LOCK", path, [&] { return ne_lock(connection_->session(), lock); });
+  const long seconds = lockSeconds(duration);  // a lock without a time-out never expires
+  const std::string body =
+      "<?xml version=\"1.0\" encoding=\"utf-8\"?>\n<lockinfo xmlns='DAV:'><lockscope><exclusive/>"
+      "</lockscope><locktype><write/></locktype><owner>" +
+      owner + "</owner></lockinfo>\n";
+  std::string token;
+  DavTransaction t = connection_->perform("LOCK", path, [&] {
+    // Built here rather than by neon's lock call, which marks the request
+    // non-idempotent and so opens a new connection for every lock.
+    ne_request* req = ne_request_create(connection_->session(), "LOCK", escaped.c_str());
+    ne_set_request_body_buffer(req, body.data(), body.size());
+    ne_add_request_header(req, "Content-Type", "application/xml");
+    ne_add_depth_header(req, NE_DEPTH_ZERO);
+    ne_print_request_header(req, "Timeout", "Second-%ld", seconds);
+    // Without it the server would lock a missing resource into being.
+    ne_add_request_header(req, "If-Match", "*");
+    ne_lock_using_parent(req, escaped.c_str());
+    ne_lock_using_resource(req, escaped.c_str(), NE_DEPTH_ZERO);
+    int ret = vtc::dispatchExpectingSuccess(req);
+    if (ret == NE_OK) {
+      const char* header = ne_get_response_header(req, "Lock-Token");
+      token = header ? header : "";
+      if (token.size() > 2 && token.front() == '<' && token.back() == '>')
+        token = token.substr(1, token.size() - 2);
+      if (token.empty()) {
+        ne_set_error(connection_->session(), "LOCK answer without a lock token");
+        ret = NE_ERROR;
+      }
+    }
+    ne_request_destroy(req);
+    return ret;
+  });
   if (t.isSuccessful()) {
     if (struct ne_lock* old = findLock(*connection_, escaped)) forgetLock(*connection_, old);
+    struct ne_lock* lock = ne_lock_create();
+    ne_fill_server_uri(connection_->session(), &lock->uri);
+    lock->uri.path = ne_strdup(escaped.c_str());
+    lock->depth = NE_DEPTH_ZERO;
+    lock->scope = ne_lockscope_exclusive;
+    lock->type = ne_locktype_write;
+    lock->timeout = seconds;
+    lock->token = ne_strdup(token.c_str());
+    lock->owner = ne_strdup(owner.c_str());
     ne_lockstore_add(connection_->lockStore(), lock);
-  } else {
-    ne_lock_destroy(lock);
-    if (t.httpStatusCode() == 412) t.setOutcome(false, 104, 404, t.transactionState());
+  } else if (t.httpStatusCode() == 412) {
+    t.setOutcome(false, 104, 404, t.transactionState());
   }
   return t;
 }
