@@ -31,4 +31,8 @@ std::string configurationURL(const std::string& host, const std::optional<std::s
 // verifies with the built-in key.
 std::optional<Dictionary> verifiedConfiguration(const Bytes& signedDocument);
 
+// Verifies with this DER public key instead of the built-in one; nothing
+// restores the built-in key (tests only).
+void setVerificationKeyForTesting(std::optional<Bytes> key);
+
 }  // namespace vtc::config

@@ -1,9 +1,37 @@
+// The signed layer of the configuration: split, verified with the built-in
+// key (or one a test installs), parsed.
+#include <mutex>
+
+#include "VantorSyncManager/NubiloDataAdditions.h"
+#include "VantorSyncManager/NubiloSignedDocument.h"
 #include "prefs/ClientConfiguration.h"
+#include "prefs/ConfigurationKey.h"
 
 namespace vtc::config {
 
-std::optional<Dictionary> verifiedConfiguration(const Bytes&) {
-  return std::nullopt;
+namespace {
+std::mutex gKeyMutex;
+std::optional<Bytes> gKeyOverride;
+}  // namespace
+
+void setVerificationKeyForTesting(std::optional<Bytes> key) {
+  std::lock_guard<std::mutex> lock(gKeyMutex);
+  gKeyOverride = std::move(key);
+}
+
+std::optional<Dictionary> verifiedConfiguration(const Bytes& signedDocument) {
+  Bytes payload = signedDocument;
+  std::optional<Bytes> signature = NubiloStripSignature(payload);
+  if (!signature) return std::nullopt;
+  Bytes key(kConfigurationKey, kConfigurationKey + kConfigurationKeyLength);
+  {
+    std::lock_guard<std::mutex> lock(gKeyMutex);
+    if (gKeyOverride) key = *gKeyOverride;
+  }
+  if (!NubiloVerifySignature(payload, *signature, key.data(), key.size())) return std::nullopt;
+  std::optional<Value> parsed = NubiloDictionaryWithData(payload);
+  if (!parsed || !parsed->isDictionary()) return std::nullopt;
+  return parsed->dictionary();
 }
 
 }  // namespace vtc::config

@@ -1,9 +1,13 @@
 #include "prefs/SyncEngineSettings.h"
 
+#include "VantorSyncManager/NubiloDataAdditions.h"
+
+#include "VantorSyncManager/NubiloDataAdditions.h"
+
 namespace vtc {
 
 std::string strippedClientName(const std::string& name) {
-  return name;
+  return NubiloStringByStrippingControlCharacters(name);
 }
 
 std::optional<Date> engineLastSuccessfulSyncDate() {

@@ -118,7 +118,7 @@ TEST_F(Registry, ClientsRegisterAndABrokenRecordIsCleanedUp) {
   auto a = open("GUID-A");
   auto b = open("GUID-B");
   auto c = open("GUID-C");
-  EXPECT_TRUE(a->registerClient("GUID-A", "Alice's Mac"));
+  EXPECT_TRUE(a->registerClient("GUID-A", "Alice's \x07Mac"));
   EXPECT_TRUE(b->registerClient("GUID-B", "Bob's Mac"));
   EXPECT_TRUE(c->registerClient("GUID-C", "Carol's Mac"));
   EXPECT_THROW(a->registerClient("GUID-A", "again"), NubiloException);

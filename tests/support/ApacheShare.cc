@@ -140,6 +140,10 @@ void ApacheShare::writeConfiguration() {
     << "  Dav On\n  AllowOverride None\n  Options None\n"
     << "  AuthType Basic\n  AuthName \"Tessel\"\n  AuthBasicProvider file\n"
     << "  AuthUserFile " << root_ << "/htpasswd\n  Require valid-user\n"
+    << "</Directory>\n"
+    // Configuration documents are public, as on a configuration server.
+    << "<Directory " << documentRoot_ << "/configurations>\n"
+    << "  Dav Off\n  Require all granted\n"
     << "</Directory>\n";
   writeFile(root_ + "/httpd.conf", c.str());
 }

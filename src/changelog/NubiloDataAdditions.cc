@@ -1,0 +1,136 @@
+#include "VantorSyncManager/NubiloDataAdditions.h"
+
+#include <zlib.h>
+
+#include <algorithm>
+#include <iterator>
+
+#include "VantorSyncManager/NubiloException.h"
+#include "VantorSyncManager/PublicNames.h"
+#include "common/Format.h"
+#include "platform/plist/PlistCodec.h"
+
+namespace {
+
+constexpr size_t kStep = 4096;
+constexpr uint8_t kGzipHeader[10] = {0x1F, 0x8B, 0x08, 0x00, 0x00, 0x00, 0x00, 0x00, 0x00, 0x03};
+
+struct CodePointRange {
+  char32_t first, last;
+};
+constexpr CodePointRange kControlCharacters[] = {
+#include "changelog/ControlCharacterTable.inc"
+};
+
+bool isControlCharacter(char32_t c) {
+  auto it = std::upper_bound(std::begin(kControlCharacters), std::end(kControlCharacters), c,
+                             [](char32_t v, const CodePointRange& r) { return v < r.first; });
+  return it != std::begin(kControlCharacters) && c <= std::prev(it)->last;
+}
+
+// The code point starting at s[i] and its length in bytes; a malformed
+// sequence is one byte long and never a control character.
+std::pair<char32_t, size_t> decode(std::string_view s, size_t i) {
+  auto b = [&](size_t k) { return static_cast<unsigned char>(s[i + k]); };
+  unsigned char c = b(0);
+  size_t len = c < 0x80 ? 1 : (c >> 5) == 0x6 ? 2 : (c >> 4) == 0xE ? 3 : (c >> 3) == 0x1E ? 4 : 0;
+  if (len == 0 || i + len > s.size()) return {0xFFFD, 1};
+  if (len == 1) return {c, 1};
+  char32_t cp = c & (0x7F >> len);
+  for (size_t k = 1; k < len; ++k) {
+    if ((b(k) & 0xC0) != 0x80) return {0xFFFD, 1};
+    cp = (cp << 6) | (b(k) & 0x3F);
+  }
+  return {cp, len};
+}
+
+}  // namespace
+
+uint32_t NubiloUInt32AtOffset(vtc::ByteView data, uint32_t offset) {
+  if (data.size() < static_cast<uint64_t>(offset) + 4) {
+    throw NubiloException(
+        NubiloCorruptChangelogException,
+        vtc::format("Attempting to parse value beyond bounds of changelog data length:%d offset:%d",
+                    data.size(), offset));
+  }
+  const uint8_t* p = data.data() + offset;
+  return (uint32_t{p[0]} << 24) | (uint32_t{p[1]} << 16) | (uint32_t{p[2]} << 8) | p[3];
+}
+
+void NubiloAppendUInt32(vtc::Bytes& data, uint32_t value) {
+  const uint8_t bytes[4] = {static_cast<uint8_t>(value >> 24), static_cast<uint8_t>(value >> 16),
+                            static_cast<uint8_t>(value >> 8), static_cast<uint8_t>(value)};
+  data.insert(data.end(), bytes, bytes + 4);
+}
+
+void NubiloAppendString(vtc::Bytes& data, std::string_view string) {
+  data.insert(data.end(), string.begin(), string.end());
+  data.push_back(0);
+}
+
+std::optional<vtc::Bytes> NubiloGzip(vtc::ByteView data) {
+  vtc::Bytes out(kGzipHeader, kGzipHeader + sizeof kGzipHeader);
+  z_stream z{};
+  if (deflateInit2(&z, Z_DEFAULT_COMPRESSION, Z_DEFLATED, -15, 8, Z_DEFAULT_STRATEGY) != Z_OK)
+    return std::nullopt;
+  z.next_in = const_cast<Bytef*>(data.data());
+  z.avail_in = static_cast<uInt>(data.size());
+  int ret;
+  do {
+    size_t used = out.size();
+    out.resize(used + kStep);
+    z.next_out = out.data() + used;
+    z.avail_out = kStep;
+    ret = deflate(&z, Z_FINISH);
+    out.resize(used + kStep - z.avail_out);
+    if (ret < 0) {
+      deflateEnd(&z);
+      return std::nullopt;
+    }
+  } while (ret == Z_OK);
+  if (deflateEnd(&z) != Z_OK) return std::nullopt;
+  return out;
+}
+
+std::optional<vtc::Bytes> NubiloCopyGunzip(vtc::ByteView data) {
+  if (data.size() <= 9) return std::nullopt;
+  z_stream z{};
+  if (inflateInit2(&z, -15) != Z_OK) return std::nullopt;
+  z.next_in = const_cast<Bytef*>(data.data() + 10);
+  z.avail_in = static_cast<uInt>(data.size() - 10);
+  vtc::Bytes out;
+  int ret;
+  do {
+    size_t used = out.size();
+    out.resize(used + kStep);
+    z.next_out = out.data() + used;
+    z.avail_out = kStep;
+    ret = inflate(&z, Z_SYNC_FLUSH);
+    out.resize(used + kStep - z.avail_out);
+    if (ret < 0) {
+      inflateEnd(&z);
+      return std::nullopt;
+    }
+  } while (ret == Z_OK);
+  if (inflateEnd(&z) != Z_OK) return std::nullopt;
+  return out;
+}
+
+std::optional<vtc::Bytes> NubiloGunzip(vtc::ByteView data) {
+  return NubiloCopyGunzip(data);
+}
+
+std::optional<vtc::Value> NubiloDictionaryWithData(vtc::ByteView data) {
+  return vtc::plist::parse(data);
+}
+
+std::string NubiloStringByStrippingControlCharacters(std::string_view string) {
+  std::string out;
+  out.reserve(string.size());
+  for (size_t i = 0; i < string.size();) {
+    auto [cp, len] = decode(string, i);
+    if (!isControlCharacter(cp)) out.append(string.substr(i, len));
+    i += len;
+  }
+  return out;
+}
