@@ -107,6 +107,21 @@ TEST_F(Faults, ALockRefusedThenCutOffRaisesANetworkFailureAfterOnePause) {
   EXPECT_EQ(TraceCapture::field(traces.withDomain(kRetry).back(), "COM_KORVO_MESSAGE_VALUE"), "1");
 }
 
+TEST_F(Faults, AnUnlockIsTriedTwiceAndItsPathKeptWhenBothFail) {
+  const std::string target = schemas() + "/Contacts/";
+  session->tesselSession().makeCollectionAtPath(schemas() + "/Contacts", false);
+  session->lockDataclass("Contacts");
+  proxy.answer({"UNLOCK", target, 0}, 500);
+  session->unlockDataclass("Contacts");
+  EXPECT_EQ(seen("UNLOCK", target), 2u);
+  EXPECT_EQ(session->lockedResources().count(target), 1u);
+  EXPECT_TRUE(time.sleeps().empty());
+  proxy.clear();
+  session.reset();  // the release tries once more, and gets through
+  EXPECT_EQ(seen("UNLOCK", target), 3u);
+  EXPECT_EQ(proxy.requests().back().action, "forwarded");
+}
+
 TEST_F(Faults, ARefusedMoveMakesTheResetDeleteChangelogByChangelogRenewingItsLocks) {
   std::string dc = "Contacts";
   session->getDataclassInfo(dc);
