@@ -1,0 +1,26 @@
+// Constants and small pieces shared by the changelog reader, writer and
+// crash flags.
+#pragma once
+
+#include <cstdint>
+#include <string>
+
+#include "VantorSyncManager/Value.h"
+
+namespace vtc::clog {
+
+inline constexpr uint32_t kFormatNumber = 101;
+inline constexpr uint32_t kIndexEnd = 0xFFFFFFFF;
+inline constexpr const char* kHeaderEnd = "HeaderEnd=$%__END__OF__HEADER%$";
+inline constexpr const char* kClientType = "Vantor Client";
+// The version of the embedded sync engine that writes changes.
+inline constexpr const char* kEngineVersion = "1.0";
+
+// 64-bit FNV-1a of the bytes: the same in every process and release, so a
+// crash flag written by one process is found by the next.
+uint64_t stableHash(ByteView bytes);
+
+// "~/.local/share/NubiloSyncClient/<hash>.cflag"
+std::string crashFlagPath(uint64_t hash);
+
+}  // namespace vtc::clog

@@ -1,0 +1,159 @@
+// The changelog reader. The compressed body is inflated in steps and parsed
+// record by record, so memory follows the decoded records, not the body.
+#include <zlib.h>
+
+#include <cstring>
+
+#include "VantorSyncManager/NubiloChangeLog.h"
+#include "VantorSyncManager/NubiloDataAdditions.h"
+#include "VantorSyncManager/NubiloException.h"
+#include "VantorSyncManager/PublicNames.h"
+#include "changelog/ChangeLogFormat.h"
+#include "common/Logging.h"
+#include "platform/plist/PlistCodec.h"
+
+namespace {
+
+[[noreturn]] void corrupt(const std::string& reason) {
+  throw NubiloException(NubiloCorruptChangelogException, reason);
+}
+
+// The zero-terminated string at offset, bounded by the end of data.
+std::string cString(vtc::ByteView data, size_t offset) {
+  if (offset >= data.size()) corrupt("string beyond the end of changelog data");
+  const uint8_t* start = data.data() + offset;
+  const void* zero = std::memchr(start, 0, data.size() - offset);
+  if (!zero) corrupt("unterminated string in changelog data");
+  return std::string(reinterpret_cast<const char*>(start),
+                     static_cast<const uint8_t*>(zero) - start);
+}
+
+// The decompressed body as a stream: the reduced gzip envelope's first ten
+// bytes are skipped, the raw deflate stream inflated on demand.
+class BodyStream {
+ public:
+  explicit BodyStream(vtc::ByteView compressed) {
+    if (compressed.size() <= 9 || inflateInit2(&z_, -15) != Z_OK)
+      corrupt("Failed to unzip changes from clog");
+    open_ = true;
+    z_.next_in = const_cast<Bytef*>(compressed.data() + 10);
+    z_.avail_in = static_cast<uInt>(compressed.size() - 10);
+  }
+  ~BodyStream() {
+    if (open_) inflateEnd(&z_);
+  }
+
+  // Makes at least n unread bytes available; false when the body ends first.
+  bool fill(size_t n) {
+    if (cursor_ > (1 << 20) && cursor_ * 2 > buffer_.size()) {  // drop what was read
+      buffer_.erase(buffer_.begin(), buffer_.begin() + static_cast<std::ptrdiff_t>(cursor_));
+      cursor_ = 0;
+    }
+    while (buffer_.size() - cursor_ < n && !ended_) {
+      size_t used = buffer_.size();
+      size_t step = std::max<size_t>(64 * 1024, n);
+      buffer_.resize(used + step);
+      z_.next_out = buffer_.data() + used;
+      z_.avail_out = static_cast<uInt>(step);
+      int ret = inflate(&z_, Z_SYNC_FLUSH);
+      buffer_.resize(used + step - z_.avail_out);
+      if (ret < 0) corrupt("Failed to unzip changes from clog");
+      if (ret != Z_OK) ended_ = true;
+    }
+    return buffer_.size() - cursor_ >= n;
+  }
+
+  std::string readCString() {
+    for (size_t have = 1;; have = buffer_.size() - cursor_ + 1) {
+      if (!fill(have)) corrupt("unterminated record identifier in changelog body");
+      const uint8_t* start = buffer_.data() + cursor_;
+      if (const void* zero = std::memchr(start, 0, buffer_.size() - cursor_)) {
+        size_t len = static_cast<const uint8_t*>(zero) - start;
+        std::string s(reinterpret_cast<const char*>(start), len);
+        cursor_ += len + 1;
+        return s;
+      }
+    }
+  }
+
+  uint32_t readUInt32() {
+    fill(4);
+    uint32_t v = NubiloUInt32AtOffset(vtc::ByteView(buffer_).subspan(cursor_), 0);
+    cursor_ += 4;
+    return v;
+  }
+
+  vtc::ByteView read(size_t n) {
+    if (!fill(n)) corrupt("record archive beyond the end of changelog data");
+    vtc::ByteView out(buffer_.data() + cursor_, n);
+    cursor_ += n;
+    return out;
+  }
+
+ private:
+  z_stream z_{};
+  bool open_ = false;
+  bool ended_ = false;
+  vtc::Bytes buffer_;
+  size_t cursor_ = 0;
+};
+
+std::string failureText(const std::exception& e) {
+  if (auto* n = dynamic_cast<const NubiloException*>(&e)) return n->reason();
+  return e.what();
+}
+
+}  // namespace
+
+void NubiloChangeLog::parseData(vtc::ByteView data) {
+  if (data.empty()) {
+    VTC_LOG_ERROR(
+        "Attempting to initialize ChangeLog with no Data, initializing with no changes "
+        "instead");
+    _changes.clear();
+    clearCrashFlagForHash(0);
+    return;
+  }
+  const uint64_t hash = vtc::clog::stableHash(data);
+  try {
+    setCrashFlagForHash(hash);
+    _version = NubiloUInt32AtOffset(data, 0);
+    const uint32_t headerStart = NubiloUInt32AtOffset(data, 4);
+    const uint32_t bodyStart = NubiloUInt32AtOffset(data, 8);
+    const uint32_t count = headerStart / 4 - 3;  // unsigned, as written
+
+    _headers = vtc::Dictionary{};
+    for (size_t at = headerStart;;) {
+      std::string line = cString(data, at);
+      if (line == vtc::clog::kHeaderEnd) break;
+      size_t eq = line.find('=');
+      if (eq == std::string::npos) corrupt("header line without \"=\": " + line);
+      size_t second = line.find('=', eq + 1);  // text after a second "=" is dropped
+      _headers->set(line.substr(0, eq), vtc::Value(line.substr(eq + 1, second - eq - 1)));
+      at += line.size() + 1;
+    }
+
+    _changes.clear();
+    if (count > 0) {
+      if (bodyStart > data.size()) corrupt("body beyond the end of changelog data");
+      BodyStream body(data.subspan(bodyStart));
+      _changes.reserve(std::min<size_t>(count, data.size()));
+      for (uint32_t i = 0; i < count; ++i) {
+        std::string identifier = body.readCString();
+        uint32_t type = body.readUInt32();
+        uint32_t length = body.readUInt32();
+        std::optional<vtc::Value> archived = vtc::plist::parse(body.read(length));
+        if (!archived || !archived->isArray()) corrupt("record archive is not a list of changes");
+        _changes.emplace_back(type, std::move(identifier), std::move(archived->mutableArray()));
+      }
+    }
+  } catch (const std::exception& e) {
+    clearCrashFlagForHash(hash);
+    VTC_LOG_ERROR("Exception caught while trying to process changelog %@ \n Headers:%@",
+                  failureText(e), _headers.value_or(vtc::Dictionary{}));
+    throw NubiloException(
+        NubiloCorruptChangelogException,
+        vtc::format("Exception trying to decode changelog %@, Headers:", failureText(e)));
+  }
+  clearCrashFlagForHash(hash);
+}
