@@ -1,0 +1,31 @@
+// nubilo-clog: looks inside changelog files.
+//   nubilo-clog dump FILE     the text dump, with its summary line
+//   nubilo-clog verify FILE   exit 0 for a readable changelog, 1 and the reason otherwise
+#include <cstdio>
+#include <cstring>
+#include <exception>
+
+#include "VantorSyncManager/VantorSyncManager.h"
+
+int main(int argc, char** argv) {
+  if (argc != 3 || (std::strcmp(argv[1], "dump") != 0 && std::strcmp(argv[1], "verify") != 0)) {
+    std::fprintf(stderr, "usage: nubilo-clog dump FILE\n       nubilo-clog verify FILE\n");
+    return 2;
+  }
+  try {
+    auto log = NubiloChangeLog::changeLogWithContentsOfFile(argv[2]);
+    if (std::strcmp(argv[1], "dump") == 0) {
+      std::fflush(stdout);
+      log->dumpToTextFile("/dev/stdout", true);
+    } else {
+      std::printf("%s: readable changelog, format %u, %zu changes\n", argv[2], log->version(),
+                  log->changes().size());
+    }
+    return 0;
+  } catch (const NubiloException& e) {
+    std::fprintf(stderr, "%s: %s\n", argv[2], e.reason().c_str());
+  } catch (const std::exception& e) {
+    std::fprintf(stderr, "%s: %s\n", argv[2], e.what());
+  }
+  return 1;
+}
