@@ -35,8 +35,10 @@ std::optional<std::string> releaseField(const std::string& key) {
 std::optional<std::string> productVersion() {
   return releaseField("VERSION_ID");
 }
+// Releases without a build identifier (Debian's) are named by their codename.
 std::optional<std::string> buildVersion() {
-  return releaseField("BUILD_ID");
+  if (auto build = releaseField("BUILD_ID")) return build;
+  return releaseField("VERSION_CODENAME");
 }
 
 void setReleaseFileForTesting(std::string path) {

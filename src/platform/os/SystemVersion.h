@@ -1,5 +1,5 @@
 // The operating system's version, from /etc/os-release (VERSION_ID and
-// BUILD_ID).
+// BUILD_ID, or VERSION_CODENAME where a release has no build identifier).
 #pragma once
 
 #include <optional>
