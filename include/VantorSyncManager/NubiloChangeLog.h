@@ -56,6 +56,9 @@ class VSM_EXPORT NubiloChangeLog {
   void clearCrashFlagForHash(uint64_t hash);
 
  protected:
+  // Told as the reader moves past input bytes that it will not read again.
+  virtual void inputConsumed(const uint8_t* begin, const uint8_t* end);
+
   std::vector<SyncEngineChange> _changes;
   uint32_t _version = 0;
   std::optional<vtc::Dictionary> _headers;
@@ -84,6 +87,11 @@ class VSM_EXPORT NubiloMappedChangelog : public NubiloChangeLog {
   // The lazy decode; a failure leaves the changelog undecoded.
   void parseData();
   bool isDecoded() const { return !_mappedData; }
+
+ protected:
+  // Gives consumed pages of the mapping back, so that reading a large file
+  // does not keep all of it resident.
+  void inputConsumed(const uint8_t* begin, const uint8_t* end) override;
 
  private:
   struct Mapping;

@@ -26,7 +26,8 @@ class VSM_EXPORT VTCConfiguration {
   int32_t defaultSyncInterval() { return 900; }
   bool isValid() { return true; }
 
- private:
+ protected:
+  // Kept for the layout older callers know; nothing reads them.
   int32_t _configVersion = 0;
   bool _validConfig = false;
   std::optional<vtc::Dictionary> _properties;

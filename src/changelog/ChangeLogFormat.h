@@ -19,6 +19,9 @@ inline constexpr const char* kEngineVersion = "1.0";
 // 64-bit FNV-1a of the bytes: the same in every process and release, so a
 // crash flag written by one process is found by the next.
 uint64_t stableHash(ByteView bytes);
+// The same hash carried on over more bytes.
+uint64_t stableHash(ByteView bytes, uint64_t carried);
+inline constexpr uint64_t kHashSeed = 14695981039346656037ull;
 
 // "~/.local/share/NubiloSyncClient/<hash>.cflag"
 std::string crashFlagPath(uint64_t hash);

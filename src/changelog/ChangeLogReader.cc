@@ -3,6 +3,7 @@
 #include <zlib.h>
 
 #include <cstring>
+#include <functional>
 
 #include "VantorSyncManager/NubiloChangeLog.h"
 #include "VantorSyncManager/NubiloDataAdditions.h"
@@ -32,7 +33,8 @@ std::string cString(vtc::ByteView data, size_t offset) {
 // bytes are skipped, the raw deflate stream inflated on demand.
 class BodyStream {
  public:
-  explicit BodyStream(vtc::ByteView compressed) {
+  using Consumed = std::function<void(const uint8_t*, const uint8_t*)>;
+  BodyStream(vtc::ByteView compressed, Consumed consumed) : consumed_(std::move(consumed)) {
     if (compressed.size() <= 9 || inflateInit2(&z_, -15) != Z_OK)
       corrupt("Failed to unzip changes from clog");
     open_ = true;
@@ -55,8 +57,10 @@ class BodyStream {
       buffer_.resize(used + step);
       z_.next_out = buffer_.data() + used;
       z_.avail_out = static_cast<uInt>(step);
+      const uint8_t* before = z_.next_in;
       int ret = inflate(&z_, Z_SYNC_FLUSH);
       buffer_.resize(used + step - z_.avail_out);
+      consumed_(before, z_.next_in);
       if (ret < 0) corrupt("Failed to unzip changes from clog");
       if (ret != Z_OK) ended_ = true;
     }
@@ -91,6 +95,7 @@ class BodyStream {
   }
 
  private:
+  Consumed consumed_;
   z_stream z_{};
   bool open_ = false;
   bool ended_ = false;
@@ -105,6 +110,8 @@ std::string failureText(const std::exception& e) {
 
 }  // namespace
 
+void NubiloChangeLog::inputConsumed(const uint8_t*, const uint8_t*) {}
+
 void NubiloChangeLog::parseData(vtc::ByteView data) {
   if (data.empty()) {
     VTC_LOG_ERROR(
@@ -114,7 +121,14 @@ void NubiloChangeLog::parseData(vtc::ByteView data) {
     clearCrashFlagForHash(0);
     return;
   }
-  const uint64_t hash = vtc::clog::stableHash(data);
+  // Hashed in steps, each step's input handed back when done with.
+  uint64_t hash = vtc::clog::kHashSeed;
+  constexpr size_t kHashStep = 8 << 20;
+  for (size_t at = 0; at < data.size(); at += kHashStep) {
+    vtc::ByteView step = data.subspan(at, std::min(kHashStep, data.size() - at));
+    hash = vtc::clog::stableHash(step, hash);
+    inputConsumed(step.data(), step.data() + step.size());
+  }
   try {
     setCrashFlagForHash(hash);
     _version = NubiloUInt32AtOffset(data, 0);
@@ -136,7 +150,8 @@ void NubiloChangeLog::parseData(vtc::ByteView data) {
     _changes.clear();
     if (count > 0) {
       if (bodyStart > data.size()) corrupt("body beyond the end of changelog data");
-      BodyStream body(data.subspan(bodyStart));
+      BodyStream body(data.subspan(bodyStart),
+                      [this](const uint8_t* b, const uint8_t* e) { inputConsumed(b, e); });
       _changes.reserve(std::min<size_t>(count, data.size()));
       for (uint32_t i = 0; i < count; ++i) {
         std::string identifier = body.readCString();

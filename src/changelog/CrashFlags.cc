@@ -14,8 +14,10 @@
 
 namespace vtc::clog {
 
-uint64_t stableHash(ByteView bytes) {
-  uint64_t h = 14695981039346656037ull;
+uint64_t stableHash(ByteView bytes) { return stableHash(bytes, kHashSeed); }
+
+uint64_t stableHash(ByteView bytes, uint64_t carried) {
+  uint64_t h = carried;
   for (uint8_t b : bytes) {
     h ^= b;
     h *= 1099511628211ull;

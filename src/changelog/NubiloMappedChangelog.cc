@@ -99,6 +99,15 @@ void NubiloMappedChangelog::parseData() {
   release();
 }
 
+void NubiloMappedChangelog::inputConsumed(const uint8_t* begin, const uint8_t* end) {
+  if (!_mappedData || _mappedData->address == MAP_FAILED) return;  // only mapped pages
+  const auto page = static_cast<uintptr_t>(::sysconf(_SC_PAGESIZE));
+  auto first = (reinterpret_cast<uintptr_t>(begin) + page - 1) & ~(page - 1);
+  auto last = reinterpret_cast<uintptr_t>(end) & ~(page - 1);
+  // Clean private pages of a file: dropping them only costs a re-read.
+  if (last > first) ::madvise(reinterpret_cast<void*>(first), last - first, MADV_DONTNEED);
+}
+
 void NubiloMappedChangelog::dumpToTextFile(const std::string& path, bool includingSummary) {
   parseData();
   NubiloChangeLog::dumpToTextFile(path, includingSummary);
