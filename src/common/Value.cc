@@ -1,5 +1,6 @@
 #include "VantorSyncManager/Value.h"
 
+#include <algorithm>
 #include <cctype>
 #include <cmath>
 #include <cstdio>
@@ -15,6 +16,10 @@ const Bytes kEmptyBytes;
 const Array kEmptyArray;
 const Dictionary kEmptyDictionary;
 const Value kNoneValue;
+
+// Small dictionaries (most of them: property changes, records) are searched
+// in place; an index is kept only past kIndexedSize entries.
+constexpr size_t kIndexedSize = 16;
 
 // Leading integer of a string, as a property-list reader reads "42abc".
 int64_t leadingInteger(const std::string& s) {
@@ -271,13 +276,17 @@ Dictionary::Dictionary(std::initializer_list<Entry> entries) {
 }
 
 const Value* Dictionary::find(std::string_view key) const {
+  if (entries_.size() <= kIndexedSize) {
+    for (const auto& e : entries_)
+      if (e.first == key) return &e.second;
+    return nullptr;
+  }
   auto it = index_.find(key);
   return it == index_.end() ? nullptr : &entries_[it->second].second;
 }
 
 Value* Dictionary::find(std::string_view key) {
-  auto it = index_.find(key);
-  return it == index_.end() ? nullptr : &entries_[it->second].second;
+  return const_cast<Value*>(static_cast<const Dictionary*>(this)->find(key));
 }
 
 const Value& Dictionary::get(std::string_view key) const {
@@ -290,14 +299,20 @@ void Dictionary::set(std::string key, Value value) {
     *existing = std::move(value);
     return;
   }
-  index_.emplace(key, entries_.size());
   entries_.emplace_back(std::move(key), std::move(value));
+  if (entries_.size() > kIndexedSize) {
+    if (index_.empty())
+      reindex();
+    else
+      index_.emplace(entries_.back().first, entries_.size() - 1);
+  }
 }
 
 bool Dictionary::erase(std::string_view key) {
-  auto it = index_.find(key);
-  if (it == index_.end()) return false;
-  entries_.erase(entries_.begin() + static_cast<std::ptrdiff_t>(it->second));
+  auto at = std::find_if(entries_.begin(), entries_.end(),
+                         [&](const Entry& e) { return e.first == key; });
+  if (at == entries_.end()) return false;
+  entries_.erase(at);
   reindex();
   return true;
 }
@@ -324,6 +339,7 @@ std::string Dictionary::description() const {
 
 void Dictionary::reindex() {
   index_.clear();
+  if (entries_.size() <= kIndexedSize) return;
   for (size_t i = 0; i < entries_.size(); ++i) index_.emplace(entries_[i].first, i);
 }
 
