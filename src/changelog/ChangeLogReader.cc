@@ -53,7 +53,9 @@ class BodyStream {
     }
     while (buffer_.size() - cursor_ < n && !ended_) {
       size_t used = buffer_.size();
-      size_t step = std::max<size_t>(64 * 1024, n);
+      // Grown in bounded steps: a length read from a damaged file must not
+      // allocate more than the body really inflates to.
+      size_t step = std::clamp<size_t>(n - (buffer_.size() - cursor_), 64 * 1024, 16 << 20);
       buffer_.resize(used + step);
       z_.next_out = buffer_.data() + used;
       z_.avail_out = static_cast<uInt>(step);

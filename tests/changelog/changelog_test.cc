@@ -141,6 +141,23 @@ TEST_F(ChangeLog, DamagedFilesAreRefusedAsCorrupt) {
   EXPECT_EQ(NubiloChangeLog(otherVersion).version(), 102u);
 }
 
+// Inputs the fuzzer found: each once crashed the reader or ran it out of
+// memory, and must now be refused as corrupt.
+TEST_F(ChangeLog, InputsThatOnceBrokeTheReaderAreRefused) {
+  size_t files = 0;
+  for (const auto& entry :
+       std::filesystem::directory_iterator(std::string(VSM_TEST_DATA) + "/changelog/data")) {
+    ++files;
+    try {
+      auto log = NubiloChangeLog::changeLogWithContentsOfFile(entry.path());
+      ADD_FAILURE() << entry.path() << " was read";
+    } catch (const NubiloException& e) {
+      EXPECT_EQ(e.name(), NubiloCorruptChangelogException) << entry.path();
+    }
+  }
+  EXPECT_GE(files, 2u);
+}
+
 TEST_F(ChangeLog, LargeChangelogsAreMappedAndDecodedOnlyWhenLookedAt) {
   Bytes bytes = written(*std::make_unique<NubiloChangeLog>(sampleChanges()));
   auto small = NubiloChangeLog::createChangeLogWithData(bytes, bytes.size() + 1);
