@@ -51,7 +51,7 @@ void NubiloChangeLog::writeToData(vtc::Bytes& output) {
     putUInt32At(output, 8 + 4 * i, static_cast<uint32_t>(bodyStart + body.size()));
     NubiloAppendString(body, change.recordIdentifier());
     NubiloAppendUInt32(body, change.type());
-    vtc::Bytes archived = vtc::plist::toBinary(vtc::Value(change.changes()));
+    vtc::Bytes archived = vtc::plist::toBinary(change.changes());
     NubiloAppendUInt32(body, static_cast<uint32_t>(archived.size()));
     body.insert(body.end(), archived.begin(), archived.end());
   }

@@ -204,8 +204,10 @@ std::string toXml(const Value& value) {
   return out;
 }
 
-Bytes toBinary(const Value& value) {
-  PlistPtr root(toPlist(value));
+namespace {
+
+Bytes binaryOf(::plist_t node) {
+  PlistPtr root(node);
   if (!root) return {};
   char* bin = nullptr;
   uint32_t len = 0;
@@ -213,6 +215,19 @@ Bytes toBinary(const Value& value) {
   Bytes out(reinterpret_cast<uint8_t*>(bin), reinterpret_cast<uint8_t*>(bin) + len);
   std::free(bin);
   return out;
+}
+
+}  // namespace
+
+Bytes toBinary(const Array& array) {
+  ::plist_t node = plist_new_array();
+  for (const Value& item : array)
+    if (::plist_t child = toPlist(item)) plist_array_append_item(node, child);
+  return binaryOf(node);
+}
+
+Bytes toBinary(const Value& value) {
+  return binaryOf(toPlist(value));
 }
 
 std::optional<Value> readFile(const std::string& path) {

@@ -23,6 +23,8 @@ std::optional<Value> parse(ByteView bytes);
 
 std::string toXml(const Value& value);
 Bytes toBinary(const Value& value);
+// The same for an array, without wrapping (and copying) it into a Value.
+Bytes toBinary(const Array& array);
 
 // nullopt when the file is absent or is not a property list.
 std::optional<Value> readFile(const std::string& path);
