@@ -1,8 +1,9 @@
 #include "prefs/SyncEngineSettings.h"
 
 #include "VantorSyncManager/NubiloDataAdditions.h"
-
-#include "VantorSyncManager/NubiloDataAdditions.h"
+#include "VantorSyncManager/PublicNames.h"
+#include "common/Logging.h"
+#include "platform/engine/SyncEngine.h"
 
 namespace vtc {
 
@@ -11,11 +12,25 @@ std::string strippedClientName(const std::string& name) {
 }
 
 std::optional<Date> engineLastSuccessfulSyncDate() {
-  return std::nullopt;
+  Value date = engine::SyncEngine::open()->objectForKey(kVantorSyncClientId, "lastSuccessSync");
+  if (date.kind() != Value::Kind::Date) return std::nullopt;
+  return date.date();
 }
 
-void removeEngineLastSuccessfulSyncDate() {}
+void removeEngineLastSuccessfulSyncDate() {
+  engine::SyncEngine::open()->setObjectForKey(kVantorSyncClientId, "lastSuccessSync", Value());
+}
 
-void setSyncsAfterOtherClients(bool) {}
+void setSyncsAfterOtherClients(bool on) {
+  try {
+    auto engine = engine::SyncEngine::open();
+    engine->setSyncsAfterClients(kVantorSyncClientId, on);
+    engine->setShouldSynchronize(kVantorSyncClientId, on, {"app", "device", "peer"});
+  } catch (const std::exception& e) {
+    // The preference is stored all the same; the engine learns it at the
+    // next change of the setting.
+    VTC_LOG_ERROR("Could not tell the sync engine about syncing after other clients: %@", e.what());
+  }
+}
 
 }  // namespace vtc

@@ -42,11 +42,15 @@ VTCPrefsCenter::~VTCPrefsCenter() {
 }
 
 std::optional<std::string> VTCPrefsCenter::applicationSupportDirectory() {
+  // Cached for the home it was made in (tests change homes within a process).
   static std::mutex mutex;
   static std::optional<std::string> cached;
+  static std::string cachedBase;
   std::lock_guard<std::mutex> lock(mutex);
-  if (cached) return cached;
   std::string base = vtc::paths::applicationSupportDirectory();
+  if (cached && base == cachedBase) return cached;
+  cachedBase = base;
+  cached.reset();
   if (base.empty()) return std::nullopt;
   std::string path = vtc::paths::join(base, keys::kSupportFolder);
   struct stat st {};

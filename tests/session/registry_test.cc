@@ -14,6 +14,7 @@
 #include "platform/dav/TesselSession.h"
 #include "support/ApacheShare.h"
 #include "support/FakeTime.h"
+#include "support/FaultProxy.h"
 #include "support/TestHome.h"
 #include "support/TraceCapture.h"
 
@@ -161,15 +162,21 @@ TEST_F(Registry, AResetMarksEveryOtherClientNeedingTheTruth) {
 }
 
 TEST_F(Registry, StatusesAlreadyInPlaceCostOnlyTheListingAndTheReads) {
-  auto a = open("GUID-A");
+  // Counted at a proxy, which sees each request as it is sent (the server
+  // logs a request only after answering it).
+  vtc::test::FaultProxy proxy(share.port());
+  vtc::Dictionary config = share.configuration();
+  config.set("host_port", vtc::Value(proxy.port()));
+  config.set("guid", vtc::Value("GUID-A"));
+  auto a = NubiloRemoteSession::sessionWithUsername("alice", "wonderland", config);
   for (int i = 0; i < 10; ++i) a->registerClient(vtc::format("GUID-%d", i), "machine");
   a->lockClients();
   a->setOtherClientStatus("needstruth", "Contacts");
-  size_t before = share.accessEntries().size();
-  size_t patchesBefore = requests("PROPPATCH");
+  size_t before = proxy.requests().size();
+  size_t patchesBefore = proxy.count("PROPPATCH");
   a->setOtherClientStatus("needstruth", "Contacts");
-  size_t sent = share.accessEntries().size() - before;
-  EXPECT_EQ(requests("PROPPATCH"), patchesBefore);
+  size_t sent = proxy.requests().size() - before;
+  EXPECT_EQ(proxy.count("PROPPATCH"), patchesBefore);
   EXPECT_EQ(sent, 12u);  // relock, listing, ten reads
   RecordProperty("requests_for_ten_unchanged_clients", static_cast<int>(sent));
   a->unlockClients();

@@ -238,8 +238,19 @@ Dictionary ApacheShare::configuration() const {
 }
 
 std::vector<AccessEntry> ApacheShare::accessEntries() const {
+  // The server logs a request just after answering it: wait until the log
+  // stops growing (a few milliseconds) before reading it.
+  std::string path = root_ + "/logs/access.log";
+  std::error_code ignored;
+  uintmax_t size = std::filesystem::file_size(path, ignored);
+  for (int i = 0; i < 10; ++i) {
+    std::this_thread::sleep_for(std::chrono::milliseconds(15));
+    uintmax_t now = std::filesystem::file_size(path, ignored);
+    if (now == size) break;
+    size = now;
+  }
   std::vector<AccessEntry> out;
-  std::ifstream in(root_ + "/logs/access.log");
+  std::ifstream in(path);
   for (std::string line; std::getline(in, line);) {
     // 127.0.0.1 54321 PROPFIND "/path with spaces" 207
     AccessEntry e;

@@ -1,0 +1,50 @@
+// The sync engine on SQLite.
+#pragma once
+
+#include <string>
+
+#include "platform/engine/Sqlite.h"
+#include "platform/engine/SyncEngine.h"
+
+namespace vtc::engine {
+
+class SqliteEngine final : public SyncEngine {
+ public:
+  explicit SqliteEngine(const std::string& path);
+
+  std::string version() override;
+  void registerClient(const std::string& client, const Dictionary& description) override;
+  Value objectForKey(const std::string& client, const std::string& key) override;
+  void setObjectForKey(const std::string& client, const std::string& key,
+                       const Value& value) override;
+  void setSyncsAfterClients(const std::string& client, bool after) override;
+  void setShouldSynchronize(const std::string& client, bool should,
+                            const std::vector<std::string>& clientTypes) override;
+  void setSchemaVersions(const std::string& dataclass, const Array& versions) override;
+  Array schemaVersions(const std::string& dataclass) override;
+  void push(const std::string& client, const std::string& dataclass,
+            const std::vector<SyncEngineChange>& changes) override;
+  PullResult pull(const std::string& client, const std::string& dataclass) override;
+  void acknowledge(const std::string& client, const std::string& dataclass,
+                   int64_t anchor) override;
+  void resetClient(const std::string& client, const std::string& dataclass) override;
+  int64_t beginSyncPlan(const std::vector<std::string>& participants) override;
+  void setSyncPlanStatus(int64_t plan, int32_t status) override;
+  void endSyncPlan(int64_t plan) override;
+  std::vector<SyncPlan> currentSyncPlans() override;
+
+ private:
+  void migrate();
+  Dictionary clientSettings(const std::string& client);
+  void storeClientSettings(const std::string& client, const Dictionary& settings);
+  int64_t anchorOf(const std::string& client, const std::string& dataclass, bool* needsTruth);
+
+  std::string path_;
+  Database db_;
+};
+
+// Property values are kept as binary property lists.
+Bytes encode(const Value& value);
+Value decode(const Bytes& bytes);
+
+}  // namespace vtc::engine
