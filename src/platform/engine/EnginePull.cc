@@ -59,7 +59,8 @@ PullResult SqliteEngine::pull(const std::string& client, const std::string& data
     if (fresh) recordOrder.push_back(id);
     Touched& rec = it->second;
     if (entries.integer(1) == SyncEngineChange::kAdd) rec.addedInWindow = true;
-    for (const Value& pc : decode(entries.blob(2)).array()) {
+    const Value list = decode(entries.blob(2));
+    for (const Value& pc : list.array()) {
       const std::string& name = pc.dictionary().get("name").string();
       if (!rec.lastChange.count(name)) rec.order.push_back(name);
       rec.lastChange[name] = pc;
@@ -80,7 +81,7 @@ PullResult SqliteEngine::pull(const std::string& client, const std::string& data
       if (!rec.addedInWindow) result.changes.emplace_back(SyncEngineChange::kDelete, id, Array{});
     } else if (rec.addedInWindow) {
       result.changes.emplace_back(SyncEngineChange::kAdd, id, setsOf(properties));
-    } else {
+    } else if (!rec.order.empty()) {  // edits that all lost a conflict change nothing
       Array merged;
       for (const std::string& name : rec.order) merged.push_back(rec.lastChange.at(name));
       result.changes.emplace_back(SyncEngineChange::kModify, id, std::move(merged));

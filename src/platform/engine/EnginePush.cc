@@ -79,7 +79,8 @@ void SqliteEngine::push(const std::string& client, const std::string& dataclass,
     if (exists) {
       unseen.bind(1, dataclass).bind(2, id).bind(3, anchor).bind(4, client);
       while (unseen.step()) {
-        for (const Value& pc : decode(unseen.blob(1)).array()) {
+        const Value list = decode(unseen.blob(1));
+        for (const Value& pc : list.array()) {
           const Dictionary& d = pc.dictionary();
           competing[d.get("name").string()] = {d.get("value"), unseen.text(0), unseen.real(2)};
         }

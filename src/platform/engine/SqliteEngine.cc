@@ -177,7 +177,8 @@ std::vector<SyncPlan> SqliteEngine::currentSyncPlans() {
   std::vector<SyncPlan> plans;
   while (s.step()) {
     SyncPlan p{s.integer(0), static_cast<int32_t>(s.integer(1)), {}};
-    for (const Value& v : decode(s.blob(2)).array()) p.participants.push_back(v.string());
+    const Value participants = decode(s.blob(2));
+    for (const Value& v : participants.array()) p.participants.push_back(v.string());
     plans.push_back(std::move(p));
   }
   return plans;
