@@ -14,6 +14,7 @@
 #include "VantorSyncManager/PublicNames.h"
 #include "VantorSyncManager/VTCPrefsCenter.h"
 #include "common/Logging.h"
+#include "platform/engine/SyncEngine.h"
 #include "platform/prefs/PreferenceStore.h"
 #include "platform/secrets/CredentialStore.h"
 #include "support/ApacheShare.h"
@@ -144,6 +145,20 @@ TEST_F(PrefsCenter, TheLastSuccessfulSyncDateIsAnnouncedOnTheSessionBus) {
   ASSERT_EQ(got.size(), 1u);
   EXPECT_EQ(got[0].name, "com.korvo.VantorSync.lastSyncDateChanged");
   EXPECT_EQ(prefs.lastSuccessfulSyncDate(), time.now());
+}
+
+TEST_F(PrefsCenter, AnOlderSyncDateInTheEnginesRecordIsMigratedOnce) {
+  {
+    auto engine = vtc::engine::SyncEngine::open();
+    engine->registerClient("com.korvo.VantorSync", vtc::Dictionary{});
+    engine->setObjectForKey("com.korvo.VantorSync", "lastSuccessSync",
+                            vtc::Value(time.now() - std::chrono::hours(3)));
+  }
+  EXPECT_EQ(prefs.lastSuccessfulSyncDate(), time.now() - std::chrono::hours(3));
+  EXPECT_EQ(perHost("lastSuccessSync").date(), time.now() - std::chrono::hours(3));
+  EXPECT_TRUE(vtc::engine::SyncEngine::open()
+                  ->objectForKey("com.korvo.VantorSync", "lastSuccessSync")
+                  .isNone());
 }
 
 TEST_F(PrefsCenter, ASessionOpensFromStoredPreferencesAndTheKeyringAlone) {
