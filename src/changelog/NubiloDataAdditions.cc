@@ -68,6 +68,30 @@ void NubiloAppendString(vtc::Bytes& data, std::string_view string) {
   data.push_back(0);
 }
 
+namespace {
+
+// Runs a zlib stream in fixed 4096-byte output steps, appending to out,
+// while step() answers Z_OK. False when zlib reports an error.
+template <typename Step, typename End>
+bool drain(z_stream& z, vtc::Bytes& out, Step step, End end) {
+  int ret;
+  do {
+    size_t used = out.size();
+    out.resize(used + kStep);
+    z.next_out = out.data() + used;
+    z.avail_out = kStep;
+    ret = step(&z);
+    out.resize(used + kStep - z.avail_out);
+    if (ret < 0) {
+      end(&z);  // abandoned: the stream's own error decides
+      return false;
+    }
+  } while (ret == Z_OK);
+  return end(&z) == Z_OK;
+}
+
+}  // namespace
+
 std::optional<vtc::Bytes> NubiloGzip(vtc::ByteView data) {
   vtc::Bytes out(kGzipHeader, kGzipHeader + sizeof kGzipHeader);
   z_stream z{};
@@ -75,20 +99,9 @@ std::optional<vtc::Bytes> NubiloGzip(vtc::ByteView data) {
     return std::nullopt;
   z.next_in = const_cast<Bytef*>(data.data());
   z.avail_in = static_cast<uInt>(data.size());
-  int ret;
-  do {
-    size_t used = out.size();
-    out.resize(used + kStep);
-    z.next_out = out.data() + used;
-    z.avail_out = kStep;
-    ret = deflate(&z, Z_FINISH);
-    out.resize(used + kStep - z.avail_out);
-    if (ret < 0) {
-      deflateEnd(&z);
-      return std::nullopt;
-    }
-  } while (ret == Z_OK);
-  if (deflateEnd(&z) != Z_OK) return std::nullopt;
+  if (!drain(
+          z, out, [](z_stream* s) { return deflate(s, Z_FINISH); }, deflateEnd))
+    return std::nullopt;
   return out;
 }
 
@@ -96,23 +109,12 @@ std::optional<vtc::Bytes> NubiloCopyGunzip(vtc::ByteView data) {
   if (data.size() <= 9) return std::nullopt;
   z_stream z{};
   if (inflateInit2(&z, -15) != Z_OK) return std::nullopt;
-  z.next_in = const_cast<Bytef*>(data.data() + 10);
+  z.next_in = const_cast<Bytef*>(data.data() + 10);  // the header is never examined
   z.avail_in = static_cast<uInt>(data.size() - 10);
   vtc::Bytes out;
-  int ret;
-  do {
-    size_t used = out.size();
-    out.resize(used + kStep);
-    z.next_out = out.data() + used;
-    z.avail_out = kStep;
-    ret = inflate(&z, Z_SYNC_FLUSH);
-    out.resize(used + kStep - z.avail_out);
-    if (ret < 0) {
-      inflateEnd(&z);
-      return std::nullopt;
-    }
-  } while (ret == Z_OK);
-  if (inflateEnd(&z) != Z_OK) return std::nullopt;
+  if (!drain(
+          z, out, [](z_stream* s) { return inflate(s, Z_SYNC_FLUSH); }, inflateEnd))
+    return std::nullopt;
   return out;
 }
 

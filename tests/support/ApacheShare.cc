@@ -1,5 +1,7 @@
 #include "support/ApacheShare.h"
 
+#include "support/Processes.h"
+
 #include <arpa/inet.h>
 #include <fcntl.h>
 #include <netinet/in.h>
@@ -194,18 +196,7 @@ void ApacheShare::start() {
 }
 
 void ApacheShare::stop() {
-  if (pid_ <= 0) return;
-  ::kill(pid_, SIGTERM);
-  for (int i = 0; i < 500; ++i) {
-    if (::waitpid(pid_, nullptr, WNOHANG) == pid_) {
-      pid_ = -1;
-      return;
-    }
-    std::this_thread::sleep_for(std::chrono::milliseconds(10));
-  }
-  ::kill(pid_, SIGKILL);
-  ::waitpid(pid_, nullptr, 0);
-  pid_ = -1;
+  stopProcess(pid_);
 }
 
 void ApacheShare::forgetLocks() {

@@ -13,25 +13,11 @@
 #include <thread>
 
 #include "platform/bus/DistributedNotifications.h"
+#include "support/Processes.h"
 
 namespace vtc::test {
 
 namespace {
-
-void stopByPid(pid_t& pid) {
-  if (pid <= 0) return;
-  ::kill(pid, SIGTERM);
-  for (int i = 0; i < 300; ++i) {
-    if (::waitpid(pid, nullptr, WNOHANG) == pid) {
-      pid = -1;
-      return;
-    }
-    std::this_thread::sleep_for(std::chrono::milliseconds(10));
-  }
-  ::kill(pid, SIGKILL);
-  ::waitpid(pid, nullptr, 0);
-  pid = -1;
-}
 
 bool nameHasOwner(const char* name) {
   sd_bus* bus = nullptr;
@@ -66,7 +52,7 @@ SessionBus::SessionBus() {
   for (int i = 0; i < 500 && !std::filesystem::exists(socket); ++i)
     std::this_thread::sleep_for(std::chrono::milliseconds(10));
   if (!std::filesystem::exists(socket)) {
-    stopByPid(busPid_);
+    stopProcess(busPid_);
     throw std::runtime_error("dbus-daemon did not start");
   }
   if (const char* a = std::getenv("DBUS_SESSION_BUS_ADDRESS")) previousAddress_ = a;
@@ -74,8 +60,8 @@ SessionBus::SessionBus() {
 }
 
 SessionBus::~SessionBus() {
-  stopByPid(keyringPid_);
-  stopByPid(busPid_);
+  stopProcess(keyringPid_);
+  stopProcess(busPid_);
   if (previousAddress_)
     ::setenv("DBUS_SESSION_BUS_ADDRESS", previousAddress_->c_str(), 1);
   else
