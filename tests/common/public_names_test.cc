@@ -1,19 +1,7 @@
 #include <gtest/gtest.h>
 
-#include <cstring>
-
 #include "VantorSyncManager/PublicNames.h"
 #include "common/ResultCodes.h"
-
-TEST(PublicNames, FailureNamesEqualTheirOwnNames) {
-  EXPECT_STREQ(NubiloLoginFailureException, "NubiloLoginFailureException");
-  EXPECT_STREQ(NubiloMinglerFailureException, "NubiloMinglerFailureException");
-  EXPECT_STREQ(NubiloSyncCancelledByUser, "User Cancelled");
-  EXPECT_STREQ(kLastSyncDateChangedNotification, "com.korvo.VantorSync.lastSyncDateChanged");
-  EXPECT_STREQ(_SMUserAgentBase, "VantorClient/%@/%@/%@");
-  EXPECT_EQ(kCurrentConfigVersion, 251);
-  EXPECT_EQ(kAutoConfigVersion, -1);
-}
 
 TEST(PublicNames, VersionStringHasTwoBlanksAndEndsWithLineFeed) {
   EXPECT_EQ(VantorSyncManagerVersionNumber, 488.5);
