@@ -26,6 +26,13 @@ const std::string& requiredString(const vtc::Dictionary& configuration, const ch
   return v.string();
 }
 
+// A first-run configuration has no time-out yet; without one a dead server
+// would hold a request for ever.
+int32_t readTimeout(const vtc::Dictionary& configuration) {
+  int64_t seconds = configuration.get("sync_dav_timeout_seconds").integer();
+  return static_cast<int32_t>(seconds > 0 ? seconds : 90);
+}
+
 }  // namespace
 
 std::unique_ptr<NubiloRemoteSession> NubiloRemoteSession::sessionWithUsername(
@@ -74,9 +81,7 @@ NubiloRemoteSession::NubiloRemoteSession(std::shared_ptr<MemberAccount> account,
   // on the share that the configuration names, at its root, so that the
   // credentials then go with every request to the share (the trash of a
   // reset lies outside the sync area) instead of being asked for again.
-  _vantorAccount->setServer(
-      scheme, hostName, port, "/",
-      static_cast<int32_t>(_configuration.get("sync_dav_timeout_seconds").integer()));
+  _vantorAccount->setServer(scheme, hostName, port, "/", readTimeout(_configuration));
   DavTransaction check = _vantorAccount->credentialsAreValid();
 
   _lockDuration = _configuration.get("lock_duration_seconds").integer();
@@ -114,8 +119,7 @@ NubiloRemoteSession::NubiloRemoteSession(std::shared_ptr<MemberAccount> account,
   _TesselSession =
       std::make_unique<TesselSession>(_vantorAccount, name.string(), hostName, port, scheme);
   _TesselSession->setIsSynchronous(true);
-  _TesselSession->_setReadTimeOut(
-      static_cast<int32_t>(_configuration.get("sync_dav_timeout_seconds").integer()));
+  _TesselSession->_setReadTimeOut(readTimeout(_configuration));
 
   _syncPath = syncPath;
   _clientsPath = stringByAppendingTesselPathComponent(_syncPath, "Clients");
