@@ -49,9 +49,6 @@ class DavConnection {
   DavTransaction perform(const std::string& method, const std::string& path,
                          const std::function<int()>& run);
 
-  // The status of the last answer seen (kNoHTTPStatus when none).
-  int lastStatus() const { return capture_.status; }
-
  private:
   struct Capture {
     int status = kNoHTTPStatus;
