@@ -8,6 +8,7 @@
 #include <openssl/evp.h>
 #include <pwd.h>
 #include <signal.h>
+#include <sys/prctl.h>
 #include <sys/socket.h>
 #include <sys/stat.h>
 #include <sys/wait.h>
@@ -172,9 +173,12 @@ void ApacheShare::start() {
   std::string conf = root_ + "/httpd.conf";
   pid_ = ::fork();
   if (pid_ == 0) {
+    // A test process that dies without its destructors takes the server along.
+    ::prctl(PR_SET_PDEATHSIG, SIGTERM);
     int devnull = ::open("/dev/null", O_RDWR);
     ::dup2(devnull, 0);
     ::dup2(devnull, 1);
+    ::dup2(devnull, 2);
     ::execl(kApache, kApache, "-f", conf.c_str(), "-DFOREGROUND", static_cast<char*>(nullptr));
     ::_exit(127);
   }

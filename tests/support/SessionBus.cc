@@ -2,6 +2,7 @@
 
 #include <fcntl.h>
 #include <signal.h>
+#include <sys/prctl.h>
 #include <sys/stat.h>
 #include <sys/wait.h>
 #include <systemd/sd-bus.h>
@@ -42,9 +43,11 @@ SessionBus::SessionBus() {
   address_ = "unix:path=" + socket;
   busPid_ = ::fork();
   if (busPid_ == 0) {
+    ::prctl(PR_SET_PDEATHSIG, SIGTERM);  // gone with a test process that crashes
     int devnull = ::open("/dev/null", O_RDWR);
     ::dup2(devnull, 0);
     ::dup2(devnull, 1);
+    ::dup2(devnull, 2);
     ::execlp("dbus-daemon", "dbus-daemon", "--session", "--nofork", "--nopidfile",
              ("--address=" + address_).c_str(), static_cast<char*>(nullptr));
     ::_exit(127);
@@ -79,6 +82,7 @@ void SessionBus::startKeyring() {
   if (::pipe(input) != 0) throw std::runtime_error("pipe failed");
   keyringPid_ = ::fork();
   if (keyringPid_ == 0) {
+    ::prctl(PR_SET_PDEATHSIG, SIGTERM);
     // Its keyrings live in the bus's folder, not in the real home.
     ::setenv("HOME", dir_.c_str(), 1);
     ::setenv("XDG_DATA_HOME", data.c_str(), 1);
