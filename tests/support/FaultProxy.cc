@@ -230,6 +230,7 @@ void FaultProxy::serve(int client) {
   while (server >= 0 && !stopping_) {
     pollfd fds[3] = {{client, POLLIN, 0}, {server, POLLIN, 0}, {wake_[0], POLLIN, 0}};
     if (::poll(fds, 3, -1) < 0 || stopping_) break;
+    if ((fds[0].revents | fds[1].revents) & (POLLERR | POLLNVAL)) break;  // a broken socket
     if (fds[1].revents & (POLLIN | POLLHUP)) {
       ssize_t n = ::recv(server, buf, sizeof buf, 0);
       if (n <= 0 || !writeAll(client, buf, static_cast<size_t>(n))) break;
@@ -259,7 +260,8 @@ void FaultProxy::serve(int client) {
           if (d.status == 401) response += "WWW-Authenticate: Basic realm=\"Tessel\"\r\n";
           response += d.body.starts_with("<?xml") ? "Content-Type: application/xml\r\n"
                                                   : "Content-Type: text/plain\r\n";
-          response += "\r\n" + d.body;
+          // A HEAD answer has headers only: a body would be read as the next answer.
+          response += "\r\n" + (r->method == "HEAD" ? std::string() : d.body);
           open = writeAll(client, response.data(), response.size());
         }
         if (open) pending.erase(0, r->length);
