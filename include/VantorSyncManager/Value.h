@@ -11,7 +11,6 @@
 #include <span>
 #include <string>
 #include <string_view>
-#include <unordered_map>
 #include <utility>
 #include <variant>
 #include <vector>
@@ -27,6 +26,55 @@ using ByteView = std::span<const uint8_t>;
 class Value;
 class Dictionary;
 using Array = std::vector<Value>;
+
+class VSM_EXPORT Dictionary {
+ public:
+  using Entry = std::pair<std::string, Value>;
+
+  // Special members live in the library: Value is incomplete here.
+  Dictionary();
+  Dictionary(std::initializer_list<Entry> entries);
+  Dictionary(const Dictionary& other);
+  Dictionary(Dictionary&& other) noexcept;
+  Dictionary& operator=(const Dictionary& other);
+  Dictionary& operator=(Dictionary&& other) noexcept;
+  ~Dictionary();
+
+  size_t size() const;
+  bool empty() const;
+  void reserve(size_t entries);
+  bool contains(std::string_view key) const { return find(key) != nullptr; }
+
+  // The value for key, or nullptr.
+  const Value* find(std::string_view key) const;
+  Value* find(std::string_view key);
+  // The value for key, or a none value.
+  const Value& get(std::string_view key) const;
+  const Value& operator[](std::string_view key) const { return get(key); }
+
+  // Adds or replaces; a replaced entry keeps its place.
+  void set(std::string_view key, Value value);
+  // The value under key, added at the end as a none value when missing.
+  Value& slot(std::string_view key);
+  bool erase(std::string_view key);
+  void merge(const Dictionary& other);  // other's entries on top
+  void clear();
+
+  std::vector<std::string> keys() const;
+  std::vector<Entry>::const_iterator begin() const;
+  std::vector<Entry>::const_iterator end() const;
+
+  std::string description() const;
+
+  // Equal when both hold the same keys with equal values, in any order.
+  friend bool operator==(const Dictionary& a, const Dictionary& b);
+
+ private:
+  struct Index;  // key to position, kept only for large dictionaries
+  void reindex();
+  std::vector<Entry> entries_;
+  std::unique_ptr<Index> index_;
+};
 
 class VSM_EXPORT Value {
  public:
@@ -72,8 +120,10 @@ class VSM_EXPORT Value {
   const Bytes& data() const;
   const Array& array() const;
   const Dictionary& dictionary() const;
-  Array& mutableArray();            // turns a none value into an empty array
-  Dictionary& mutableDictionary();  // turns a none value into an empty dictionary
+  // Each turns a value of another kind into an empty one of its own kind.
+  std::string& mutableString();
+  Array& mutableArray();
+  Dictionary& mutableDictionary();
 
   // Old-style property-list text: strings quoted only when needed,
   // dictionaries as { key = value; }, arrays as ( a, b ), data as <0a1b>.
@@ -82,52 +132,24 @@ class VSM_EXPORT Value {
   friend bool operator==(const Value& a, const Value& b);
 
  private:
+  // Containers are held in place: a decoded dictionary costs one allocation
+  // (its entries), not two.
   using Storage = std::variant<std::monostate, std::string, int64_t, double, bool, Date, Bytes,
-                               std::unique_ptr<Array>, std::unique_ptr<Dictionary>>;
+                               Array, Dictionary>;
   Storage v_;
 };
 
-class VSM_EXPORT Dictionary {
- public:
-  using Entry = std::pair<std::string, Value>;
-
-  Dictionary() = default;
-  Dictionary(std::initializer_list<Entry> entries);
-
-  size_t size() const { return entries_.size(); }
-  bool empty() const { return entries_.empty(); }
-  bool contains(std::string_view key) const { return find(key) != nullptr; }
-
-  // The value for key, or nullptr.
-  const Value* find(std::string_view key) const;
-  Value* find(std::string_view key);
-  // The value for key, or a none value.
-  const Value& get(std::string_view key) const;
-  const Value& operator[](std::string_view key) const { return get(key); }
-
-  // Adds or replaces; a replaced entry keeps its place.
-  void set(std::string key, Value value);
-  bool erase(std::string_view key);
-  void merge(const Dictionary& other);  // other's entries on top
-  void clear();
-
-  std::vector<std::string> keys() const;
-  auto begin() const { return entries_.begin(); }
-  auto end() const { return entries_.end(); }
-
-  std::string description() const;
-
-  // Equal when both hold the same keys with equal values, in any order.
-  friend bool operator==(const Dictionary& a, const Dictionary& b);
-
- private:
-  struct KeyHash {
-    using is_transparent = void;
-    size_t operator()(std::string_view s) const { return std::hash<std::string_view>{}(s); }
-  };
-  void reindex();
-  std::vector<Entry> entries_;
-  std::unordered_map<std::string, size_t, KeyHash, std::equal_to<>> index_;
-};
+inline size_t Dictionary::size() const {
+  return entries_.size();
+}
+inline bool Dictionary::empty() const {
+  return entries_.empty();
+}
+inline std::vector<Dictionary::Entry>::const_iterator Dictionary::begin() const {
+  return entries_.begin();
+}
+inline std::vector<Dictionary::Entry>::const_iterator Dictionary::end() const {
+  return entries_.end();
+}
 
 }  // namespace vtc

@@ -6,6 +6,7 @@
 #include <cstdio>
 #include <cstdlib>
 #include <ctime>
+#include <unordered_map>
 
 namespace vtc {
 
@@ -119,36 +120,14 @@ Value::Value(const char* s) : v_(s ? std::string(s) : std::string()) {
 }
 Value::Value(std::string s) : v_(std::move(s)) {}
 Value::Value(std::string_view s) : v_(std::string(s)) {}
-Value::Value(Array a) : v_(std::make_unique<Array>(std::move(a))) {}
-Value::Value(Dictionary d) : v_(std::make_unique<Dictionary>(std::move(d))) {}
+Value::Value(Array a) : v_(std::move(a)) {}
+Value::Value(Dictionary d) : v_(std::move(d)) {}
 
-Value::Value(const Value& other) {
-  *this = other;
-}
-Value::Value(Value&& other) noexcept : v_(std::move(other.v_)) {}
+Value::Value(const Value& other) = default;
+Value::Value(Value&& other) noexcept = default;
 Value::~Value() = default;
-
-Value& Value::operator=(const Value& other) {
-  if (this == &other) return *this;
-  std::visit(
-      [this](const auto& x) {
-        using T = std::decay_t<decltype(x)>;
-        if constexpr (std::is_same_v<T, std::unique_ptr<Array>>) {
-          v_ = std::make_unique<Array>(*x);
-        } else if constexpr (std::is_same_v<T, std::unique_ptr<Dictionary>>) {
-          v_ = std::make_unique<Dictionary>(*x);
-        } else {
-          v_ = x;
-        }
-      },
-      other.v_);
-  return *this;
-}
-
-Value& Value::operator=(Value&& other) noexcept {
-  v_ = std::move(other.v_);
-  return *this;
-}
+Value& Value::operator=(const Value& other) = default;
+Value& Value::operator=(Value&& other) noexcept = default;
 
 Value::Kind Value::kind() const {
   switch (v_.index()) {
@@ -223,23 +202,28 @@ const Bytes& Value::data() const {
 }
 
 const Array& Value::array() const {
-  auto* a = std::get_if<std::unique_ptr<Array>>(&v_);
-  return a ? **a : kEmptyArray;
+  auto* a = std::get_if<Array>(&v_);
+  return a ? *a : kEmptyArray;
 }
 
 const Dictionary& Value::dictionary() const {
-  auto* d = std::get_if<std::unique_ptr<Dictionary>>(&v_);
-  return d ? **d : kEmptyDictionary;
+  auto* d = std::get_if<Dictionary>(&v_);
+  return d ? *d : kEmptyDictionary;
+}
+
+std::string& Value::mutableString() {
+  if (!std::holds_alternative<std::string>(v_)) v_ = std::string();
+  return std::get<std::string>(v_);
 }
 
 Array& Value::mutableArray() {
-  if (!std::holds_alternative<std::unique_ptr<Array>>(v_)) v_ = std::make_unique<Array>();
-  return *std::get<std::unique_ptr<Array>>(v_);
+  if (!std::holds_alternative<Array>(v_)) v_ = Array();
+  return std::get<Array>(v_);
 }
 
 Dictionary& Value::mutableDictionary() {
-  if (!std::holds_alternative<std::unique_ptr<Dictionary>>(v_)) v_ = std::make_unique<Dictionary>();
-  return *std::get<std::unique_ptr<Dictionary>>(v_);
+  if (!std::holds_alternative<Dictionary>(v_)) v_ = Dictionary();
+  return std::get<Dictionary>(v_);
 }
 
 std::string Value::description() const {
@@ -271,8 +255,34 @@ bool operator==(const Value& a, const Value& b) {
   return false;
 }
 
+struct Dictionary::Index {
+  struct Hash {
+    using is_transparent = void;
+    size_t operator()(std::string_view s) const { return std::hash<std::string_view>{}(s); }
+  };
+  std::unordered_map<std::string, size_t, Hash, std::equal_to<>> positions;
+};
+
+Dictionary::Dictionary() = default;
 Dictionary::Dictionary(std::initializer_list<Entry> entries) {
   for (const auto& [k, v] : entries) set(k, v);
+}
+Dictionary::Dictionary(const Dictionary& other) : entries_(other.entries_) {
+  reindex();
+}
+Dictionary::Dictionary(Dictionary&& other) noexcept = default;
+Dictionary& Dictionary::operator=(const Dictionary& other) {
+  if (this != &other) {
+    entries_ = other.entries_;
+    reindex();
+  }
+  return *this;
+}
+Dictionary& Dictionary::operator=(Dictionary&& other) noexcept = default;
+Dictionary::~Dictionary() = default;
+
+void Dictionary::reserve(size_t entries) {
+  entries_.reserve(entries);
 }
 
 const Value* Dictionary::find(std::string_view key) const {
@@ -281,8 +291,8 @@ const Value* Dictionary::find(std::string_view key) const {
       if (e.first == key) return &e.second;
     return nullptr;
   }
-  auto it = index_.find(key);
-  return it == index_.end() ? nullptr : &entries_[it->second].second;
+  auto it = index_->positions.find(key);
+  return it == index_->positions.end() ? nullptr : &entries_[it->second].second;
 }
 
 Value* Dictionary::find(std::string_view key) {
@@ -294,18 +304,20 @@ const Value& Dictionary::get(std::string_view key) const {
   return v ? *v : kNoneValue;
 }
 
-void Dictionary::set(std::string key, Value value) {
-  if (Value* existing = find(key)) {
-    *existing = std::move(value);
-    return;
-  }
-  entries_.emplace_back(std::move(key), std::move(value));
+void Dictionary::set(std::string_view key, Value value) {
+  slot(key) = std::move(value);
+}
+
+Value& Dictionary::slot(std::string_view key) {
+  if (Value* existing = find(key)) return *existing;
+  entries_.emplace_back(std::string(key), Value());
   if (entries_.size() > kIndexedSize) {
-    if (index_.empty())
+    if (!index_)
       reindex();
     else
-      index_.emplace(entries_.back().first, entries_.size() - 1);
+      index_->positions.emplace(entries_.back().first, entries_.size() - 1);
   }
+  return entries_.back().second;
 }
 
 bool Dictionary::erase(std::string_view key) {
@@ -323,7 +335,7 @@ void Dictionary::merge(const Dictionary& other) {
 
 void Dictionary::clear() {
   entries_.clear();
-  index_.clear();
+  index_.reset();
 }
 
 std::vector<std::string> Dictionary::keys() const {
@@ -338,9 +350,10 @@ std::string Dictionary::description() const {
 }
 
 void Dictionary::reindex() {
-  index_.clear();
+  index_.reset();
   if (entries_.size() <= kIndexedSize) return;
-  for (size_t i = 0; i < entries_.size(); ++i) index_.emplace(entries_[i].first, i);
+  index_ = std::make_unique<Index>();
+  for (size_t i = 0; i < entries_.size(); ++i) index_->positions.emplace(entries_[i].first, i);
 }
 
 bool operator==(const Dictionary& a, const Dictionary& b) {
