@@ -6,7 +6,7 @@
 #include "changelog/ChangeLogFormat.h"
 #include "common/Clock.h"
 #include "common/Format.h"
-#include "platform/plist/PlistCodec.h"
+#include "platform/plist/BinaryPlistWriter.h"
 
 namespace {
 
@@ -46,14 +46,17 @@ void NubiloChangeLog::writeToData(vtc::Bytes& output) {
   const size_t bodyStart = output.size();
 
   vtc::Bytes body;
+  vtc::plist::BinaryPlistWriter archiver;
   for (size_t i = 0; i < n; ++i) {
     const SyncEngineChange& change = _changes[i];
     putUInt32At(output, 8 + 4 * i, static_cast<uint32_t>(bodyStart + body.size()));
     NubiloAppendString(body, change.recordIdentifier());
     NubiloAppendUInt32(body, change.type());
-    vtc::Bytes archived = vtc::plist::toBinary(change.changes());
-    NubiloAppendUInt32(body, static_cast<uint32_t>(archived.size()));
-    body.insert(body.end(), archived.begin(), archived.end());
+    // The archive goes straight into the body; its length is filled in after.
+    const size_t lengthAt = body.size();
+    NubiloAppendUInt32(body, 0);
+    archiver.append(change.changes(), body);
+    putUInt32At(body, lengthAt, static_cast<uint32_t>(body.size() - lengthAt - 4));
   }
   putUInt32At(output, 8 + 4 * n, vtc::clog::kIndexEnd);
   if (std::optional<vtc::Bytes> zipped = NubiloGzip(body))

@@ -10,62 +10,21 @@
 #include <fstream>
 #include <iterator>
 
+#include "platform/plist/BinaryPlistFormat.h"
+#include "platform/plist/BinaryPlistReader.h"
+#include "platform/plist/BinaryPlistWriter.h"
+
 namespace vtc::plist {
 
 namespace {
 
 // libplist counts dates from 2001-01-01 00:00:00 UTC.
-constexpr int64_t kPlistEpochOffset = 978307200;
+constexpr int64_t kPlistEpochOffset = binary::kEpochOffsetSeconds;
 
 struct PlistFree {
   void operator()(::plist_t p) const { plist_free(p); }
 };
 using PlistPtr = std::unique_ptr<void, PlistFree>;
-
-uint64_t bigEndian(const uint8_t* p, size_t n) {
-  uint64_t v = 0;
-  for (size_t i = 0; i < n; ++i) v = (v << 8) | p[i];
-  return v;
-}
-
-// Whether every string object of a binary property list is free of zero
-// characters. libplist aborts the process on a dictionary key that holds
-// one, so such input is refused before libplist sees it. False also for a
-// table that points outside the bytes.
-bool binaryStringsAreClean(ByteView b) {
-  if (b.size() < 8 + 32) return false;
-  const uint8_t* trailer = b.data() + b.size() - 32;
-  const size_t offsetSize = trailer[6];
-  const uint64_t count = bigEndian(trailer + 8, 8);
-  const uint64_t tableAt = bigEndian(trailer + 24, 8);
-  if (offsetSize == 0 || offsetSize > 8 || tableAt > b.size() ||
-      count > (b.size() - tableAt) / offsetSize)
-    return false;
-  for (uint64_t i = 0; i < count; ++i) {
-    uint64_t at = bigEndian(b.data() + tableAt + i * offsetSize, offsetSize);
-    if (at >= b.size()) return false;
-    const uint8_t marker = b[at];
-    const int kind = marker >> 4;
-    if (kind != 0x5 && kind != 0x6) continue;  // ASCII or UTF-16 string
-    uint64_t length = marker & 0x0F;
-    uint64_t start = at + 1;
-    if (length == 0x0F) {  // the length follows as an integer object
-      if (start >= b.size() || (b[start] >> 4) != 0x1) return false;
-      const size_t width = size_t{1} << (b[start] & 0x0F);
-      if (width > 8 || start + 1 + width > b.size()) return false;
-      length = bigEndian(b.data() + start + 1, width);
-      start += 1 + width;
-    }
-    const uint64_t bytes = kind == 0x6 ? length * 2 : length;
-    if (length > b.size() || start + bytes > b.size()) return false;
-    for (uint64_t k = 0; k < length; ++k) {
-      bool zero =
-          kind == 0x5 ? b[start + k] == 0 : (b[start + 2 * k] == 0 && b[start + 2 * k + 1] == 0);
-      if (zero) return false;
-    }
-  }
-  return true;
-}
 
 }  // namespace
 
@@ -181,10 +140,9 @@ Value fromPlist(::plist_t node) {
 
 std::optional<Value> parse(ByteView bytes) {
   if (bytes.empty() || bytes.size() > UINT32_MAX) return std::nullopt;
-  static constexpr uint8_t kBinaryMagic[] = {'b', 'p', 'l', 'i', 's', 't', '0', '0'};
-  if (bytes.size() >= 8 && std::equal(kBinaryMagic, kBinaryMagic + 8, bytes.begin()) &&
-      !binaryStringsAreClean(bytes))
-    return std::nullopt;
+  if (bytes.size() >= binary::kMagicSize &&
+      std::equal(binary::kMagic, binary::kMagic + binary::kMagicSize, bytes.begin()))
+    return parseBinary(bytes);
   ::plist_t root = nullptr;
   plist_from_memory(reinterpret_cast<const char*>(bytes.data()),
                     static_cast<uint32_t>(bytes.size()), &root);
@@ -204,30 +162,16 @@ std::string toXml(const Value& value) {
   return out;
 }
 
-namespace {
-
-Bytes binaryOf(::plist_t node) {
-  PlistPtr root(node);
-  if (!root) return {};
-  char* bin = nullptr;
-  uint32_t len = 0;
-  plist_to_bin(root.get(), &bin, &len);
-  Bytes out(reinterpret_cast<uint8_t*>(bin), reinterpret_cast<uint8_t*>(bin) + len);
-  std::free(bin);
+Bytes toBinary(const Array& array) {
+  Bytes out;
+  BinaryPlistWriter().append(array, out);
   return out;
 }
 
-}  // namespace
-
-Bytes toBinary(const Array& array) {
-  ::plist_t node = plist_new_array();
-  for (const Value& item : array)
-    if (::plist_t child = toPlist(item)) plist_array_append_item(node, child);
-  return binaryOf(node);
-}
-
 Bytes toBinary(const Value& value) {
-  return binaryOf(toPlist(value));
+  Bytes out;
+  BinaryPlistWriter().append(value, out);
+  return out;
 }
 
 std::optional<Value> readFile(const std::string& path) {

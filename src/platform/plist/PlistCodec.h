@@ -1,5 +1,7 @@
-// The one property-list layer: vtc::Value to and from libplist, XML and binary
-// encodings, and property-list files written atomically.
+// The one property-list layer: vtc::Value to and from libplist and XML, binary
+// encodings (through BinaryPlistReader and BinaryPlistWriter, which the
+// changelog's record archives need to be fast), and property-list files
+// written atomically.
 #pragma once
 
 #include <optional>

@@ -1,0 +1,19 @@
+// Reads binary property lists ("bplist00") into values. Every offset, length
+// and reference is checked against the document, nesting is bounded (which
+// also stops reference cycles), and so is the work a document can ask for
+// by referring to one object from many places.
+#pragma once
+
+#include <optional>
+
+#include "VantorSyncManager/Value.h"
+
+namespace vtc::plist {
+
+// The document's top object, or nullopt when the bytes are not a well-formed
+// binary property list. Strings holding a zero character are refused: keys
+// and strings travel on as C strings (XML files, text headers). Null and
+// UID objects read as none values, sets as arrays.
+std::optional<Value> parseBinary(ByteView bytes);
+
+}  // namespace vtc::plist
