@@ -46,34 +46,38 @@ class BodyStream {
   }
 
   // Makes at least n unread bytes available; false when the body ends first.
+  // The body is inflated into one window that is reused: read bytes are
+  // dropped by moving the unread tail to the front.
   bool fill(size_t n) {
-    if (cursor_ > (1 << 20) && cursor_ * 2 > buffer_.size()) {  // drop what was read
-      buffer_.erase(buffer_.begin(), buffer_.begin() + static_cast<std::ptrdiff_t>(cursor_));
+    if (filled_ - cursor_ >= n) return true;
+    if (cursor_ > 0) {
+      std::memmove(window_.data(), window_.data() + cursor_, filled_ - cursor_);
+      filled_ -= cursor_;
       cursor_ = 0;
     }
-    while (buffer_.size() - cursor_ < n && !ended_) {
-      size_t used = buffer_.size();
-      // Grown in bounded steps: a length read from a damaged file must not
-      // allocate more than the body really inflates to.
-      size_t step = std::clamp<size_t>(n - (buffer_.size() - cursor_), 64 * 1024, 16 << 20);
-      buffer_.resize(used + step);
-      z_.next_out = buffer_.data() + used;
-      z_.avail_out = static_cast<uInt>(step);
+    while (filled_ < n && !ended_) {
+      if (filled_ == window_.size()) {
+        // Grown in bounded steps: a length read from a damaged file must not
+        // allocate more than the body really inflates to.
+        window_.resize(window_.size() + std::clamp<size_t>(n - filled_, kWindow, 16 << 20));
+      }
+      z_.next_out = window_.data() + filled_;
+      z_.avail_out = static_cast<uInt>(window_.size() - filled_);
       const uint8_t* before = z_.next_in;
       int ret = inflate(&z_, Z_SYNC_FLUSH);
-      buffer_.resize(used + step - z_.avail_out);
+      filled_ = window_.size() - z_.avail_out;
       consumed_(before, z_.next_in);
       if (ret < 0) corrupt("Failed to unzip changes from clog");
       if (ret != Z_OK) ended_ = true;
     }
-    return buffer_.size() - cursor_ >= n;
+    return filled_ - cursor_ >= n;
   }
 
   std::string readCString() {
-    for (size_t have = 1;; have = buffer_.size() - cursor_ + 1) {
+    for (size_t have = 1;; have = filled_ - cursor_ + 1) {
       if (!fill(have)) corrupt("unterminated record identifier in changelog body");
-      const uint8_t* start = buffer_.data() + cursor_;
-      if (const void* zero = std::memchr(start, 0, buffer_.size() - cursor_)) {
+      const uint8_t* start = window_.data() + cursor_;
+      if (const void* zero = std::memchr(start, 0, filled_ - cursor_)) {
         size_t len = static_cast<const uint8_t*>(zero) - start;
         std::string s(reinterpret_cast<const char*>(start), len);
         cursor_ += len + 1;
@@ -83,15 +87,16 @@ class BodyStream {
   }
 
   uint32_t readUInt32() {
-    fill(4);
-    uint32_t v = NubiloUInt32AtOffset(vtc::ByteView(buffer_).subspan(cursor_), 0);
+    if (!fill(4)) corrupt("record header beyond the end of changelog data");
+    uint32_t v = NubiloUInt32AtOffset(vtc::ByteView(window_.data() + cursor_, 4), 0);
     cursor_ += 4;
     return v;
   }
 
+  // The next n bytes, valid until the next read.
   vtc::ByteView read(size_t n) {
     if (!fill(n)) corrupt("record archive beyond the end of changelog data");
-    vtc::ByteView out(buffer_.data() + cursor_, n);
+    vtc::ByteView out(window_.data() + cursor_, n);
     cursor_ += n;
     return out;
   }
@@ -101,8 +106,10 @@ class BodyStream {
   z_stream z_{};
   bool open_ = false;
   bool ended_ = false;
-  vtc::Bytes buffer_;
-  size_t cursor_ = 0;
+  static constexpr size_t kWindow = 1 << 20;
+  vtc::Bytes window_;
+  size_t filled_ = 0;  // inflated bytes in the window
+  size_t cursor_ = 0;  // next unread byte
 };
 
 std::string failureText(const std::exception& e) {
