@@ -196,8 +196,17 @@ class Reader {
     if (!lengthAt(at, marker & 0x0F, length)) return false;
     const uint8_t* s = p_ + at;
     if ((marker >> 4) == kAsciiString) {
-      if (!fits(at, length) || !spend(length) || std::memchr(s, 0, length)) return false;
-      out.assign(reinterpret_cast<const char*>(s), length);
+      if (!fits(at, length) || !spend(3 * length)) return false;
+      uint8_t high = 0;
+      for (uint64_t i = 0; i < length; ++i) high |= s[i];
+      if (high < 0x80) {
+        out.assign(reinterpret_cast<const char*>(s), length);
+        return true;
+      }
+      // Bytes past ASCII have no agreed meaning here; like malformed text
+      // elsewhere they read as U+FFFD, so every string read is valid UTF-8.
+      out.clear();
+      for (uint64_t i = 0; i < length; ++i) appendUtf8(out, s[i] < 0x80 ? s[i] : 0xFFFD);
       return true;
     }
     if (length > (tableAt_ - at) / 2 || !spend(3 * length)) return false;
@@ -205,7 +214,6 @@ class Reader {
     out.reserve(length);
     for (uint64_t i = 0; i < length; ++i) {
       uint32_t c = static_cast<uint32_t>(s[2 * i] << 8 | s[2 * i + 1]);
-      if (c == 0) return false;
       if (c >= 0xD800 && c <= 0xDFFF) {
         uint32_t next =
             i + 1 < length ? static_cast<uint32_t>(s[2 * i + 2] << 8 | s[2 * i + 3]) : 0;

@@ -11,9 +11,9 @@
 namespace vtc::plist {
 
 // The document's top object, or nullopt when the bytes are not a well-formed
-// binary property list. Strings holding a zero character are refused: keys
-// and strings travel on as C strings (XML files, text headers). Null and
-// UID objects read as none values, sets as arrays.
+// binary property list. Strings are always read as valid UTF-8 (malformed
+// text becomes U+FFFD) and may hold zero characters. Null and UID objects
+// read as none values, sets as arrays.
 std::optional<Value> parseBinary(ByteView bytes);
 
 }  // namespace vtc::plist
