@@ -11,6 +11,7 @@
 #include "support/ApacheShare.h"
 #include "support/FakeTime.h"
 #include "support/FaultProxy.h"
+#include "support/ShareTest.h"
 #include "support/TestHome.h"
 #include "support/TraceCapture.h"
 
@@ -23,24 +24,18 @@ namespace {
 constexpr const char* kRetry = "com.korvo.sync.nubilosession.retrytransaction";
 constexpr const char* kFinal = "com.korvo.sync.nubilosession.retrytransaction.final";
 
-class Faults : public ::testing::Test {
+class Faults : public vtc::test::ShareTest {
  protected:
-  vtc::test::TestHome home;
-  vtc::test::FakeTime time;
-  TraceCapture traces;
-  vtc::test::ApacheShare share;
   FaultProxy proxy{share.port()};
   std::unique_ptr<NubiloRemoteSession> session;
 
   void SetUp() override { session = open("GUID-A"); }
 
   std::unique_ptr<NubiloRemoteSession> open(const std::string& guid, int attempts = 3) {
-    vtc::Dictionary config = share.configuration();
-    config.set("host_port", vtc::Value(proxy.port()));
-    config.set("sync_dav_timeout_seconds", vtc::Value(1));  // neon's smallest time-out
-    config.set("max_lock_acquire_attempts", vtc::Value(attempts));
-    config.set("guid", vtc::Value(guid));
-    return NubiloRemoteSession::sessionWithUsername("alice", "wonderland", config);
+    return openSession(vtc::Dictionary{{"host_port", proxy.port()},
+                                       {"sync_dav_timeout_seconds", 1},  // neon's smallest time-out
+                                       {"max_lock_acquire_attempts", attempts},
+                                       {"guid", guid}});
   }
   std::string schemas() const { return session->schemasPath(); }
   size_t seen(const std::string& method, const std::string& path) const {

@@ -10,6 +10,7 @@
 #include "platform/dav/TesselSession.h"
 #include "support/ApacheShare.h"
 #include "support/FakeTime.h"
+#include "support/ShareTest.h"
 #include "support/TestHome.h"
 #include "support/TraceCapture.h"
 
@@ -17,21 +18,14 @@ using vtc::test::ApacheShare;
 
 namespace {
 
-class Locking : public ::testing::Test {
+class Locking : public vtc::test::ShareTest {
  protected:
-  vtc::test::TestHome home;
-  vtc::test::FakeTime time;
-  vtc::test::TraceCapture traces;
-  ApacheShare share;
-
   std::unique_ptr<NubiloRemoteSession> open(const std::string& guid, const std::string& name,
                                             int attempts = 3) {
-    vtc::Dictionary config = share.configuration();
-    config.set("guid", vtc::Value(guid));
-    config.set("ClientGuid", vtc::Value(guid));
-    config.set("ClientName", vtc::Value(name));
-    config.set("max_lock_acquire_attempts", vtc::Value(attempts));
-    auto s = NubiloRemoteSession::sessionWithUsername("alice", "wonderland", config);
+    vtc::Dictionary overrides = clientOverrides(guid);
+    overrides.set("ClientName", name);
+    overrides.set("max_lock_acquire_attempts", attempts);
+    auto s = openSession(overrides);
     // Registration is a later step; here a client is just its resource.
     s->tesselSession().putData({}, s->clientsPath() + "/" + guid + ".client");
     s->tesselSession().makeCollectionAtPath(s->schemasPath() + "/Contacts", false);

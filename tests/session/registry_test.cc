@@ -15,6 +15,7 @@
 #include "support/ApacheShare.h"
 #include "support/FakeTime.h"
 #include "support/FaultProxy.h"
+#include "support/ShareTest.h"
 #include "support/TestHome.h"
 #include "support/TraceCapture.h"
 
@@ -24,18 +25,10 @@ namespace {
 
 constexpr const char* kNs = "http://nubilo.example/ns/sync/";
 
-class Registry : public ::testing::Test {
+class Registry : public vtc::test::ShareTest {
  protected:
-  vtc::test::TestHome home;
-  vtc::test::FakeTime time;
-  vtc::test::TraceCapture traces;
-  ApacheShare share;
-
   std::unique_ptr<NubiloRemoteSession> open(const std::string& guid) {
-    vtc::Dictionary config = share.configuration();
-    config.set("guid", vtc::Value(guid));
-    config.set("ClientGuid", vtc::Value(guid));
-    return NubiloRemoteSession::sessionWithUsername("alice", "wonderland", config);
+    return openSession(clientOverrides(guid));
   }
 
   // The record of a server path as a second session sees it.

@@ -13,6 +13,7 @@
 #include "platform/dav/TesselSession.h"
 #include "support/ApacheShare.h"
 #include "support/FakeTime.h"
+#include "support/ShareTest.h"
 #include "support/TestHome.h"
 #include "support/TraceCapture.h"
 
@@ -25,13 +26,8 @@ bool isDirectory(const std::string& path) {
   return ::stat(path.c_str(), &st) == 0 && S_ISDIR(st.st_mode);
 }
 
-class SessionSetup : public ::testing::Test {
+class SessionSetup : public vtc::test::ShareTest {
  protected:
-  vtc::test::TestHome home;
-  vtc::test::FakeTime time;
-  vtc::test::TraceCapture traces;
-  ApacheShare share;
-
   std::unique_ptr<NubiloRemoteSession> open(vtc::Dictionary config,
                                             const std::string& password = "wonderland") {
     return NubiloRemoteSession::sessionWithUsername("alice", password, config);
@@ -39,7 +35,7 @@ class SessionSetup : public ::testing::Test {
 };
 
 TEST_F(SessionSetup, CreatesTheSyncAreaAndNotesTheRespondingServer) {
-  auto session = open(share.configuration());
+  auto session = openSession();
   std::string sync = ApacheShare::kSyncPath;
   EXPECT_EQ(session->clientsPath(), sync + "/Clients");
   EXPECT_EQ(session->schemasPath(), sync + "/Schemas");
@@ -51,7 +47,7 @@ TEST_F(SessionSetup, CreatesTheSyncAreaAndNotesTheRespondingServer) {
   EXPECT_TRUE(time.sleeps().empty());
 
   // A second session finds the area in place, and sees it through the share.
-  auto second = open(share.configuration());
+  auto second = openSession();
   EXPECT_TRUE(second->createSyncPaths());
   DavTransaction listing = second->tesselSession().listCollectionAtPath(sync);
   ASSERT_TRUE(listing.isSuccessful());
@@ -138,7 +134,7 @@ TEST_F(SessionSetup, LockOwnerTextQuotesNamesButNotTheClientId) {
 }
 
 TEST_F(SessionSetup, AllRequestsOfASessionShareOneConnection) {
-  auto session = open(share.configuration());
+  auto session = openSession();
   TesselSession& dav = session->tesselSession();
   dav.putData({'x'}, session->clientsPath() + "/probe.client");
   dav.basicAttributesAtPath(session->clientsPath() + "/probe.client");
@@ -160,7 +156,7 @@ TEST_F(SessionSetup, AllRequestsOfASessionShareOneConnection) {
 }
 
 TEST_F(SessionSetup, RemoveSyncPathsDeletesTheArea) {
-  auto session = open(share.configuration());
+  auto session = openSession();
   EXPECT_TRUE(session->removeSyncPaths());
   EXPECT_FALSE(isDirectory(share.diskPath(ApacheShare::kSyncPath)));
   EXPECT_TRUE(isDirectory(share.diskPath("/Library/Application Support")));

@@ -9,6 +9,7 @@
 #include "platform/dav/TesselSession.h"
 #include "support/ApacheShare.h"
 #include "support/FakeTime.h"
+#include "support/ShareTest.h"
 #include "support/TestHome.h"
 #include "support/TraceCapture.h"
 
@@ -21,18 +22,11 @@ constexpr const char* kRetry = "com.korvo.sync.nubilosession.retrytransaction";
 constexpr const char* kCode = "com.korvo.sync.nubilosession.retrytransaction.errorcode";
 constexpr const char* kFinal = "com.korvo.sync.nubilosession.retrytransaction.final";
 
-class Retry : public ::testing::Test {
+class Retry : public vtc::test::ShareTest {
  protected:
-  vtc::test::TestHome home;
-  vtc::test::FakeTime time;
-  TraceCapture traces;
-  ApacheShare share;
   std::unique_ptr<NubiloRemoteSession> session;
 
-  void SetUp() override {
-    vtc::Dictionary config = share.configuration();
-    session = NubiloRemoteSession::sessionWithUsername("alice", "wonderland", config);
-  }
+  void SetUp() override { session = openSession(); }
   std::string schemas() const { return session->schemasPath(); }
 };
 
