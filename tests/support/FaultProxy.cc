@@ -205,7 +205,10 @@ FaultProxy::Decision FaultProxy::decide(const std::string& method, const std::st
   }
   const char* names[] = {"forwarded", "timed out", "dropped", "answered"};
   std::string action = names[static_cast<int>(d.action)];
-  if (d.action == Action::Answer) action += " " + std::to_string(d.status);
+  if (d.action == Action::Answer) {
+    action += ' ';
+    action += std::to_string(d.status);
+  }
   seen_.push_back({method, path, action});
   return d;
 }

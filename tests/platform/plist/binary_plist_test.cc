@@ -105,7 +105,8 @@ TEST(BinaryPlist, WriterReusedAcrossDocumentsKeepsThemApart) {
   vtc::plist::BinaryPlistWriter writer;
   Bytes first, second;
   Array strings;  // enough distinct strings to grow the writer's table
-  for (int i = 0; i < 200; ++i) strings.push_back(Value("s" + std::to_string(i)));
+  for (int i = 0; i < 200; ++i)
+    strings.push_back(Value(std::string("s").append(std::to_string(i))));
   writer.append(Value(strings), first);
   writer.append(Value(Array{Value("s7"), Value("other"), Value("s7")}), second);
   EXPECT_EQ(*vtc::plist::parseBinary(first), Value(strings));
