@@ -38,6 +38,19 @@ void appendUtf8(std::string& out, uint32_t c) {
   }
 }
 
+bool isAscii(const uint8_t* s, size_t length) {
+  // Eight bytes at a time; text is mostly short, so the tail matters too.
+  uint64_t high = 0;
+  size_t i = 0;
+  for (; i + 8 <= length; i += 8) {
+    uint64_t word;
+    std::memcpy(&word, s + i, 8);
+    high |= word;
+  }
+  for (; i < length; ++i) high |= s[i];
+  return (high & 0x8080808080808080ull) == 0;
+}
+
 class Reader {
  public:
   explicit Reader(ByteView bytes)
@@ -120,8 +133,8 @@ class Reader {
       case kSet: {
         uint64_t count;
         if (!lengthAt(at, low, count) || count > (tableAt_ - at) / refWidth_) return false;
-        out = Value(Array(count));
         Array& array = out.mutableArray();
+        array.resize(count);
         for (uint64_t i = 0; i < count; ++i)
           if (!read(refAt(at, i), depth + 1, array[i])) return false;
         return true;
@@ -129,14 +142,15 @@ class Reader {
       case kDictionary: {
         uint64_t count;
         if (!lengthAt(at, low, count) || count > (tableAt_ - at) / refWidth_ / 2) return false;
-        out = Value(Dictionary());
         Dictionary& dictionary = out.mutableDictionary();
         dictionary.reserve(count);
         for (uint64_t i = 0; i < count; ++i) {
-          if (!keyAt(refAt(at, i), key_)) return false;
+          std::string_view key;
+          if (!keyAt(refAt(at, i), key)) return false;
           // A repeated key keeps its first place and its last value.
-          Value& value = dictionary.slot(key_);
-          value = Value();
+          const size_t before = dictionary.size();
+          Value& value = dictionary.slot(key);
+          if (dictionary.size() == before) value = Value();
           if (!read(refAt(at, count + i), depth + 1, value)) return false;
         }
         return true;
@@ -182,13 +196,27 @@ class Reader {
     return true;
   }
 
-  bool keyAt(uint64_t ref, std::string& key) {
+  // A key is read in place when it is plain ASCII, else decoded into key_.
+  bool keyAt(uint64_t ref, std::string_view& key) {
     size_t at;
     if (nodeBudget_ == 0 || !objectAt(ref, at)) return false;
     --nodeBudget_;
     const uint8_t marker = p_[at++];
     const uint8_t kind = marker >> 4;
-    return (kind == kAsciiString || kind == kUtf16String) && stringAt(at, marker, key);
+    if (kind != kAsciiString && kind != kUtf16String) return false;
+    if (kind == kAsciiString) {
+      size_t start = at;
+      uint64_t length;
+      if (!lengthAt(start, marker & 0x0F, length) || !fits(start, length)) return false;
+      if (isAscii(p_ + start, length)) {
+        if (!spend(3 * length)) return false;
+        key = std::string_view(reinterpret_cast<const char*>(p_ + start), length);
+        return true;
+      }
+    }
+    if (!stringAt(at, marker, key_)) return false;
+    key = key_;
+    return true;
   }
 
   bool stringAt(size_t at, uint8_t marker, std::string& out) {
@@ -197,9 +225,7 @@ class Reader {
     const uint8_t* s = p_ + at;
     if ((marker >> 4) == kAsciiString) {
       if (!fits(at, length) || !spend(3 * length)) return false;
-      uint8_t high = 0;
-      for (uint64_t i = 0; i < length; ++i) high |= s[i];
-      if (high < 0x80) {
+      if (isAscii(s, length)) {
         out.assign(reinterpret_cast<const char*>(s), length);
         return true;
       }
