@@ -121,7 +121,6 @@ class VSM_EXPORT Value {
   const Array& array() const;
   const Dictionary& dictionary() const;
   // Each turns a value of another kind into an empty one of its own kind.
-  std::string& mutableString();
   Array& mutableArray();
   Dictionary& mutableDictionary();
 

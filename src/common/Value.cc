@@ -211,11 +211,6 @@ const Dictionary& Value::dictionary() const {
   return d ? *d : kEmptyDictionary;
 }
 
-std::string& Value::mutableString() {
-  if (!std::holds_alternative<std::string>(v_)) v_ = std::string();
-  return std::get<std::string>(v_);
-}
-
 Array& Value::mutableArray() {
   if (!std::holds_alternative<Array>(v_)) v_ = Array();
   return std::get<Array>(v_);

@@ -6,6 +6,7 @@
 
 #include <cstddef>
 #include <cstdint>
+#include <cstring>
 
 namespace vtc::plist::binary {
 
@@ -50,6 +51,20 @@ inline uint64_t readBigEndian(const uint8_t* p, size_t width) {
       return v;
     }
   }
+}
+
+// Whether text fits an ASCII string object (else it is stored as UTF-16).
+// Eight bytes at a time; text is mostly short, so the tail matters too.
+inline bool isAscii(const uint8_t* s, size_t length) {
+  uint64_t high = 0;
+  size_t i = 0;
+  for (; i + 8 <= length; i += 8) {
+    uint64_t word;
+    std::memcpy(&word, s + i, 8);
+    high |= word;
+  }
+  for (; i < length; ++i) high |= s[i];
+  return (high & 0x8080808080808080ull) == 0;
 }
 
 }  // namespace vtc::plist::binary

@@ -38,19 +38,6 @@ void appendUtf8(std::string& out, uint32_t c) {
   }
 }
 
-bool isAscii(const uint8_t* s, size_t length) {
-  // Eight bytes at a time; text is mostly short, so the tail matters too.
-  uint64_t high = 0;
-  size_t i = 0;
-  for (; i + 8 <= length; i += 8) {
-    uint64_t word;
-    std::memcpy(&word, s + i, 8);
-    high |= word;
-  }
-  for (; i < length; ++i) high |= s[i];
-  return (high & 0x8080808080808080ull) == 0;
-}
-
 class Reader {
  public:
   explicit Reader(ByteView bytes)
@@ -125,8 +112,12 @@ class Reader {
         return true;
       }
       case kAsciiString:
-      case kUtf16String:
-        return stringAt(at, marker, out.mutableString());
+      case kUtf16String: {
+        std::string_view text;
+        if (!textAt(at, marker, text)) return false;
+        out = Value(text);
+        return true;
+      }
       case kUid:
         return true;  // archiver references mean nothing here: a none value
       case kArray:
@@ -196,48 +187,39 @@ class Reader {
     return true;
   }
 
-  // A key is read in place when it is plain ASCII, else decoded into key_.
   bool keyAt(uint64_t ref, std::string_view& key) {
     size_t at;
     if (nodeBudget_ == 0 || !objectAt(ref, at)) return false;
     --nodeBudget_;
     const uint8_t marker = p_[at++];
     const uint8_t kind = marker >> 4;
-    if (kind != kAsciiString && kind != kUtf16String) return false;
-    if (kind == kAsciiString) {
-      size_t start = at;
-      uint64_t length;
-      if (!lengthAt(start, marker & 0x0F, length) || !fits(start, length)) return false;
-      if (isAscii(p_ + start, length)) {
-        if (!spend(3 * length)) return false;
-        key = std::string_view(reinterpret_cast<const char*>(p_ + start), length);
-        return true;
-      }
-    }
-    if (!stringAt(at, marker, key_)) return false;
-    key = key_;
-    return true;
+    return (kind == kAsciiString || kind == kUtf16String) && textAt(at, marker, key);
   }
 
-  bool stringAt(size_t at, uint8_t marker, std::string& out) {
+  // The text of the string object whose marker precedes at, as UTF-8: plain
+  // ASCII is viewed in place, anything else decoded into text_. The view
+  // lasts until the next string is read.
+  bool textAt(size_t at, uint8_t marker, std::string_view& text) {
     uint64_t length;
     if (!lengthAt(at, marker & 0x0F, length)) return false;
     const uint8_t* s = p_ + at;
+    std::string& decoded = text_;
     if ((marker >> 4) == kAsciiString) {
       if (!fits(at, length) || !spend(3 * length)) return false;
       if (isAscii(s, length)) {
-        out.assign(reinterpret_cast<const char*>(s), length);
+        text = std::string_view(reinterpret_cast<const char*>(s), length);
         return true;
       }
       // Bytes past ASCII have no agreed meaning here; like malformed text
       // elsewhere they read as U+FFFD, so every string read is valid UTF-8.
-      out.clear();
-      for (uint64_t i = 0; i < length; ++i) appendUtf8(out, s[i] < 0x80 ? s[i] : 0xFFFD);
+      decoded.clear();
+      for (uint64_t i = 0; i < length; ++i) appendUtf8(decoded, s[i] < 0x80 ? s[i] : 0xFFFD);
+      text = decoded;
       return true;
     }
     if (length > (tableAt_ - at) / 2 || !spend(3 * length)) return false;
-    out.clear();
-    out.reserve(length);
+    decoded.clear();
+    decoded.reserve(length);
     for (uint64_t i = 0; i < length; ++i) {
       uint32_t c = static_cast<uint32_t>(s[2 * i] << 8 | s[2 * i + 1]);
       if (c >= 0xD800 && c <= 0xDFFF) {
@@ -250,14 +232,15 @@ class Reader {
           c = 0xFFFD;  // an unpaired surrogate
         }
       }
-      appendUtf8(out, c);
+      appendUtf8(decoded, c);
     }
+    text = decoded;
     return true;
   }
 
   const uint8_t* p_;
   size_t size_;
-  std::string key_;  // the key being read, reused
+  std::string text_;  // decoded text, reused
   uint64_t nodeBudget_;
   uint64_t byteBudget_;
   size_t offsetWidth_ = 0;

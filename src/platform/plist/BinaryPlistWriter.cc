@@ -94,12 +94,6 @@ void toUtf16(std::string_view s, std::vector<uint16_t>& units) {
   }
 }
 
-bool isAscii(const std::string& s) {
-  for (unsigned char c : s)
-    if (c >= 0x80) return false;
-  return true;
-}
-
 }  // namespace
 
 void BinaryPlistWriter::append(const Value& value, Bytes& out) {
@@ -227,21 +221,20 @@ void BinaryPlistWriter::finish(Bytes& out) {
   putBigEndian(out, tableAt, 8);
 }
 
-void BinaryPlistWriter::writeObject(const Object& object, Bytes& out) const {
+void BinaryPlistWriter::writeObject(const Object& object, Bytes& out) {
   switch (object.shape) {
     case Shape::String: {
       const auto& s = *static_cast<const std::string*>(object.source);
-      if (isAscii(s)) {
+      if (isAscii(reinterpret_cast<const uint8_t*>(s.data()), s.size())) {
         putMarker(out, kAsciiString, s.size());
         out.insert(out.end(), s.begin(), s.end());
         return;
       }
-      thread_local std::vector<uint16_t> units;
-      toUtf16(s, units);
-      putMarker(out, kUtf16String, units.size());
+      toUtf16(s, units_);
+      putMarker(out, kUtf16String, units_.size());
       size_t at = out.size();
-      out.resize(at + 2 * units.size());
-      for (uint16_t unit : units) {
+      out.resize(at + 2 * units_.size());
+      for (uint16_t unit : units_) {
         out[at++] = static_cast<uint8_t>(unit >> 8);
         out[at++] = static_cast<uint8_t>(unit);
       }

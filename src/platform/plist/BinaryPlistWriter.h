@@ -42,12 +42,13 @@ class BinaryPlistWriter {
   uint32_t addArray(const Array& array);
   uint32_t addDictionary(const Dictionary& dictionary);
   void growStringTable();
-  void writeObject(const Object& object, Bytes& out) const;
+  void writeObject(const Object& object, Bytes& out);
 
   std::vector<Object> objects_;
   std::vector<uint32_t> refs_;
   std::vector<uint64_t> offsets_;
-  std::vector<Slot> strings_;  // open addressing; slots of older documents count as empty
+  std::vector<uint16_t> units_;  // a non-ASCII string as UTF-16
+  std::vector<Slot> strings_;    // open addressing; slots of older documents count as empty
   uint32_t generation_ = 0;
   size_t stringCount_ = 0;
   size_t refWidth_ = 1;

@@ -18,9 +18,6 @@ namespace vtc::plist {
 
 namespace {
 
-// libplist counts dates from 2001-01-01 00:00:00 UTC.
-constexpr int64_t kPlistEpochOffset = binary::kEpochOffsetSeconds;
-
 struct PlistFree {
   void operator()(::plist_t p) const { plist_free(p); }
 };
@@ -50,7 +47,7 @@ using PlistPtr = std::unique_ptr<void, PlistFree>;
         usec += 1000000;
         sec -= 1;
       }
-      return plist_new_date(static_cast<int32_t>(sec - kPlistEpochOffset),
+      return plist_new_date(static_cast<int32_t>(sec - binary::kEpochOffsetSeconds),
                             static_cast<int32_t>(usec));
     }
     case Value::Kind::Data: {
@@ -102,7 +99,8 @@ Value fromPlist(::plist_t node) {
     case PLIST_DATE: {
       int32_t sec = 0, usec = 0;
       plist_get_date_val(node, &sec, &usec);
-      auto us = std::chrono::microseconds((int64_t{sec} + kPlistEpochOffset) * 1000000 + usec);
+      auto us =
+          std::chrono::microseconds((int64_t{sec} + binary::kEpochOffsetSeconds) * 1000000 + usec);
       return Value(Date(std::chrono::duration_cast<Date::duration>(us)));
     }
     case PLIST_DATA: {
