@@ -1,32 +1,21 @@
 #include "support/ApacheShare.h"
 
-#include "support/Processes.h"
-
-#include <arpa/inet.h>
-#include <fcntl.h>
-#include <netinet/in.h>
 #include <openssl/evp.h>
 #include <pwd.h>
-#include <signal.h>
-#include <sys/prctl.h>
-#include <sys/socket.h>
 #include <sys/stat.h>
 #include <sys/wait.h>
 #include <unistd.h>
 
-#include <chrono>
 #include <cstdlib>
 #include <filesystem>
 #include <fstream>
+#include <iterator>
 #include <sstream>
 #include <stdexcept>
 #include <thread>
-#include <vector>
+#include <utility>
 
 namespace vtc::test {
-
-const char* const ApacheShare::kSyncPath = "/Library/Application Support/SyncWorks";
-const char* const ApacheShare::kSyncNamespace = "http://nubilo.example/ns/sync/";
 
 namespace {
 
@@ -48,46 +37,24 @@ void writeFile(const std::string& path, const std::string& text) {
   if (!out) throw std::runtime_error("cannot write " + path);
 }
 
-bool canConnect(int port) {
-  int fd = ::socket(AF_INET, SOCK_STREAM, 0);
-  sockaddr_in addr{};
-  addr.sin_family = AF_INET;
-  addr.sin_port = htons(static_cast<uint16_t>(port));
-  addr.sin_addr.s_addr = htonl(INADDR_LOOPBACK);
-  bool ok = ::connect(fd, reinterpret_cast<sockaddr*>(&addr), sizeof addr) == 0;
-  ::close(fd);
-  return ok;
-}
-
 // Started as root, Apache's workers run as www-data: hand them their folders.
 void giveToWorkers(const std::string& path) {
-  if (::geteuid() != 0) return;
-  if (const passwd* pw = getpwnam("www-data")) {
-    for (auto& entry : std::filesystem::recursive_directory_iterator(path))
-      (void)::chown(entry.path().c_str(), pw->pw_uid, pw->pw_gid);
-    (void)::chown(path.c_str(), pw->pw_uid, pw->pw_gid);
-  }
+  const passwd* pw = ::geteuid() == 0 ? getpwnam("www-data") : nullptr;
+  if (!pw) return;
+  for (auto& entry : std::filesystem::recursive_directory_iterator(path))
+    (void)::chown(entry.path().c_str(), pw->pw_uid, pw->pw_gid);
+  (void)::chown(path.c_str(), pw->pw_uid, pw->pw_gid);
 }
 
 }  // namespace
 
 int freeLoopbackPort() {
-  int fd = ::socket(AF_INET, SOCK_STREAM, 0);
-  sockaddr_in addr{};
-  addr.sin_family = AF_INET;
-  addr.sin_addr.s_addr = htonl(INADDR_LOOPBACK);
-  addr.sin_port = 0;
-  ::bind(fd, reinterpret_cast<sockaddr*>(&addr), sizeof addr);
-  socklen_t len = sizeof addr;
-  ::getsockname(fd, reinterpret_cast<sockaddr*>(&addr), &len);
-  int port = ntohs(addr.sin_port);
-  ::close(fd);
+  int port = 0;
+  ::close(listenLoopback(port));
   return port;
 }
 
-ApacheShare::ApacheShare() : ApacheShare(Options{}) {}
-
-ApacheShare::ApacheShare(Options options) : options_(std::move(options)) {
+ApacheShare::ApacheShare(Options options) : options_(options) {
   char tmpl[] = "/tmp/vsm-dav-XXXXXX";
   if (!mkdtemp(tmpl)) throw std::runtime_error("mkdtemp failed");
   root_ = tmpl;
@@ -96,9 +63,21 @@ ApacheShare::ApacheShare(Options options) : options_(std::move(options)) {
   for (const char* dir : {"/dav", "/var", "/logs", "/run"})
     std::filesystem::create_directories(root_ + dir);
   writeConfiguration();
-  giveToWorkers(documentRoot_);
-  giveToWorkers(root_ + "/var");
-  start();
+  giveToWorkers(root_);
+
+  pid_ = startProcess({kApache, "-f", root_ + "/httpd.conf", "-DFOREGROUND"});
+  bool listening = waitUntil([&] {
+    if (::waitpid(pid_, nullptr, WNOHANG) == pid_) pid_ = -1;  // it gave up
+    int fd = pid_ < 0 ? -1 : connectLoopback(port_);
+    if (fd >= 0) ::close(fd);
+    return pid_ < 0 || fd >= 0;
+  });
+  if (pid_ < 0 || !listening) {
+    stop();
+    std::ifstream log(root_ + "/logs/error.log");
+    throw std::runtime_error("apache2 did not start: " +
+                             std::string(std::istreambuf_iterator<char>(log), {}));
+  }
 }
 
 ApacheShare::~ApacheShare() {
@@ -109,7 +88,7 @@ ApacheShare::~ApacheShare() {
 
 void ApacheShare::writeConfiguration() {
   port_ = freeLoopbackPort();
-  writeFile(root_ + "/htpasswd", shaPasswordLine(options_.user, options_.password));
+  writeFile(root_ + "/htpasswd", shaPasswordLine(kUser, kPassword));
   std::ostringstream c;
   c << "ServerRoot " << root_ << "\n"
     << "ServerName 127.0.0.1\n"
@@ -134,9 +113,9 @@ void ApacheShare::writeConfiguration() {
   if (::geteuid() == 0) c << "User www-data\nGroup www-data\n";
   c << "StartServers 1\nServerLimit 1\nThreadsPerChild 16\nMaxRequestWorkers 16\n"
     << "KeepAlive On\nMaxKeepAliveRequests 0\nKeepAliveTimeout 60\nTimeout 30\n"
-    << "LogFormat \"%a %{remote}p %m \\\"%U\\\" %>s\" share\n"
+    << "LogFormat \"%{remote}p %m %>s\" share\n"
     << "CustomLog " << root_ << "/logs/access.log share\n"
-    << "Header always set X-Responding-Server \"" << options_.respondingServer << "\"\n"
+    << "Header always set X-Responding-Server \"dav-test-1\"\n"
     << "DavLockDB " << root_ << "/var/DavLock\n"
     << "DocumentRoot " << documentRoot_ << "\n"
     << "<Directory " << documentRoot_ << ">\n"
@@ -155,52 +134,15 @@ void ApacheShare::writeConfiguration() {
 void ApacheShare::makeCertificates() {
   std::string dir = root_ + "/tls";
   std::filesystem::create_directories(dir);
-  std::string script =
-      "cd '" + dir +
-      "' && "
+  const char* commands =
       "openssl req -x509 -newkey rsa:2048 -nodes -days 2 -subj '/CN=Share Test Authority' "
       "-keyout ca.key -out ca.pem && "
       "openssl req -newkey rsa:2048 -nodes -subj '/CN=127.0.0.1' -keyout server.key "
-      "-out server.csr && "
-      "printf 'subjectAltName=IP:127.0.0.1\\n' > ext.cnf && "
+      "-out server.csr && printf 'subjectAltName=IP:127.0.0.1\\n' > ext.cnf && "
       "openssl x509 -req -in server.csr -CA ca.pem -CAkey ca.key -CAcreateserial -days 2 "
       "-extfile ext.cnf -out server.pem";
-  if (std::system((script + " >/dev/null 2>&1").c_str()) != 0)
+  if (std::system(("exec >/dev/null 2>&1 && cd '" + dir + "' && " + commands).c_str()) != 0)
     throw std::runtime_error("could not make test certificates");
-}
-
-void ApacheShare::start() {
-  std::string conf = root_ + "/httpd.conf";
-  pid_ = ::fork();
-  if (pid_ == 0) {
-    // A test process that dies without its destructors takes the server along.
-    ::prctl(PR_SET_PDEATHSIG, SIGTERM);
-    int devnull = ::open("/dev/null", O_RDWR);
-    ::dup2(devnull, 0);
-    ::dup2(devnull, 1);
-    ::dup2(devnull, 2);
-    ::execl(kApache, kApache, "-f", conf.c_str(), "-DFOREGROUND", static_cast<char*>(nullptr));
-    ::_exit(127);
-  }
-  // Ready when the port answers; give up after ten seconds.
-  for (int i = 0; i < 1000; ++i) {
-    if (canConnect(port_)) return;
-    int status = 0;
-    if (::waitpid(pid_, &status, WNOHANG) == pid_) {
-      pid_ = -1;
-      std::ifstream log(root_ + "/logs/error.log");
-      std::stringstream text;
-      text << log.rdbuf();
-      throw std::runtime_error("apache2 exited at start: " + text.str());
-    }
-    std::this_thread::sleep_for(std::chrono::milliseconds(10));
-  }
-  stop();
-  throw std::runtime_error("apache2 did not start listening");
-}
-
-void ApacheShare::stop() {
-  stopProcess(pid_);
 }
 
 void ApacheShare::forgetLocks() {
@@ -209,23 +151,19 @@ void ApacheShare::forgetLocks() {
       std::filesystem::remove(entry.path());
 }
 
-std::string ApacheShare::diskPath(const std::string& serverPath) const {
-  return documentRoot_ + serverPath;
-}
-
 Dictionary ApacheShare::configuration() const {
   return Dictionary{
       {"host_scheme", Value(options_.tls ? "https" : "http")},
       {"host_name", Value("127.0.0.1")},
       {"host_port", Value(port_)},
       {"sync_path", Value(kSyncPath)},
-      {"sync_namespace", Value(kSyncNamespace)},
+      {"sync_namespace", Value("http://nubilo.example/ns/sync/")},
       {"sync_dav_timeout_seconds", Value(5)},
       {"lock_duration_seconds", Value(240)},
       {"max_lock_acquire_attempts", Value(3)},
       {"lock_acquire_sleep_seconds", Value(4)},
       {"user_agent", Value("VantorClient/-/-/488")},
-      {"Name", Value(options_.user)},
+      {"Name", Value(kUser)},
       {"guid", Value("11111111-2222-3333-4444-555555555555")},
       {"ClientGuid", Value("11111111-2222-3333-4444-555555555555")},
       {"ClientName", Value("Test Machine")},
@@ -237,27 +175,15 @@ std::vector<AccessEntry> ApacheShare::accessEntries() const {
   // stops growing (a few milliseconds) before reading it.
   std::string path = root_ + "/logs/access.log";
   std::error_code ignored;
-  uintmax_t size = std::filesystem::file_size(path, ignored);
-  for (int i = 0; i < 10; ++i) {
+  uintmax_t size = std::filesystem::file_size(path, ignored), before = -1;
+  for (int i = 0; i < 10 && size != before; ++i) {
     std::this_thread::sleep_for(std::chrono::milliseconds(15));
-    uintmax_t now = std::filesystem::file_size(path, ignored);
-    if (now == size) break;
-    size = now;
+    before = std::exchange(size, std::filesystem::file_size(path, ignored));
   }
   std::vector<AccessEntry> out;
   std::ifstream in(path);
-  for (std::string line; std::getline(in, line);) {
-    // 127.0.0.1 54321 PROPFIND "/path with spaces" 207
-    AccessEntry e;
-    std::istringstream s(line);
-    std::string address;
-    s >> address >> e.clientPort >> e.method;
-    size_t open = line.find('"'), close = line.rfind('"');
-    if (open == std::string::npos || close <= open) continue;
-    e.path = line.substr(open + 1, close - open - 1);
-    e.status = std::atoi(line.c_str() + close + 1);
-    out.push_back(e);
-  }
+  // A line a request: client port, method, status ("54321 PUT 201").
+  for (AccessEntry e; in >> e.clientPort >> e.method >> e.status;) out.push_back(e);
   return out;
 }
 

@@ -11,28 +11,25 @@
 #include <vector>
 
 #include "VantorSyncManager/Value.h"
+#include "support/Processes.h"
 
 namespace vtc::test {
 
 struct AccessEntry {
   int clientPort = 0;
   std::string method;
-  std::string path;  // decoded URL path
   int status = 0;
 };
 
 class ApacheShare {
  public:
   struct Options {
-    std::string user = "alice";
-    std::string password = "wonderland";
-    std::string respondingServer = "dav-test-1";
     // Serve HTTPS with a certificate from a private authority; caFile()
     // then names that authority's certificate.
     bool tls = false;
   };
 
-  ApacheShare();
+  ApacheShare() : ApacheShare(Options{}) {}
   explicit ApacheShare(Options options);
   ~ApacheShare();
   ApacheShare(const ApacheShare&) = delete;
@@ -40,11 +37,10 @@ class ApacheShare {
 
   int port() const { return port_; }
   pid_t pid() const { return pid_; }
-  const Options& options() const { return options_; }
   // The folder on disk that the share serves.
   const std::string& documentRoot() const { return documentRoot_; }
   // The disk path of a server path.
-  std::string diskPath(const std::string& serverPath) const;
+  std::string diskPath(const std::string& serverPath) const { return documentRoot_ + serverPath; }
 
   // The certificate of the authority that signed a TLS share's certificate.
   std::string caFile() const { return root_ + "/tls/ca.pem"; }
@@ -58,17 +54,17 @@ class ApacheShare {
 
   // Stops the server (by PID) before the end of the test: later requests
   // find nothing listening.
-  void stop();
+  void stop() { stopProcess(pid_); }
   // Makes the server forget every lock it holds, as a lock that timed out.
   void forgetLocks();
 
-  static const char* const kSyncPath;
-  static const char* const kSyncNamespace;
+  static constexpr const char* kUser = "alice";
+  static constexpr const char* kPassword = "wonderland";
+  static constexpr const char* kSyncPath = "/Library/Application Support/SyncWorks";
 
  private:
   void writeConfiguration();
   void makeCertificates();
-  void start();
 
   Options options_;
   std::string root_;

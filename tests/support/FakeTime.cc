@@ -26,9 +26,9 @@ void FakeTime::advanceOnEveryReading(Seconds step) {
 }
 
 void FakeTime::sleepFor(Seconds duration) {
+  advance(duration);
   std::lock_guard<std::mutex> lock(mutex_);
   sleeps_.push_back(duration.count());
-  now_ += std::chrono::duration_cast<Date::duration>(duration);
 }
 
 void FakeTime::advance(Seconds duration) {

@@ -6,8 +6,6 @@
 // Rules and records may be touched from any thread while the proxy serves.
 #pragma once
 
-#include <atomic>
-#include <memory>
 #include <mutex>
 #include <string>
 #include <thread>
@@ -36,11 +34,13 @@ class FaultProxy {
 
   int port() const { return port_; }
 
-  void timeOut(Match match);
-  void dropConnection(Match match);
-  // Answers with this status and body instead of forwarding; a 401 carries a
-  // Basic challenge, a body that starts with "<?xml" is sent as XML.
-  void answer(Match match, int status, std::string body = {});
+  void timeOut(Match match) { add({std::move(match), "timed out"}); }
+  void dropConnection(Match match) { add({std::move(match), "dropped"}); }
+  // Answers with this status and no body instead of forwarding; a 401
+  // carries a Basic challenge.
+  void answer(Match match, int status) {
+    add({std::move(match), "answered " + std::to_string(status), status});
+  }
   void clear();
 
   std::vector<Seen> requests() const;
@@ -48,29 +48,23 @@ class FaultProxy {
   size_t count(const std::string& method) const;
 
  private:
-  enum class Action { Forward, TimeOut, Drop, Answer };
   struct Rule {
     Match match;
-    Action action;
-    int status = 0;
-    std::string body;
-    int seen = 0;
-  };
-  struct Decision {
-    Action action = Action::Forward;
-    int status = 0;
-    std::string body;
+    std::string action = "forwarded";
+    int status = 0;  // of an answer
+    int seen = 0;    // matching requests so far
   };
 
-  void acceptLoop();
+  void add(Rule rule);
+  // The rule that applies to the request at the start of pending (a
+  // forwarding one if none does).
+  Rule decide(const std::string& pending);
   void serve(int client);
-  Decision decide(const std::string& method, const std::string& path);
 
   int targetPort_;
   int port_ = 0;
   int listener_ = -1;
-  int wake_[2] = {-1, -1};
-  std::atomic<bool> stopping_{false};
+  int wake_ = -1;  // readable once the proxy stops; every poll() watches it
   mutable std::mutex mutex_;
   std::vector<Rule> rules_;
   std::vector<Seen> seen_;

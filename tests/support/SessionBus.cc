@@ -1,17 +1,12 @@
 #include "support/SessionBus.h"
 
-#include <fcntl.h>
-#include <signal.h>
-#include <sys/prctl.h>
 #include <sys/stat.h>
-#include <sys/wait.h>
 #include <systemd/sd-bus.h>
-#include <unistd.h>
 
 #include <cstdlib>
 #include <filesystem>
 #include <stdexcept>
-#include <thread>
+#include <utility>
 
 #include "platform/bus/DistributedNotifications.h"
 #include "support/Processes.h"
@@ -22,15 +17,15 @@ namespace {
 
 bool nameHasOwner(const char* name) {
   sd_bus* bus = nullptr;
-  if (sd_bus_open_user(&bus) < 0) return false;
   sd_bus_message* reply = nullptr;
   int has = 0;
-  int r = sd_bus_call_method(bus, "org.freedesktop.DBus", "/org/freedesktop/DBus",
-                             "org.freedesktop.DBus", "NameHasOwner", nullptr, &reply, "s", name);
-  if (r >= 0) sd_bus_message_read(reply, "b", &has);
+  if (sd_bus_open_user(&bus) >= 0 &&
+      sd_bus_call_method(bus, "org.freedesktop.DBus", "/org/freedesktop/DBus",
+                         "org.freedesktop.DBus", "NameHasOwner", nullptr, &reply, "s", name) >= 0)
+    sd_bus_message_read(reply, "b", &has);
   sd_bus_message_unref(reply);
   sd_bus_flush_close_unref(bus);
-  return r >= 0 && has;
+  return has;
 }
 
 }  // namespace
@@ -39,27 +34,15 @@ SessionBus::SessionBus() {
   char tmpl[] = "/tmp/vsm-bus-XXXXXX";
   if (!mkdtemp(tmpl)) throw std::runtime_error("mkdtemp failed");
   dir_ = tmpl;
-  std::string socket = dir_ + "/bus";
-  address_ = "unix:path=" + socket;
-  busPid_ = ::fork();
-  if (busPid_ == 0) {
-    ::prctl(PR_SET_PDEATHSIG, SIGTERM);  // gone with a test process that crashes
-    int devnull = ::open("/dev/null", O_RDWR);
-    ::dup2(devnull, 0);
-    ::dup2(devnull, 1);
-    ::dup2(devnull, 2);
-    ::execlp("dbus-daemon", "dbus-daemon", "--session", "--nofork", "--nopidfile",
-             ("--address=" + address_).c_str(), static_cast<char*>(nullptr));
-    ::_exit(127);
-  }
-  for (int i = 0; i < 500 && !std::filesystem::exists(socket); ++i)
-    std::this_thread::sleep_for(std::chrono::milliseconds(10));
-  if (!std::filesystem::exists(socket)) {
+  std::string address = "unix:path=" + dir_ + "/bus";
+  busPid_ =
+      startProcess({"dbus-daemon", "--session", "--nofork", "--nopidfile", "--address=" + address});
+  if (!waitUntil([&] { return std::filesystem::exists(dir_ + "/bus"); })) {
     stopProcess(busPid_);
     throw std::runtime_error("dbus-daemon did not start");
   }
   if (const char* a = std::getenv("DBUS_SESSION_BUS_ADDRESS")) previousAddress_ = a;
-  ::setenv("DBUS_SESSION_BUS_ADDRESS", address_.c_str(), 1);
+  ::setenv("DBUS_SESSION_BUS_ADDRESS", address.c_str(), 1);
 }
 
 SessionBus::~SessionBus() {
@@ -75,65 +58,36 @@ SessionBus::~SessionBus() {
 
 void SessionBus::startKeyring() {
   std::string data = dir_ + "/data", runtime = dir_ + "/run";
-  std::filesystem::create_directories(data);
-  std::filesystem::create_directories(runtime);
-  ::chmod(runtime.c_str(), 0700);
-  int input[2];
-  if (::pipe(input) != 0) throw std::runtime_error("pipe failed");
-  keyringPid_ = ::fork();
-  if (keyringPid_ == 0) {
-    ::prctl(PR_SET_PDEATHSIG, SIGTERM);
-    // Its keyrings live in the bus's folder, not in the real home.
-    ::setenv("HOME", dir_.c_str(), 1);
-    ::setenv("XDG_DATA_HOME", data.c_str(), 1);
-    ::setenv("XDG_RUNTIME_DIR", runtime.c_str(), 1);
-    ::dup2(input[0], 0);
-    ::close(input[1]);
-    int devnull = ::open("/dev/null", O_RDWR);
-    ::dup2(devnull, 1);
-    ::dup2(devnull, 2);
-    ::execlp("gnome-keyring-daemon", "gnome-keyring-daemon", "--foreground", "--components=secrets",
-             "--unlock", static_cast<char*>(nullptr));
-    ::_exit(127);
-  }
-  ::close(input[0]);
-  const char password[] = "test-keyring-password";
-  (void)!::write(input[1], password, sizeof password - 1);
-  ::close(input[1]);
-  for (int i = 0; i < 500; ++i) {
-    if (nameHasOwner("org.freedesktop.secrets")) return;
-    std::this_thread::sleep_for(std::chrono::milliseconds(10));
-  }
-  throw std::runtime_error("gnome-keyring-daemon did not start");
+  ::mkdir(data.c_str(), 0700);
+  ::mkdir(runtime.c_str(), 0700);
+  // Its keyrings live in the bus's folder, not in the real home.
+  keyringPid_ =
+      startProcess({"env", "HOME=" + dir_, "XDG_DATA_HOME=" + data, "XDG_RUNTIME_DIR=" + runtime,
+                    "gnome-keyring-daemon", "--foreground", "--components=secrets", "--unlock"},
+                   "test-keyring-password");
+  if (!waitUntil([] { return nameHasOwner("org.freedesktop.secrets"); }))
+    throw std::runtime_error("gnome-keyring-daemon did not start");
 }
 
 NotificationListener::NotificationListener() {
   sd_bus* bus = nullptr;
   if (sd_bus_open_user(&bus) < 0) throw std::runtime_error("no session bus");
   bus_ = bus;
-  std::string match = std::string("type='signal',interface='") + bus::kNotificationInterface +
-                      "',member='" + bus::kNotificationMember + "'";
-  sd_bus_slot* slot = nullptr;
-  sd_bus_add_match(bus, &slot, match.c_str(),
-                   reinterpret_cast<sd_bus_message_handler_t>(&NotificationListener::onSignal),
-                   this);
-  slot_ = slot;
-  // Make sure the match is installed before anything is posted.
-  sd_bus_call_method(bus, "org.freedesktop.DBus", "/org/freedesktop/DBus",
-                     "org.freedesktop.DBus.Peer", "Ping", nullptr, nullptr, "");
+  // The match is in place when this returns, so no later signal is missed;
+  // it lives as long as the connection.
+  auto onSignal = [](sd_bus_message* message, void* self, sd_bus_error*) {
+    const char *name = nullptr, *object = nullptr, *info = nullptr;
+    if (sd_bus_message_read(message, "sss", &name, &object, &info) >= 0)
+      static_cast<NotificationListener*>(self)->received_.push_back({name, object, info});
+    return 0;
+  };
+  if (sd_bus_match_signal(bus, nullptr, nullptr, nullptr, bus::kNotificationInterface,
+                          bus::kNotificationMember, onSignal, this) < 0)
+    throw std::runtime_error("cannot listen for notifications");
 }
 
 NotificationListener::~NotificationListener() {
-  sd_bus_slot_unref(static_cast<sd_bus_slot*>(slot_));
   sd_bus_flush_close_unref(static_cast<sd_bus*>(bus_));
-}
-
-int NotificationListener::onSignal(void* message, void* userdata, void*) {
-  auto* self = static_cast<NotificationListener*>(userdata);
-  const char *name = nullptr, *object = nullptr, *info = nullptr;
-  if (sd_bus_message_read(static_cast<sd_bus_message*>(message), "sss", &name, &object, &info) >= 0)
-    self->received_.push_back({name, object, info});
-  return 0;
 }
 
 std::vector<NotificationListener::Received> NotificationListener::waitFor(
@@ -141,13 +95,10 @@ std::vector<NotificationListener::Received> NotificationListener::waitFor(
   auto* bus = static_cast<sd_bus*>(bus_);
   auto deadline = std::chrono::steady_clock::now() + wait;
   while (received_.empty() && std::chrono::steady_clock::now() < deadline) {
-    int r = sd_bus_process(bus, nullptr);
-    if (r > 0) continue;
+    if (sd_bus_process(bus, nullptr) > 0) continue;
     sd_bus_wait(bus, 20000);
   }
-  auto out = std::move(received_);
-  received_.clear();
-  return out;
+  return std::exchange(received_, {});
 }
 
 }  // namespace vtc::test

@@ -20,13 +20,11 @@ class SessionBus {
   SessionBus(const SessionBus&) = delete;
   SessionBus& operator=(const SessionBus&) = delete;
 
-  const std::string& address() const { return address_; }
   // Starts gnome-keyring-daemon's secrets component on this bus, unlocked.
   void startKeyring();
 
  private:
   std::string dir_;
-  std::string address_;
   std::optional<std::string> previousAddress_;
   pid_t busPid_ = -1;
   pid_t keyringPid_ = -1;
@@ -44,9 +42,7 @@ class NotificationListener {
   std::vector<Received> waitFor(std::chrono::milliseconds wait);
 
  private:
-  static int onSignal(void* message, void* userdata, void* error);
-  void* bus_ = nullptr;
-  void* slot_ = nullptr;
+  void* bus_ = nullptr;  // an sd_bus
   std::vector<Received> received_;
 };
 

@@ -5,7 +5,7 @@ namespace vtc::test {
 std::unique_ptr<NubiloRemoteSession> ShareTest::openSession(const Dictionary& overrides) const {
   Dictionary config = share.configuration();
   config.merge(overrides);
-  return NubiloRemoteSession::sessionWithUsername(share.options().user, share.options().password,
+  return NubiloRemoteSession::sessionWithUsername(ApacheShare::kUser, ApacheShare::kPassword,
                                                   config);
 }
 

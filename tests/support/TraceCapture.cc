@@ -20,10 +20,9 @@ std::vector<MessageTraceRecord> TraceCapture::records() const {
 }
 
 std::vector<MessageTraceRecord> TraceCapture::withDomain(const std::string& domain) const {
-  std::vector<MessageTraceRecord> out;
-  for (const auto& r : records())
-    if (field(r, "COM_KORVO_MESSAGE_DOMAIN") == domain) out.push_back(r);
-  return out;
+  auto all = records();
+  std::erase_if(all, [&](const auto& r) { return field(r, "COM_KORVO_MESSAGE_DOMAIN") != domain; });
+  return all;
 }
 
 std::string TraceCapture::field(const MessageTraceRecord& record, const std::string& key) {
