@@ -1,0 +1,400 @@
+// NubiloRemoteSession against a real share behind a fault-injecting proxy:
+// requests with retry, locking between clients, the dataclass and client
+// registries as whole scenarios (the server's state checked through a second
+// session), and what the session does when the server or network misbehaves.
+#include <gmock/gmock.h>
+
+#include <algorithm>
+#include <filesystem>
+#include <set>
+
+#include "VantorSyncManager/NubiloException.h"
+#include "VantorSyncManager/PublicNames.h"
+#include "VantorSyncManager/VTCPrefsCenter.h"
+#include "platform/dav/TesselSession.h"
+#include "support/FaultProxy.h"
+#include "support/ShareTest.h"
+
+using testing::StartsWith;
+using testing::ThrowsMessage;
+using vtc::test::TraceCapture;
+
+namespace {
+
+constexpr const char* kRetry = "com.korvo.sync.nubilosession.retrytransaction";
+constexpr const char* kCode = "com.korvo.sync.nubilosession.retrytransaction.errorcode";
+constexpr const char* kFinal = "com.korvo.sync.nubilosession.retrytransaction.final";
+
+class ShareBehindProxy : public vtc::test::ShareTest {
+ protected:
+  vtc::test::FaultProxy proxy{share.port()};
+  std::unique_ptr<NubiloRemoteSession> session = open("GUID-A", "Alice's Mac");
+  const std::string schemas = session->schemasPath();
+
+  // A client's session, through the proxy.
+  std::unique_ptr<NubiloRemoteSession> open(const std::string& guid, const std::string& name,
+                                            int attempts = 3) {
+    vtc::Dictionary overrides = clientOverrides(guid);
+    overrides.merge({{"host_port", proxy.port()},
+                     {"ClientName", name},
+                     {"max_lock_acquire_attempts", attempts}});
+    return openSession(overrides);
+  }
+
+  // How many requests of this method on this path the proxy saw.
+  size_t seen(const std::string& method, const std::string& path) const {
+    auto all = proxy.requests();
+    return std::count_if(all.begin(), all.end(),
+                         [&](const auto& s) { return s.method == method && s.path == path; });
+  }
+  // A field of the nth trace record of a domain.
+  std::string field(const char* domain, size_t n, const std::string& key) const {
+    return TraceCapture::field(traces.withDomain(domain).at(n), key);
+  }
+  // The sync-namespace record of a server path, as session s sees it.
+  vtc::Dictionary recordAt(NubiloRemoteSession& s, const std::string& path) {
+    DavTransaction t = s.tesselSession()._issuePropFindAtPath(path, 0, {});
+    vtc::Dictionary record;
+    if (!t.isSuccessful()) return record;
+    const std::string& ns = s.syncNamespace();
+    for (const auto& [name, value] : t.result().dictionary().begin()->second.dictionary())
+      if (name.starts_with(ns)) record.set(name.substr(ns.size()), value);
+    return record;
+  }
+};
+using Retry = ShareBehindProxy;
+using Locking = ShareBehindProxy;
+using Registry = ShareBehindProxy;
+
+TEST_F(Retry, ATimeOutIsTriedOnceMoreAndTheSecondAnswerReturnedEvenANetworkFailure) {
+  // Waits a second for an answer, neon's smallest time-out.
+  auto quick = openSession({{"host_port", proxy.port()}, {"sync_dav_timeout_seconds", 1}});
+  std::string path = schemas + "/x.clog";
+  proxy.timeOut({"PUT", path, 1});
+  proxy.dropConnection({"PUT", path, 0});
+  EXPECT_EQ(quick->putDataWithRetry({'x'}, path).errorType(), kNBNetworkError);
+  EXPECT_EQ(seen("PUT", path), 2u);
+  EXPECT_TRUE(time.sleeps().empty());
+  // A retry report of two records tied together and to the session; no final one.
+  quick->messageTraceTransactionFailure(DavTransaction(), true, 0, "no request, no records");
+  ASSERT_EQ(traces.records().size(), 2u);
+  EXPECT_EQ(field(kRetry, 0, "COM_KORVO_MESSAGE_SIGNATURE"), "PUT");
+  EXPECT_EQ(field(kRetry, 0, "COM_KORVO_MESSAGE_VALUE"), "0");
+  EXPECT_EQ(field(kRetry, 0, "COM_KORVO_MESSAGE_RESULT"), "noop");
+  EXPECT_EQ(field(kRetry, 0, "COM_KORVO_MESSAGE_EVENT"), quick->eventUUID());
+  EXPECT_EQ(field(kCode, 0, "COM_KORVO_MESSAGE_SIGNATURE"), "kNBTimeoutError");
+  EXPECT_EQ(field(kCode, 0, "COM_KORVO_MESSAGE_SIGNATURE2"), "");  // no status
+  EXPECT_EQ(field(kRetry, 0, "COM_KORVO_MESSAGE_UUID"), field(kCode, 0, "COM_KORVO_MESSAGE_UUID"));
+}
+
+TEST_F(Retry, OnlyAMissingDownloadWaitsAndIsTriedAgainOtherFailuresAreReturnedAtOnce) {
+  std::string full = schemas + "/full.clog";
+  proxy.answer({"PUT", full, 0}, 507);
+  DavTransaction t = session->putDataWithRetry({'x'}, full);
+  EXPECT_EQ(t.errorType(), kNBInsufficientStorage);
+  EXPECT_EQ(t.httpStatusCode(), 507);
+  EXPECT_EQ(seen("PUT", full), 1u);
+  std::string missing = schemas + "/missing/";
+  t = session->_issuePropFindWithRetryAtPath(missing, kDAVZeroDepth, {});
+  EXPECT_EQ(t.httpStatusCode(), 404);
+  EXPECT_EQ(seen("PROPFIND", missing), 1u);
+  std::string a = schemas + "/a.clog";
+  std::string b = schemas + "/b.clog";
+  session->putDataWithRetry({'1'}, a);
+  session->putDataWithRetry({'2'}, b);
+  t = session->moveResourceWithRetryAtPath(a, b, /*allowingOverwrite=*/false);
+  EXPECT_FALSE(t.isSuccessful());
+  EXPECT_EQ(t.httpStatusCode(), 412);
+  EXPECT_TRUE(session->moveResourceWithRetryAtPath(a, b).isSuccessful());
+  EXPECT_TRUE(traces.records().empty());
+  EXPECT_TRUE(time.sleeps().empty());
+
+  EXPECT_EQ(session->getDataWithRetryAtPath(schemas + "/00001.clog").httpStatusCode(), 404);
+  EXPECT_EQ(time.sleeps(), std::vector<double>{30});
+  ASSERT_EQ(traces.withDomain(kRetry).size(), 2u);
+  EXPECT_EQ(field(kRetry, 1, "COM_KORVO_MESSAGE_VALUE"), "1");
+  ASSERT_EQ(traces.withDomain(kFinal).size(), 1u);
+  EXPECT_EQ(field(kFinal, 0, "MESSAGE"), "Failed to get data");
+  session->getDataWithRetryAtPath(schemas + "/00002.clog", std::nullopt, 0, 0, std::nullopt);
+  EXPECT_EQ(time.sleeps(), (std::vector<double>{30, 2}));
+}
+
+TEST_F(Retry, AServerThatWentAwayRaisesANetworkFailure) {
+  auto direct = openSession();  // the proxy would still be listening
+  share.stop();
+  EXPECT_THAT([&] { direct->putDataWithRetry({'x'}, schemas + "/00001.clog"); },
+              ThrowsMessage<NubiloException>(StartsWith(
+                  "NubiloNetworkFailureException: putData transaction failed due to network "
+                  "error, <")));
+  ASSERT_EQ(traces.withDomain(kFinal).size(), 1u);
+  EXPECT_EQ(field(kFinal, 0, "COM_KORVO_MESSAGE_SIGNATURE"), "Raised Exception");
+  EXPECT_EQ(field(kFinal, 0, "COM_KORVO_MESSAGE_RESULT"), "failure");
+  EXPECT_EQ(field(kFinal, 0, "COM_KORVO_MESSAGE_UUID"), field(kRetry, 0, "COM_KORVO_MESSAGE_UUID"));
+  EXPECT_EQ(field(kCode, 0, "COM_KORVO_MESSAGE_SIGNATURE"), "kNBNetworkError");
+  EXPECT_TRUE(time.sleeps().empty());
+}
+
+TEST_F(Locking, AContenderWaitsOutItsAttemptsAndLearnsWhoHoldsTheLock) {
+  auto b = open("GUID-B", "Bob's Mac");
+  session->tesselSession().makeCollectionAtPath(schemas + "/Contacts", false);
+  session->lockDataclass("Contacts");
+  size_t locks = proxy.count("LOCK");
+  try {
+    b->lockDataclass("Contacts");
+    FAIL() << "no exception";
+  } catch (const NubiloException& e) {
+    EXPECT_EQ(e.name(), NubiloLockFailureException);
+    EXPECT_EQ(e.reason(), "Failed to lock resource, " + schemas + "/Contacts/");
+    const vtc::Array& holders = e.userInfo().get("DAV:lockdiscovery").array();
+    ASSERT_EQ(holders.size(), 1u) << e.userInfo().description();
+    EXPECT_EQ(holders[0].dictionary().get("clientid").string(), "GUID-A");
+    EXPECT_EQ(holders[0].dictionary().get("clientname").string(), "Alice's Mac");
+  }
+  EXPECT_EQ(proxy.count("LOCK") - locks, 4u);  // max attempts + 1
+  // Pauses that never shrink, and never pass the ceiling.
+  std::vector<double> pauses = time.sleeps();
+  ASSERT_EQ(pauses.size(), 3u);
+  EXPECT_TRUE(std::is_sorted(pauses.begin(), pauses.end()));
+  EXPECT_LE(pauses.back(), 90.0);
+  ASSERT_EQ(traces.withDomain(kRetry).size(), 3u);
+  for (size_t i = 0; i < 3; ++i)
+    EXPECT_EQ(field(kRetry, i, "COM_KORVO_MESSAGE_VALUE"), std::to_string(i));
+  EXPECT_TRUE(traces.withDomain(kFinal).empty());
+  EXPECT_TRUE(b->lockedResources().empty());
+
+  // Once the holder lets go, the contender gets the lock at once.
+  session->unlockDataclass("Contacts");
+  EXPECT_TRUE(session->lockedResources().empty());
+  b->lockDataclass("Contacts");
+  EXPECT_EQ(time.sleeps().size(), 3u);
+  EXPECT_EQ(b->lockedResources(), std::set<std::string>{schemas + "/Contacts/"});
+}
+
+TEST_F(Locking, WithNoRetriesOneRefusalFailsAtOnceAndAReleasedSessionUnlocksWhatItHeld) {
+  auto b = open("GUID-B", "Bob's Mac", /*attempts=*/0);
+  session->tesselSession().putData({}, session->clientsPath() + "/GUID-A.client");
+  session->lockClient();
+  session->lockDataclasses();
+  EXPECT_EQ(session->lockedResources(),
+            (std::set<std::string>{session->clientsPath() + "/GUID-A.client", schemas + "/"}));
+  size_t locks = proxy.count("LOCK");
+  EXPECT_THROW(b->lockClient("GUID-A"), NubiloException);
+  EXPECT_EQ(proxy.count("LOCK") - locks, 1u);
+  EXPECT_TRUE(time.sleeps().empty());
+  EXPECT_TRUE(traces.records().empty());
+  session.reset();
+  b->lockClient("GUID-A");
+  b->lockDataclasses();
+  EXPECT_EQ(b->lockedResources().size(), 2u);
+}
+
+TEST_F(Locking, LocksOnMissingOrForgottenResourcesFail) {
+  EXPECT_THAT([&] { session->lockClient("NOBODY"); },
+              ThrowsMessage<NubiloException>("NubiloClientRegistrationException: Attempting to "
+                                             "lock a client that doesn't exist, NOBODY"));
+  EXPECT_THAT([&] { session->lockDataclass("Unregistered"); },
+              ThrowsMessage<NubiloException>(StartsWith("NubiloResourceNotFoundException: ")));
+  EXPECT_TRUE(time.sleeps().empty());
+  EXPECT_EQ(traces.withDomain(kFinal).size(), 2u);
+  session->unlockClient("NOBODY");  // logged, never raised
+
+  // A lock the server forgot, as one that timed out, can be neither renewed
+  // nor released.
+  session->tesselSession().makeCollectionAtPath(schemas + "/Contacts", false);
+  session->lockDataclass("Contacts");
+  session->relockDataclass("Contacts");
+  share.forgetLocks();
+  EXPECT_THAT(
+      [&] { session->relockDataclass("Contacts"); },
+      ThrowsMessage<NubiloException>("NubiloRelockFailureException: Failed to relock resource, " +
+                                     schemas + "/Contacts/"));
+  ASSERT_EQ(traces.withDomain(kFinal).size(), 3u);
+  EXPECT_EQ(field(kFinal, 2, "MESSAGE"), "Failed to relock resource");
+  session->unlockDataclass("Contacts");
+  EXPECT_EQ(session->lockedResources().size(), 1u);  // kept for the release to try again
+}
+
+TEST_F(Locking, ALockCutOffIsRaisedAfterOnePauseAndAFailedUnlockIsKeptForTheRelease) {
+  const std::string target = schemas + "/Contacts/";
+  session->tesselSession().makeCollectionAtPath(schemas + "/Contacts", false);
+  proxy.answer({"LOCK", target, 1}, 423);
+  proxy.dropConnection({"LOCK", target, 0});
+  EXPECT_THAT(
+      [&] { session->lockDataclass("Contacts"); },
+      ThrowsMessage<NubiloException>(StartsWith(
+          "NubiloNetworkFailureException: Lock transaction failed due to network error, ")));
+  EXPECT_EQ(time.sleeps().size(), 1u);
+  ASSERT_EQ(traces.withDomain(kFinal).size(), 1u);
+  EXPECT_EQ(field(kRetry, 1, "COM_KORVO_MESSAGE_VALUE"), "1");
+
+  // An unlock is tried twice at once.
+  proxy.clear();
+  session->lockDataclass("Contacts");
+  proxy.answer({"UNLOCK", target, 0}, 500);
+  session->unlockDataclass("Contacts");
+  EXPECT_EQ(seen("UNLOCK", target), 2u);
+  EXPECT_EQ(session->lockedResources().count(target), 1u);
+  EXPECT_EQ(time.sleeps().size(), 1u);
+  proxy.clear();
+  session.reset();  // the release tries once more, and gets through
+  EXPECT_EQ(seen("UNLOCK", target), 3u);
+  EXPECT_EQ(proxy.requests().back().action, "forwarded");
+}
+
+TEST_F(Registry, ADataclassFromUnregisteredToPopulatedToResetToGone) {
+  const std::string dc = "com.korvo.Contacts";
+  NubiloRemoteSession& a = *session;
+  auto observer = open("GUID-OBSERVER", "Observer");
+  std::string collection = schemas + "/" + dc + "/";
+
+  EXPECT_TRUE(recordAt(*observer, collection).empty());
+  EXPECT_THAT(a.getDataclassInfo(dc).keys(),  // registers it
+              testing::UnorderedElementsAre("DAV:getetag", "dataclassname", "displayname"));
+  EXPECT_EQ(recordAt(*observer, collection).get("dataclassname").string(), dc);
+  EXPECT_EQ(a.dataclassNames(), std::vector<std::string>{dc});
+  EXPECT_TRUE(a.validPropertiesForDataclass(dc));
+
+  a.lockDataclass(dc);
+  for (uint8_t i = 1; i <= 3; ++i)
+    ASSERT_TRUE(
+        a.tesselSession().putData({'c', i}, a.changeLogPathForDataclass(dc, i)).isSuccessful());
+  a.tesselSession().putData({'x'}, collection + "00004.clog.tmp");
+  a.setInfoForDataclass(vtc::Dictionary{{"minversion", "00001"}, {"maxversion", "00003"}}, dc);
+  EXPECT_EQ(a.changeLogVersionsForDataclass(dc),
+            (std::vector<std::string>{"00001", "00002", "00003"}));
+  EXPECT_TRUE(a.validPropertiesForDataclass(dc));
+  EXPECT_EQ(a.calculateStorageConsumedForDataclass(dc), 7);
+  EXPECT_EQ(recordAt(*observer, collection).get("maxversion").string(), "00003");
+
+  // An incoherent record is found and repaired from the files present.
+  a.setInfoForDataclass(vtc::Dictionary{{"maxversion", "00005"}}, dc);
+  EXPECT_FALSE(a.validPropertiesForDataclass(dc));
+  a.setInfoForDataclass(a.calculatePropertiesForDataclass(dc), dc);
+  EXPECT_TRUE(a.validPropertiesForDataclass(dc));
+
+  // Fast reset: the collection goes to the trash in one move, and every
+  // client but the resetter is told it needs the truth.
+  for (const char* guid : {"GUID-A", "GUID-B", "GUID-C"}) a.registerClient(guid, guid);
+  a.setInfoForClient(vtc::Dictionary{{dc + ".version", "7"}, {dc + ".status", "normal"}}, "GUID-B");
+  a.resetDataclass(dc);
+  vtc::Dictionary afterReset = recordAt(*observer, collection);
+  EXPECT_FALSE(afterReset.contains("minversion"));
+  EXPECT_FALSE(afterReset.contains("maxversion"));
+  EXPECT_FALSE(afterReset.contains("status"));
+  EXPECT_TRUE(a.changeLogVersionsForDataclass(dc).empty());
+  EXPECT_EQ(proxy.count("MOVE"), 1u);
+  std::string trash = share.diskPath("/Web/.Temporary Web Resources/SyncWorks/Trash");
+  EXPECT_EQ(std::distance(std::filesystem::directory_iterator(trash), {}), 1);
+  EXPECT_TRUE(a.lockedResources().count(collection));
+  EXPECT_EQ(a.getClientInfo("GUID-B").get(dc + ".status").string(), "needstruth");
+  EXPECT_FALSE(a.getClientInfo("GUID-B").contains(dc + ".version"));
+  EXPECT_EQ(a.getClientInfo("GUID-C").get(dc + ".status").string(), "needstruth");
+  EXPECT_FALSE(a.getClientInfo("GUID-A").contains(dc + ".status"));
+  // Statuses already in place cost only the relock, the listing and the reads.
+  a.lockClients();
+  size_t sent = proxy.requests().size();
+  size_t patches = proxy.count("PROPPATCH");
+  a.setOtherClientStatus("needstruth", dc);
+  EXPECT_EQ(proxy.count("PROPPATCH"), patches);
+  EXPECT_EQ(proxy.requests().size() - sent, 4u);  // relock, listing, two reads
+  a.unlockClients();
+
+  a.unlockDataclass(dc);
+  EXPECT_TRUE(a.unregisterDataclass(dc));
+  EXPECT_TRUE(recordAt(*observer, collection).empty());
+  EXPECT_TRUE(a.getAllDataclassInfo().empty());
+  EXPECT_TRUE(a.lockedResources().empty());
+}
+
+TEST_F(Registry, ClientsRegisterAndABrokenRecordIsCleanedUp) {
+  auto& a = session;
+  auto b = open("GUID-B", "Bob's Mac");
+  auto c = open("GUID-C", "Carol's Mac");
+  EXPECT_TRUE(a->registerClient("GUID-A", "Alice's \x07Mac"));
+  EXPECT_TRUE(b->registerClient("GUID-B", "Bob's Mac"));
+  EXPECT_TRUE(c->registerClient("GUID-C", "Carol's Mac"));
+  EXPECT_THROW(a->registerClient("GUID-A", "again"), NubiloException);
+
+  vtc::Dictionary record = b->getClientInfo("GUID-A");
+  EXPECT_EQ(record.get("clientname").string(), "Alice's Mac");
+  EXPECT_EQ(record.get("classname").string(), "bramble");
+  EXPECT_EQ(record.get("buildversion").string(), "VantorSyncClient-488.5");
+  EXPECT_EQ(VTCPrefsCenter::defaultCenter().clientGuid(), "GUID-C");  // the last to register here
+
+  // Carol's record loses its name: listed once more, then removed.
+  c->setInfoForClient(vtc::Dictionary{{"clientname", kNBRemoveProp}}, "GUID-C");
+  EXPECT_EQ(a->getAllClientInfo().size(), 3u);
+  EXPECT_FALSE(std::filesystem::exists(share.diskPath(a->clientsPath() + "/GUID-C.client")));
+  EXPECT_EQ(a->getAllClientInfo().size(), 2u);
+  EXPECT_THAT([&] { a->getClientInfo("GUID-C"); },
+              ThrowsMessage<NubiloException>(StartsWith("NubiloClientRegistrationException: ")));
+  EXPECT_TRUE(b->unregisterClient("GUID-B"));
+  EXPECT_EQ(a->getAllClientInfo().size(), 1u);
+}
+
+TEST_F(Registry, ARefusedMoveMakesTheResetDeleteChangelogByChangelogRenewingItsLocks) {
+  std::string dc = "Contacts";
+  session->getDataclassInfo(dc);
+  session->lockDataclass(dc);
+  for (int i = 3; i <= 8; ++i)
+    session->tesselSession().putData({'c'}, session->changeLogPathForDataclass(dc, i));
+  session->setInfoForDataclass(vtc::Dictionary{{"minversion", "00003"}, {"maxversion", "00008"}},
+                               dc);
+  proxy.answer({"MOVE", schemas + "/" + dc, 0}, 500);
+  size_t locksBefore = proxy.count("LOCK");
+  time.advanceOnEveryReading(vtc::Seconds(50));  // each step takes long: renewals are due
+  session->resetDataclass(dc);
+  time.advanceOnEveryReading(vtc::Seconds(0));
+
+  EXPECT_TRUE(session->changeLogVersionsForDataclass(dc).empty());
+  for (int i = 3; i <= 8; ++i)
+    EXPECT_EQ(seen("DELETE", session->changeLogPathForDataclass(dc, i)), 1u) << i;
+  vtc::Dictionary record = session->getDataclassInfo(dc);
+  EXPECT_FALSE(record.contains("minversion"));
+  EXPECT_FALSE(record.contains("maxversion"));
+  // Renewals of the dataclass and clients locks beside the fresh locks taken.
+  EXPECT_GT(proxy.count("LOCK") - locksBefore, 4u);
+  EXPECT_TRUE(session->lockedResources().count(schemas + "/" + dc + "/"));
+  ASSERT_EQ(traces.withDomain(kRetry).size(), 1u);
+  EXPECT_EQ(field(kRetry, 0, "MESSAGE"), "Failed to move dataclass aside for reset");
+  EXPECT_EQ(field(kCode, 0, "COM_KORVO_MESSAGE_SIGNATURE2"), "500");
+}
+
+TEST_F(Registry, RegistrationWaitsOutAuthorizationFailuresAndRecordReadsNameTheAccountsTrouble) {
+  std::string client = session->clientsPath() + "/GUID-B.client";
+  proxy.answer({"PROPFIND", client, 0}, 401);
+  EXPECT_TRUE(session->registerClient("GUID-B", "Bob"));
+  EXPECT_EQ(time.sleeps(), (std::vector<double>{30, 30, 30}));
+  ASSERT_EQ(traces.withDomain(kFinal).size(), 1u);
+  EXPECT_EQ(field(kFinal, 0, "MESSAGE"), "Failed to get basic attributes on Client");
+  proxy.clear();
+  EXPECT_EQ(session->getClientInfo("GUID-B").get("clientname").string(), "Bob");
+
+  for (auto [status, name] : {std::pair{402, "NubiloAccountExpiredException: "},
+                              {508, "NubiloAccountMigratedException: "},
+                              {500, "NubiloTransactionFailureException: "}}) {
+    proxy.clear();
+    proxy.answer({"PROPFIND", client, 0}, status);
+    EXPECT_THAT([&] { session->getClientInfo("GUID-B"); },
+                ThrowsMessage<NubiloException>(StartsWith(name)))
+        << status;
+  }
+  proxy.clear();
+  proxy.answer({"PROPFIND", schemas + "/Contacts/", 0}, 402);
+  EXPECT_THAT([&] { session->getDataclassInfo("Contacts"); },
+              ThrowsMessage<NubiloException>(StartsWith("NubiloAccountExpiredException: ")));
+  proxy.answer({"DELETE", client, 0}, 500);
+  EXPECT_FALSE(session->unregisterClient("GUID-B"));
+}
+
+TEST_F(Registry, EntityTagsCompareWithoutTheWeakPrefix) {
+  std::string tag = session->getDataclassInfo("Contacts").get("DAV:getetag").string();
+  ASSERT_FALSE(tag.empty());
+  std::string bare = tag.starts_with("W/") ? tag.substr(2) : tag;
+  EXPECT_FALSE(session->eTagChangedForDataclass("Contacts", bare));
+  EXPECT_FALSE(session->eTagChangedForDataclass("Contacts", "W/" + bare));
+  EXPECT_TRUE(session->eTagChangedForDataclass("Contacts", "\"something-else\""));
+  EXPECT_TRUE(session->eTagChangedForDataclass("Unknown", "eTagNotFound"));  // find failed
+}
+
+}  // namespace
