@@ -11,17 +11,15 @@
 
 namespace {
 
-TEST(DistributedNotifications, ReachListenersOnTheSessionBus) {
+TEST(DistributedNotifications, ReachListenersOnTheSessionBusAndFailQuietlyWithoutOne) {
   vtc::test::SessionBus bus;
   vtc::test::NotificationListener listener;
   ASSERT_TRUE(vtc::bus::postDistributedNotification("com.korvo.VantorSync.lastSyncDateChanged"));
   ASSERT_TRUE(vtc::bus::postDistributedNotification("NubiloSyncProgressNotification", "Contacts",
                                                     vtc::Dictionary{{"NubiloSyncProgressKey", 0}}));
-  auto got = listener.waitFor(std::chrono::milliseconds(500));
-  if (got.size() < 2) {
-    auto more = listener.waitFor(std::chrono::milliseconds(500));
-    got.insert(got.end(), more.begin(), more.end());
-  }
+  std::vector<vtc::test::NotificationListener::Received> got;
+  for (int i = 0; i < 5 && got.size() < 2; ++i)
+    for (auto& r : listener.waitFor(std::chrono::milliseconds(200))) got.push_back(r);
   ASSERT_EQ(got.size(), 2u);
   EXPECT_EQ(got[0].name, "com.korvo.VantorSync.lastSyncDateChanged");
   EXPECT_EQ(got[0].object, "");
@@ -31,17 +29,11 @@ TEST(DistributedNotifications, ReachListenersOnTheSessionBus) {
       reinterpret_cast<const uint8_t*>(got[1].information.data()), got[1].information.size()));
   ASSERT_TRUE(info);
   EXPECT_EQ(info->dictionary().get("NubiloSyncProgressKey").integer(), 0);
-}
 
-TEST(DistributedNotifications, WithoutABusNothingFails) {
-  const char* previous = std::getenv("DBUS_SESSION_BUS_ADDRESS");
-  std::string keep = previous ? previous : "";
+  // With no bus to reach, posting fails without throwing (the SessionBus puts
+  // the address back when it goes).
   ::setenv("DBUS_SESSION_BUS_ADDRESS", "unix:path=/nonexistent/bus", 1);
   EXPECT_FALSE(vtc::bus::postDistributedNotification("anything"));
-  if (previous)
-    ::setenv("DBUS_SESSION_BUS_ADDRESS", keep.c_str(), 1);
-  else
-    ::unsetenv("DBUS_SESSION_BUS_ADDRESS");
 }
 
 TEST(CredentialStore, FindsWhatTheSecretServiceHolds) {

@@ -46,34 +46,6 @@ TEST(Multistatus, KeepsSuccessfulPropertiesOfEveryResponseByUnescapedPath) {
   EXPECT_EQ(entries[1].path, "/Sync/My Folder/a+b.clog");
 }
 
-TEST(Multistatus, LockDiscoveryGivesTheOwnerRecordWhole) {
-  std::string longName(400, 'n');
-  Parsed doc(R"(<D:multistatus xmlns:D="DAV:"><D:response><D:href>/c/</D:href><D:propstat><D:prop>
-<D:lockdiscovery><D:activelock><D:locktype><D:write/></D:locktype><D:lockscope><D:exclusive/></D:lockscope>
-<D:depth>0</D:depth><D:owner><SY:synclockinfo xmlns:SY='http://nubilo.example/ns/sync/'>
-<SY:lock-user>alice</SY:lock-user><SY:clientid>G-1</SY:clientid><SY:clientname>)" +
-             longName + R"(</SY:clientname>
-<SY:acquiredate>2026-11-22 10:00:00 +0000</SY:acquiredate></SY:synclockinfo></D:owner>
-<D:timeout>Second-240</D:timeout><D:locktoken><D:href>opaquelocktoken:abc</D:href></D:locktoken>
-</D:activelock></D:lockdiscovery></D:prop><D:status>HTTP/1.1 200 OK</D:status></D:propstat>
-</D:response></D:multistatus>)");
-  ASSERT_TRUE(doc.ok);
-  auto entries = vtc::readMultistatus(*doc.builder.root());
-  ASSERT_EQ(entries.size(), 1u);
-  ASSERT_NE(entries[0].lockDiscovery, nullptr);
-  vtc::Array locks = vtc::readActiveLocks(*entries[0].lockDiscovery);
-  ASSERT_EQ(locks.size(), 1u);
-  const vtc::Dictionary& lock = locks[0].dictionary();
-  EXPECT_EQ(lock.get("clientname").string(), longName);
-  EXPECT_EQ(lock.get("clientid").string(), "G-1");
-  EXPECT_EQ(lock.get("token").string(), "opaquelocktoken:abc");
-  EXPECT_EQ(lock.get("scope").string(), "exclusive");
-  EXPECT_EQ(lock.get("timeout").string(), "Second-240");
-  EXPECT_NE(
-      lock.get("owner").string().find("<synclockinfo xmlns=\"http://nubilo.example/ns/sync/\">"),
-      std::string::npos);
-}
-
 TEST(Multistatus, HostileDocumentsAreRefusedOrIgnored) {
   std::string deep = "<a>";
   for (int i = 0; i < 100000; ++i) deep += "<b>";

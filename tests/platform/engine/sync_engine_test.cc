@@ -1,7 +1,7 @@
 // The embedded sync engine: two local clients and the network client
 // exchanging changes, conflicts, resets, bad input, and two processes
 // pushing at once.
-#include <gtest/gtest.h>
+#include <gmock/gmock.h>
 
 #include <sys/wait.h>
 #include <unistd.h>
@@ -20,6 +20,8 @@ using vtc::Array;
 using vtc::Dictionary;
 using vtc::Value;
 using vtc::engine::SyncEngine;
+using Changes = std::vector<SyncEngineChange>;
+using ::testing::HasSubstr;
 
 namespace {
 
@@ -29,6 +31,10 @@ Value set(const std::string& name, Value v) {
 Value clear(const std::string& name) {
   return Value(Dictionary{{"action", "clear"}, {"name", name}});
 }
+// A modify of record r1 setting its name.
+Changes renamed(const std::string& name) {
+  return {SyncEngineChange(2, "r1", Array{set("name", Value(name))})};
+}
 
 class Engine : public ::testing::Test {
  protected:
@@ -37,8 +43,11 @@ class Engine : public ::testing::Test {
   std::string path = home.path() + "/engine.sqlite";
   std::unique_ptr<SyncEngine> engine = SyncEngine::open(path);
 
+  void push(const std::string& client, Changes changes) {
+    engine->push(client, "Contacts", std::move(changes));
+  }
   // Pulls and acknowledges, as a client does after applying the changes.
-  std::vector<SyncEngineChange> sync(const std::string& client) {
+  Changes sync(const std::string& client) {
     auto r = engine->pull(client, "Contacts");
     engine->acknowledge(client, "Contacts", r.anchor);
     return r.changes;
@@ -46,123 +55,94 @@ class Engine : public ::testing::Test {
 };
 
 TEST_F(Engine, ClientsExchangeCoalescedChangesButNeverTheirOwn) {
-  engine->push(
-      "app.a", "Contacts",
-      {SyncEngineChange(1, "r1", Array{set("name", Value("Ann")), set("age", Value(30))})});
+  SyncEngineChange ann(1, "r1", Array{set("name", Value("Ann")), set("age", Value(30))});
+  push("app.a", {ann});
   EXPECT_TRUE(sync("app.a").empty());  // its own change
-  auto b = sync("app.b");
-  ASSERT_EQ(b.size(), 1u);
-  EXPECT_EQ(b[0],
-            SyncEngineChange(1, "r1", Array{set("name", Value("Ann")), set("age", Value(30))}));
+  EXPECT_EQ(sync("app.b"), Changes{ann});
 
   // Two edits by A arrive at B as one change, the later value winning.
-  engine->push("app.a", "Contacts", {SyncEngineChange(2, "r1", Array{set("name", Value("Anna"))})});
-  engine->push("app.a", "Contacts",
-               {SyncEngineChange(2, "r1", Array{set("name", Value("Annie")), clear("age")})});
-  EXPECT_EQ(sync("app.b"), (std::vector<SyncEngineChange>{SyncEngineChange(
-                               2, "r1", Array{set("name", Value("Annie")), clear("age")})}));
+  push("app.a", renamed("Anna"));
+  SyncEngineChange annie(2, "r1", Array{set("name", Value("Annie")), clear("age")});
+  push("app.a", {annie});
+  EXPECT_EQ(sync("app.b"), Changes{annie});
 
   // The network client, never synced, gets the record as it is now.
-  EXPECT_EQ(sync("net"), (std::vector<SyncEngineChange>{
-                             SyncEngineChange(1, "r1", Array{set("name", Value("Annie"))})}));
+  EXPECT_EQ(sync("net"), Changes{SyncEngineChange(1, "r1", Array{set("name", Value("Annie"))})});
 
   // What the network client brings in reaches both local clients.
-  engine->push("net", "Contacts", {SyncEngineChange(3, "r1", Array{})});
-  EXPECT_EQ(sync("app.a"), (std::vector<SyncEngineChange>{SyncEngineChange(3, "r1", Array{})}));
-  EXPECT_EQ(sync("app.b"), (std::vector<SyncEngineChange>{SyncEngineChange(3, "r1", Array{})}));
+  SyncEngineChange gone(3, "r1", Array{});
+  push("net", {gone});
+  EXPECT_EQ(sync("app.a"), Changes{gone});
+  EXPECT_EQ(sync("app.b"), Changes{gone});
   // A record added and deleted between two pulls never shows.
-  engine->push("app.a", "Contacts", {SyncEngineChange(1, "tmp", Array{set("x", Value(1))})});
-  engine->push("app.a", "Contacts", {SyncEngineChange(3, "tmp", Array{})});
+  push("app.a", {SyncEngineChange(1, "tmp", Array{set("x", Value(1))})});
+  push("app.a", {SyncEngineChange(3, "tmp", Array{})});
   EXPECT_TRUE(sync("app.b").empty());
 }
 
 TEST_F(Engine, ConflictingEditsAreSettledByPushTimeThenClientAndLogged) {
   vtc::prefs::PreferenceStore::shared().setValue(
       "LoggingLevel", Value("info"), "com.korvo.VantorSync", vtc::prefs::Scope::AnyHost);
-  engine->push("app.a", "Contacts", {SyncEngineChange(1, "r1", Array{set("name", Value("Ann"))})});
-  sync("app.b");
-  sync("net");
+  push("app.a", {SyncEngineChange(1, "r1", Array{set("name", Value("Ann"))})});
+  for (auto client : {"app.b", "net"}) sync(client);
   // B and the network client both change the name before pulling again.
   time.advance(vtc::Seconds(1));
-  engine->push("app.b", "Contacts", {SyncEngineChange(2, "r1", Array{set("name", Value("Bee"))})});
+  push("app.b", renamed("Bee"));
   time.advance(vtc::Seconds(1));
-  engine->push("net", "Contacts", {SyncEngineChange(2, "r1", Array{set("name", Value("Net"))})});
-  EXPECT_EQ(engine->pull("app.a", "Contacts").changes[0].changes()[0], set("name", Value("Net")));
+  push("net", renamed("Net"));
+  EXPECT_EQ(sync("app.a"), renamed("Net"));
 
   // Same push time: the greater client identifier wins, whichever pushes last.
-  sync("app.a");
-  sync("app.b");
-  sync("net");
+  for (auto client : {"app.b", "net"}) sync(client);
   time.advance(vtc::Seconds(1));
-  engine->push("app.b", "Contacts", {SyncEngineChange(2, "r1", Array{set("name", Value("B2"))})});
-  engine->push("app.a", "Contacts", {SyncEngineChange(2, "r1", Array{set("name", Value("A2"))})});
-  auto toNet = engine->pull("net", "Contacts").changes;
-  ASSERT_EQ(toNet.size(), 1u);
-  EXPECT_EQ(toNet[0].changes()[0], set("name", Value("B2")));
+  push("app.b", renamed("B2"));
+  push("app.a", renamed("A2"));
+  EXPECT_EQ(sync("net"), renamed("B2"));
 
-  std::ifstream log(vtc::log::logFilePath());
-  std::stringstream text;
-  text << log.rdbuf();
-  EXPECT_NE(text.str().find("Conflict on name of record r1 in Contacts: kept Net from net, "
-                            "dropped Bee from app.b"),
-            std::string::npos)
-      << text.str();
+  std::stringstream log;
+  log << std::ifstream(vtc::log::logFilePath()).rdbuf();
+  EXPECT_THAT(log.str(), HasSubstr("Conflict on name of record r1 in Contacts: kept Net from net, "
+                                   "dropped Bee from app.b"));
 }
 
-TEST_F(Engine, AResetClientGetsTheWholeTruthAsAdds) {
-  engine->push("app.a", "Contacts",
-               {SyncEngineChange(1, "r1", Array{set("n", Value(1))}),
-                SyncEngineChange(1, "r2", Array{set("n", Value(2))})});
+TEST_F(Engine, ResetsBadInputAndOddChanges) {
+  // A reset client gets the whole truth as adds, once.
+  push("app.a", {SyncEngineChange(1, "r1", Array{set("n", Value(1))}),
+                 SyncEngineChange(1, "r2", Array{set("n", Value(2))})});
   sync("net");
-  engine->push("app.a", "Contacts", {SyncEngineChange(2, "r2", Array{set("n", Value(3))})});
+  push("app.a", {SyncEngineChange(2, "r2", Array{set("n", Value(3))})});
   engine->resetClient("net", "Contacts");
   auto truth = sync("net");
   ASSERT_EQ(truth.size(), 2u);
   for (const auto& c : truth) EXPECT_EQ(c.type(), 1u);
   EXPECT_TRUE(sync("net").empty());
-}
 
-TEST_F(Engine, BadInputIsRefusedWholeAndOddChangesAreMadeSense) {
-  EXPECT_THROW(engine->push("app.a", "Contacts",
-                            {SyncEngineChange(1, "good", Array{set("n", Value(1))}),
-                             SyncEngineChange(1, "bad", Array{set("n", Value())})}),
+  // Bad input is refused whole.
+  sync("app.b");
+  EXPECT_THROW(push("app.a", {SyncEngineChange(1, "good", Array{set("n", Value(1))}),
+                              SyncEngineChange(1, "bad", Array{set("n", Value())})}),
                std::invalid_argument);
-  EXPECT_TRUE(sync("app.b").empty());  // nothing of that push was applied
-  engine->push("app.a", "Contacts",
-               {SyncEngineChange(2, "unknown", Array{set("n", Value(1))}),  // becomes an add
-                SyncEngineChange(3, "never-seen", Array{})});               // ignored
-  EXPECT_EQ(
-      sync("app.b"),
-      (std::vector<SyncEngineChange>{SyncEngineChange(1, "unknown", Array{set("n", Value(1))})}));
+  EXPECT_TRUE(sync("app.b").empty());
+  push("app.a", {SyncEngineChange(2, "unknown", Array{set("n", Value(1))}),  // becomes an add
+                 SyncEngineChange(3, "never-seen", Array{})});               // ignored
+  EXPECT_EQ(sync("app.b"), Changes{SyncEngineChange(1, "unknown", Array{set("n", Value(1))})});
 }
 
-TEST_F(Engine, ClientRecordsSchemasAndSyncPlans) {
-  engine->registerClient("com.korvo.VantorSync", Dictionary{{"Type", "server"}});
-  engine->setObjectForKey("com.korvo.VantorSync", "lastSuccessSync", Value(time.now()));
-  EXPECT_EQ(engine->objectForKey("com.korvo.VantorSync", "lastSuccessSync").date(), time.now());
-  engine->setShouldSynchronize("com.korvo.VantorSync", true, {"app", "peer"});
-  EXPECT_TRUE(engine->objectForKey("com.korvo.VantorSync", "SynchronizeWithClientTypes")
-                  .dictionary()
-                  .get("peer")
-                  .boolean());
-  EXPECT_THROW(engine->objectForKey("nobody", "x"), vtc::engine::EngineError);
-
-  Array versions{Value(Dictionary{{"Name", "Contacts"}, {"MajorVersion", 2}, {"MinorVersion", 1}})};
-  engine->setSchemaVersions("Contacts", versions);
-  EXPECT_EQ(SyncEngine::open(path)->schemaVersions("Contacts"), versions);
-
+TEST_F(Engine, SyncPlansAreSharedBetweenConnections) {
   int64_t plan = engine->beginSyncPlan({"com.korvo.VantorSync", "app.a"});
   engine->setSyncPlanStatus(plan, 7);
-  auto plans = SyncEngine::open(path)->currentSyncPlans();  // seen by another connection
+  auto plans = SyncEngine::open(path)->currentSyncPlans();
   ASSERT_EQ(plans.size(), 1u);
   EXPECT_EQ(plans[0].status, 7);
   EXPECT_EQ(plans[0].participants[0], "com.korvo.VantorSync");
   engine->endSyncPlan(plan);
   EXPECT_TRUE(engine->currentSyncPlans().empty());
+  EXPECT_THROW(engine->objectForKey("nobody", "x"), vtc::engine::EngineError);
 }
 
 TEST_F(Engine, TwoProcessesPushingAtOnceLoseNothing) {
-  auto writer = [&](const std::string& client) {
+  std::vector<pid_t> writers;
+  for (std::string client : {"app.a", "app.b"}) {
     pid_t pid = ::fork();
     if (pid == 0) {
       auto own = SyncEngine::open(path);  // a connection of its own
@@ -171,26 +151,21 @@ TEST_F(Engine, TwoProcessesPushingAtOnceLoseNothing) {
                   {SyncEngineChange(1, client + std::to_string(i), Array{set("i", Value(i))})});
       ::_exit(0);
     }
-    return pid;
-  };
-  pid_t a = writer("app.a"), b = writer("app.b");
-  int sa = 0, sb = 0;
-  ::waitpid(a, &sa, 0);
-  ::waitpid(b, &sb, 0);
-  ASSERT_TRUE(WIFEXITED(sa) && WEXITSTATUS(sa) == 0);
-  ASSERT_TRUE(WIFEXITED(sb) && WEXITSTATUS(sb) == 0);
+    writers.push_back(pid);
+  }
+  for (pid_t pid : writers) {
+    int status = 0;
+    ::waitpid(pid, &status, 0);
+    ASSERT_TRUE(WIFEXITED(status) && WEXITSTATUS(status) == 0);
+  }
   EXPECT_EQ(sync("net").size(), 200u);
 }
 
 TEST_F(Engine, ADamagedDatabaseIsReportedAndLeftInPlace) {
   std::string broken = home.path() + "/broken.sqlite";
   std::ofstream(broken) << std::string(8192, 'x');
-  try {
-    SyncEngine::open(broken);
-    FAIL() << "opened";
-  } catch (const vtc::engine::EngineError& e) {
-    EXPECT_NE(std::string(e.what()).find("left in place"), std::string::npos) << e.what();
-  }
+  EXPECT_THAT([&] { SyncEngine::open(broken); },
+              ::testing::ThrowsMessage<vtc::engine::EngineError>(HasSubstr("left in place")));
   EXPECT_EQ(std::filesystem::file_size(broken), 8192u);
 }
 
