@@ -1,6 +1,6 @@
 // VTCPrefsCenter on real preference files, a private session bus and a real
 // Secret Service.
-#include <gtest/gtest.h>
+#include <gmock/gmock.h>
 
 #include <sys/wait.h>
 #include <unistd.h>
@@ -22,6 +22,7 @@
 #include "support/SessionBus.h"
 #include "support/TestHome.h"
 
+using testing::HasSubstr;
 using vtc::prefs::PreferenceStore;
 using vtc::prefs::Scope;
 
@@ -40,50 +41,35 @@ class PrefsCenter : public ::testing::Test {
   void setPerHost(const std::string& key, vtc::Value v) {
     PreferenceStore::shared().setValue(key, std::move(v), kVantorDefaultsKey, Scope::CurrentHost);
   }
-  std::string logText() {
-    std::ifstream in(vtc::log::logFilePath());
-    std::stringstream s;
-    s << in.rdbuf();
-    return s.str();
-  }
 };
 
-TEST_F(PrefsCenter, FailuresCountUpAndASuccessClearsEveryGuard) {
+TEST_F(PrefsCenter, FailureGuardsCountUpAFailedTagExpiresAndASuccessClearsThemAll) {
   prefs.setSyncSuccessful(false, "Contacts");
   prefs.setSyncSuccessful(false, "Contacts");
   EXPECT_EQ(prefs.failedSyncCountForDataclass("Contacts"), 2);
   EXPECT_FALSE(prefs.lastSuccessfulSyncDateForDataclass("Contacts"));
   EXPECT_EQ(prefs.lastAttemptedSyncDateForDataclass("Contacts"), time.now());
-  setPerHost("etag.Contacts", vtc::Value("\"t\""));
-  prefs.setDownloadedAnchorClog(vtc::Value(12), "Contacts");
+  std::vector<int64_t> counts;
+  for (int anchor : {12, 12, 12, 13, 13}) {
+    prefs.setDownloadedAnchorClog(vtc::Value(anchor), "Contacts");
+    counts.push_back(prefs.repeatedDownloadCountForDataclass("Contacts"));
+  }
+  EXPECT_EQ(counts, (std::vector<int64_t>{0, 1, 2, 0, 1}));  // a new anchor starts again
+  EXPECT_EQ(perHost("anchorClog.Contacts").integer(), 13);
   prefs.setDownloadedAnchorClog(vtc::Value(12), "Calendars");
+  setPerHost("etag.Contacts", vtc::Value("\"abc\""));
+  setPerHost("etagTTL.Contacts", vtc::Value(time.now() + std::chrono::seconds(10)));
+  EXPECT_EQ(prefs.failedETagForDataclass("Contacts"), "\"abc\"");
+  time.advance(vtc::Seconds(11));
+  EXPECT_FALSE(prefs.failedETagForDataclass("Contacts"));  // expired: not believed, but kept
+  EXPECT_EQ(perHost("etag.Contacts").string(), "\"abc\"");
 
-  time.advance(vtc::Seconds(5));
   prefs.setSyncSuccessful(true, "Contacts");
   EXPECT_EQ(prefs.lastSuccessfulSyncDateForDataclass("Contacts"), time.now());
   for (const char* key :
        {"FailedCount.Contacts", "etag.Contacts", "anchorClog.Contacts", "anchorCount.Contacts"})
     EXPECT_TRUE(perHost(key).isNone()) << key;
   EXPECT_EQ(perHost("anchorClog.Calendars").integer(), 12);  // other dataclasses untouched
-}
-
-TEST_F(PrefsCenter, RepeatedAnchorsAreCounted) {
-  std::vector<int64_t> counts;
-  for (int anchor : {12, 12, 12, 13}) {
-    prefs.setDownloadedAnchorClog(vtc::Value(anchor), "Bookmarks");
-    counts.push_back(prefs.repeatedDownloadCountForDataclass("Bookmarks"));
-  }
-  EXPECT_EQ(counts, (std::vector<int64_t>{0, 1, 2, 0}));
-  EXPECT_EQ(perHost("anchorClog.Bookmarks").integer(), 13);
-}
-
-TEST_F(PrefsCenter, AnExpiredFailedTagIsNotBelievedButKept) {
-  setPerHost("etag.Contacts", vtc::Value("\"abc\""));
-  setPerHost("etagTTL.Contacts", vtc::Value(time.now() + std::chrono::seconds(10)));
-  EXPECT_EQ(prefs.failedETagForDataclass("Contacts"), "\"abc\"");
-  time.advance(vtc::Seconds(11));
-  EXPECT_FALSE(prefs.failedETagForDataclass("Contacts"));
-  EXPECT_EQ(perHost("etag.Contacts").string(), "\"abc\"");
 }
 
 TEST_F(PrefsCenter, ModesDefaultToSixAndAreSeenAcrossProcessesAfterAResync) {
@@ -136,10 +122,21 @@ TEST_F(PrefsCenter, AResetKeepsTheLogLevel) {
   EXPECT_FALSE(prefs.clientGuid());
 }
 
-TEST_F(PrefsCenter, TheLastSuccessfulSyncDateIsAnnouncedOnTheSessionBus) {
+TEST_F(PrefsCenter, TheLastSyncDateIsMigratedOnceFromTheEngineAndAnnouncedWhenSet) {
+  const vtc::Date older = time.now() - std::chrono::hours(3);
+  {
+    auto engine = vtc::engine::SyncEngine::open();
+    engine->registerClient("com.korvo.VantorSync", vtc::Dictionary{});
+    engine->setObjectForKey("com.korvo.VantorSync", "lastSuccessSync", vtc::Value(older));
+  }
+  EXPECT_EQ(prefs.lastSuccessfulSyncDate(), older);
+  EXPECT_EQ(perHost("lastSuccessSync").date(), older);
+  EXPECT_TRUE(vtc::engine::SyncEngine::open()
+                  ->objectForKey("com.korvo.VantorSync", "lastSuccessSync")
+                  .isNone());
+
   vtc::test::SessionBus bus;
   vtc::test::NotificationListener listener;
-  EXPECT_FALSE(prefs.lastSuccessfulSyncDate());
   prefs.setLastSuccessfulSyncDate(time.now());
   auto got = listener.waitFor(std::chrono::milliseconds(1000));
   ASSERT_EQ(got.size(), 1u);
@@ -147,54 +144,36 @@ TEST_F(PrefsCenter, TheLastSuccessfulSyncDateIsAnnouncedOnTheSessionBus) {
   EXPECT_EQ(prefs.lastSuccessfulSyncDate(), time.now());
 }
 
-TEST_F(PrefsCenter, AnOlderSyncDateInTheEnginesRecordIsMigratedOnce) {
+TEST_F(PrefsCenter, ASessionOpensFromThePreferencesAndTheKeyringOrTheLogSaysHowToStoreIt) {
+  PreferenceStore::shared().setValue("KitbagMember", vtc::Value("alice"), kVantorDefaultsKey,
+                                     Scope::AnyHost);
   {
-    auto engine = vtc::engine::SyncEngine::open();
-    engine->registerClient("com.korvo.VantorSync", vtc::Dictionary{});
-    engine->setObjectForKey("com.korvo.VantorSync", "lastSuccessSync",
-                            vtc::Value(time.now() - std::chrono::hours(3)));
+    vtc::test::SessionBus bus;
+    bus.startKeyring();
+    vtc::test::ApacheShare share;
+    ASSERT_TRUE(vtc::secrets::storeGenericPassword("Kitbag", "alice", "Nubilo", "wonderland"));
+    EXPECT_EQ(prefs.username(), "alice");
+    EXPECT_EQ(prefs.objectForKey("Password"), vtc::Value("wonderland"));
+    NubiloRemoteSession::sessionFromPreferencesWithConfiguration(share.configuration());
+    EXPECT_TRUE(std::filesystem::is_directory(
+        share.diskPath(std::string(vtc::test::ApacheShare::kSyncPath) + "/Clients")));
   }
-  EXPECT_EQ(prefs.lastSuccessfulSyncDate(), time.now() - std::chrono::hours(3));
-  EXPECT_EQ(perHost("lastSuccessSync").date(), time.now() - std::chrono::hours(3));
-  EXPECT_TRUE(vtc::engine::SyncEngine::open()
-                  ->objectForKey("com.korvo.VantorSync", "lastSuccessSync")
-                  .isNone());
-}
-
-TEST_F(PrefsCenter, ASessionOpensFromStoredPreferencesAndTheKeyringAlone) {
+  // Without a Secret Service on the bus the login fails before any request.
   vtc::test::SessionBus bus;
-  bus.startKeyring();
-  vtc::test::ApacheShare share;
-  PreferenceStore::shared().setValue("KitbagMember", vtc::Value("alice"), kVantorDefaultsKey,
-                                     Scope::AnyHost);
-  ASSERT_TRUE(vtc::secrets::storeGenericPassword("Kitbag", "alice", "Nubilo", "wonderland"));
-  EXPECT_EQ(prefs.username(), "alice");
-  EXPECT_EQ(prefs.objectForKey("Password"), vtc::Value("wonderland"));
-  auto session =
-      NubiloRemoteSession::sessionFromPreferencesWithConfiguration(share.configuration());
-  EXPECT_TRUE(std::filesystem::is_directory(
-      share.diskPath(std::string(vtc::test::ApacheShare::kSyncPath) + "/Clients")));
-}
-
-TEST_F(PrefsCenter, WithoutASecretServiceTheLoginFailsAndTheLogSaysHowToStoreThePassword) {
-  vtc::test::SessionBus bus;  // no keyring on it
-  PreferenceStore::shared().setValue("KitbagMember", vtc::Value("alice"), kVantorDefaultsKey,
-                                     Scope::AnyHost);
-  vtc::Dictionary config{
-      {"user_agent", "VantorClient/-/-/488"}, {"sync_path", "/s"}, {"host_name", "127.0.0.1"}};
-  try {
-    NubiloRemoteSession::sessionFromPreferencesWithConfiguration(config);
-    FAIL() << "no exception";
-  } catch (const NubiloException& e) {
-    EXPECT_EQ(e.name(), NubiloLoginFailureException);
-    EXPECT_EQ(e.reason(), "Failed to obtain credentials");
-  }
-  std::string log = logText();
-  EXPECT_NE(log.find("secret-tool store --label=Nubilo service Kitbag account alice"),
-            std::string::npos)
-      << log;
-  EXPECT_NE(log.find("Failed to obtain credentials from Preferences for VantorClient/-/-/488"),
-            std::string::npos);
+  EXPECT_THAT(
+      [] {
+        NubiloRemoteSession::sessionFromPreferencesWithConfiguration(
+            vtc::Dictionary{{"user_agent", "VantorClient/-/-/488"}});
+      },
+      testing::ThrowsMessage<NubiloException>(std::string(NubiloLoginFailureException) +
+                                              ": Failed to obtain credentials"));
+  std::stringstream log;
+  log << std::ifstream(vtc::log::logFilePath()).rdbuf();
+  EXPECT_THAT(
+      log.str(),
+      testing::AllOf(
+          HasSubstr("secret-tool store --label=Nubilo service Kitbag account alice"),
+          HasSubstr("Failed to obtain credentials from Preferences for VantorClient/-/-/488")));
 }
 
 }  // namespace

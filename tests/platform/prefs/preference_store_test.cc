@@ -21,22 +21,29 @@ namespace {
 
 constexpr const char* kDomain = "com.korvo.VantorSync";
 
+std::string readText(const std::string& path) {
+  std::stringstream s;
+  s << std::ifstream(path).rdbuf();
+  return s.str();
+}
+
 class PreferenceStoreTest : public ::testing::Test {
  protected:
   vtc::test::TestHome home;
   PreferenceStore& store = PreferenceStore::shared();
 
-  // Runs body in a child process and waits for it; true when it exited 0.
+  // Starts body in a child process that reads the files afresh.
   template <typename F>
   static pid_t spawn(F body) {
     pid_t pid = ::fork();
     if (pid == 0) {
-      PreferenceStore::shared().resetForTesting();  // the child reads the files afresh
+      PreferenceStore::shared().resetForTesting();
       body();
       ::_exit(0);
     }
     return pid;
   }
+  // Waits for the child; true when it exited 0.
   static bool succeeded(pid_t pid) {
     int status = 0;
     return ::waitpid(pid, &status, 0) == pid && WIFEXITED(status) && WEXITSTATUS(status) == 0;
@@ -88,17 +95,11 @@ TEST_F(PreferenceStoreTest, ACorruptFileIsMovedAsideLoggedAndReadAsEmpty) {
   std::ofstream(path) << "<plist><dict><key>half";
   EXPECT_TRUE(store.copyValue("anything", kDomain, Scope::CurrentHost).isNone());
   EXPECT_FALSE(std::filesystem::exists(path));
-  std::ifstream aside(path + ".corrupt");
-  std::stringstream kept;
-  kept << aside.rdbuf();
-  EXPECT_EQ(kept.str(), "<plist><dict><key>half");
-
-  std::ifstream log(vtc::log::logFilePath());
-  std::stringstream lines;
-  lines << log.rdbuf();
-  EXPECT_NE(lines.str().find("|Error|Preference file " + path + " is not a property list"),
+  EXPECT_EQ(readText(path + ".corrupt"), "<plist><dict><key>half");
+  std::string log = readText(vtc::log::logFilePath());
+  EXPECT_NE(log.find("|Error|Preference file " + path + " is not a property list"),
             std::string::npos)
-      << lines.str();
+      << log;
 
   store.setValue("fresh", vtc::Value(true), kDomain, Scope::CurrentHost);
   ASSERT_TRUE(store.synchronize(kDomain, Scope::CurrentHost));
