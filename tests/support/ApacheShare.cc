@@ -97,9 +97,9 @@ void ApacheShare::writeConfiguration() {
     << "DefaultRuntimeDir " << root_ << "/run\n"
     << "ErrorLog " << root_ << "/logs/error.log\n"
     << "LogLevel warn\n";
-  std::vector<const char*> modules = {"mpm_event",  "authn_core", "authn_file", "authz_core",
-                                      "authz_user", "auth_basic", "dav",        "dav_fs",
-                                      "dav_lock",   "headers"};
+  std::vector<const char*> modules = {"mpm_prefork", "authn_core", "authn_file", "authz_core",
+                                      "authz_user",  "auth_basic", "dav",        "dav_fs",
+                                      "dav_lock",    "headers"};
   if (options_.tls) modules.insert(modules.end(), {"socache_shmcb", "ssl"});
   for (const char* m : modules)
     c << "LoadModule " << m << "_module " << kModules << "/mod_" << m << ".so\n";
@@ -111,7 +111,11 @@ void ApacheShare::writeConfiguration() {
       << "SSLSessionCache shmcb:" << root_ << "/run/ssl_scache(512000)\n";
   }
   if (::geteuid() == 0) c << "User www-data\nGroup www-data\n";
-  c << "StartServers 1\nServerLimit 1\nThreadsPerChild 16\nMaxRequestWorkers 16\n"
+  // Processes, not threads: the lock database of mod_dav_fs is guarded by
+  // record locks, which the threads of one process do not hold against each
+  // other, so a threaded server can grant two exclusive locks at once.
+  c << "StartServers 4\nMinSpareServers 2\nMaxSpareServers 8\nServerLimit 24\n"
+    << "MaxRequestWorkers 24\n"
     << "KeepAlive On\nMaxKeepAliveRequests 0\nKeepAliveTimeout 60\nTimeout 30\n"
     << "LogFormat \"%{remote}p %m %>s\" share\n"
     << "CustomLog " << root_ << "/logs/access.log share\n"
