@@ -51,6 +51,8 @@ class TesselSession {
 
   // Locks (depth 0, exclusive, write). A lock of a missing resource fails as
   // not found (result 104, HTTP 404) instead of leaving a lock-null resource.
+  // A granted lock is checked in the lock discovery; one that the server
+  // gave to another client at the same moment fails as locked (HTTP 423).
   DavTransaction lockResourceAtPath(const std::string& path);
   DavTransaction unlockResourceAtPath(const std::string& path);
   DavTransaction _lockResourceAtPath(const std::string& path, double duration,
@@ -96,6 +98,10 @@ class TesselSession {
   // attribute dictionaries.
   DavTransaction listCollectionAtPath(const std::string& path);
 
+  // Stores a flattened sync report as "<reportsPath>/<MachineGUID>.plist"
+  // (the collection is made on first use).
+  DavTransaction _sendReportingInfo(const vtc::Dictionary& report, const std::string& reportsPath);
+
   const std::string& owner() const { return owner_; }
   bool isSynchronous() const { return synchronous_; }
   // Whether this session holds a lock on path in its lock store.
@@ -106,6 +112,8 @@ class TesselSession {
                           const std::vector<std::string>& props, bool includingParent);
   DavTransaction attributes(const std::string& path, int32_t depth, bool withLocks);
   DavTransaction mkcol(const std::string& path);
+  // Whether the server's lock discovery of path shows token as its only lock.
+  bool lockStands(const std::string& path, const std::string& token);
 
   std::shared_ptr<MemberAccount> account_;
   std::shared_ptr<vtc::DavConnection> connection_;

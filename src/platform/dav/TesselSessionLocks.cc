@@ -89,10 +89,32 @@ DavTransaction TesselSession::_lockResourceAtPath(const std::string& path, doubl
     lock->token = ne_strdup(token.c_str());
     lock->owner = ne_strdup(owner.c_str());
     ne_lockstore_add(connection_->lockStore(), lock);
+    if (!lockStands(path, token)) {
+      // Given back in case the server kept it after all; an unknown token
+      // is simply refused.
+      connection_->perform("UNLOCK", path, [&] { return ne_unlock(connection_->session(), lock); });
+      forgetLock(*connection_, lock);
+      t.setOutcome(false, 153, 423, vtc::kTransactionCompleted);
+      t.setErrorText("the server gave this lock to another client at the same moment");
+    }
   } else if (t.httpStatusCode() == 412) {
     t.setOutcome(false, 104, 404, t.transactionState());
   }
   return t;
+}
+
+// Some servers (Apache's mod_dav_fs among them) check and record a lock in
+// two steps, so two exclusive locks asked for at the same moment can both be
+// granted while only one is kept. The lock discovery tells whose lock stands.
+// A discovery that cannot be read proves nothing and counts as standing.
+bool TesselSession::lockStands(const std::string& path, const std::string& token) {
+  DavTransaction t = extendedAttributesAtPath(path);
+  const vtc::Value* locks =
+      t.isSuccessful() ? t.result().dictionary().find(vtc::kDavLockDiscovery) : nullptr;
+  if (!locks) return true;
+  for (const vtc::Value& lock : locks->array())
+    if (lock.dictionary().get("token").string() != token) return false;
+  return !locks->array().empty();
 }
 
 DavTransaction TesselSession::_relockResourceAtPath(const std::string& path, double duration,
