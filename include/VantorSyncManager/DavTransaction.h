@@ -29,6 +29,8 @@ class VSM_EXPORT DavTransaction {
   int32_t httpStatusCode() const { return httpStatus_; }
   int32_t transactionState() const { return state_; }
   const vtc::Value& result() const { return result_; }
+  // Hands the parsed result over without a copy (a downloaded body can be large).
+  vtc::Value takeResult() { return std::move(result_); }
   const std::optional<vtc::Dictionary>& _responseHeaders() const { return headers_; }
   // The request's method; none for a transaction that stands for no request.
   const std::optional<std::string>& method() const { return method_; }

@@ -7,6 +7,7 @@
 #include <atomic>
 #include <cstdint>
 #include <functional>
+#include <map>
 #include <memory>
 #include <optional>
 #include <set>
@@ -16,12 +17,21 @@
 #include "VantorSyncManager/DavTransaction.h"
 #include "VantorSyncManager/Export.h"
 #include "VantorSyncManager/MemberAccount.h"
+#include "VantorSyncManager/NubiloChangeLog.h"
+#include "VantorSyncManager/SyncEngineChange.h"
 #include "VantorSyncManager/Value.h"
 
 class TesselSession;
 namespace vtc {
 struct RetryTexts;
-}
+
+// What fetchChangeLogsForDataclass brings back: the parsed changelogs by
+// index, and "StorageConsumed", the number of bytes downloaded.
+struct ChangeLogFetchResult {
+  std::map<int64_t, std::unique_ptr<NubiloChangeLog>> changeLogs;
+  int64_t StorageConsumed = 0;
+};
+}  // namespace vtc
 
 class VSM_EXPORT NubiloRemoteSession {
  public:
@@ -151,9 +161,45 @@ class VSM_EXPORT NubiloRemoteSession {
   // The dataclass's own status; none removes it.
   void setStatus(const std::optional<std::string>& status, const std::string& dataclass);
 
-  // Changelog paths.
-  std::string changeLogPathForDataclass(const std::string& dataclass, int64_t index) const;
+  // Changelog transfer. The caller of commitChanges holds the dataclass lock
+  // and passes the index one above the record's maxversion. The commit
+  // uploads under a temporary name, publishes the new maxversion, then moves
+  // the file into place without overwriting; a failed move is rolled back.
+  // False only for an empty change list (nothing is sent). Raises
+  // NubiloTesselFullException, NubiloNetworkFailureException,
+  // NubiloTransactionFailureException or, when another client committed the
+  // index first, NubiloServerIncoherencyException.
+  bool commitChanges(const std::vector<SyncEngineChange>& changes, const std::string& dataclass,
+                     int64_t index, bool reset);
+  // Downloads the changelogs from..to in growing batches and parses them (from
+  // 32768 bytes on, into mapped files). A 404 strictly inside the range or an
+  // empty file raises NubiloCorruptChangelogException, any other failure
+  // NubiloFailedToDownloadChangelogException; a cancelled session returns what
+  // came before the cancellation.
+  vtc::ChangeLogFetchResult fetchChangeLogsForDataclass(const std::string& dataclass, int64_t from,
+                                                        int64_t to);
+  // The raw bytes of one changelog; raises NubiloFailedToDownloadChangelogException.
+  vtc::Bytes fetchChangeLogForDataclass(const std::string& dataclass, int64_t index);
   bool changeLogExistsForDataclass(const std::string& dataclass, int64_t index);
+  // A plain PUT to the changelog's path; the outcome is not looked at.
+  void uploadChangeLog(const vtc::Bytes& data, const std::string& dataclass, int64_t index);
+  std::string changeLogPathForDataclass(const std::string& dataclass, int64_t index) const;
+  // Copies minversion..maxversion into directory/dataclass/NNNNN.clog; write
+  // failures are ignored, download failures raise.
+  void downloadChangeLogsForDataclass(const std::string& dataclass, const std::string& directory);
+  // Uploads every .clog under directory as the dataclass's content (after a
+  // reset when clear is set), widens the record's versions to match and sets
+  // every client's status. Takes and renews the dataclass and clients locks;
+  // they are not released when an exception passes.
+  void putChangeLogsFromDirectory(const std::string& directory, const std::string& dataclass,
+                                  const std::string& status, bool clear);
+  // Deletes the newest changelog, steps maxversion back and marks every
+  // client "needstruth". False when the record has no maxversion.
+  bool removeLastChangelogForDataclass(const std::string& dataclass);
+
+  // Flattens a sync summary into a report of text values and stores it on the
+  // share for the account's other computers; never raises, never judged.
+  void sendReportingInfo(const vtc::Dictionary& summary);
 
   // Read access for callers and tests.
   TesselSession& tesselSession() { return *_TesselSession; }

@@ -1,18 +1,13 @@
 #include "platform/prefs/PreferenceFiles.h"
 
-#include <fstream>
-
 #include "platform/fs/LocalPaths.h"
+#include "platform/os/HostIdentity.h"
 #include "platform/prefs/PreferenceStore.h"
 
 namespace vtc::prefs {
 
 std::string byHostIdentifier() {
-  std::ifstream in("/etc/machine-id");
-  std::string id;
-  std::getline(in, id);
-  while (!id.empty() && (id.back() == ' ' || id.back() == '\n' || id.back() == '\r')) id.pop_back();
-  return id;
+  return os::machineId();
 }
 
 std::string perUserFile(std::string_view domain) {

@@ -1,0 +1,26 @@
+// The reporting request: a report stored on the share as an XML property
+// list named by the machine it describes.
+#include "VantorSyncManager/StringAdditions.h"
+#include "platform/dav/TesselSession.h"
+#include "platform/plist/PlistCodec.h"
+
+DavTransaction TesselSession::_sendReportingInfo(const vtc::Dictionary& report,
+                                                 const std::string& reportsPath) {
+  const vtc::Value& machine = report.get("MachineGUID");
+  if (!machine.isString() || machine.string().empty()) {
+    DavTransaction t("PUT", reportsPath);
+    t.setOutcome(false, 107, vtc::kNoHTTPStatus, 0);
+    t.setErrorText("a report names no machine");
+    return t;
+  }
+  const std::string xml = vtc::plist::toXml(vtc::Value(report));
+  const vtc::Bytes body(xml.begin(), xml.end());
+  const std::string path =
+      stringByAppendingTesselPathComponent(reportsPath, machine.string() + ".plist");
+  DavTransaction t = putData(body, path);
+  if (t.httpStatusCode() == 409) {  // the first report of the account: no collection yet
+    mkcol(reportsPath);
+    t = putData(body, path);
+  }
+  return t;
+}
