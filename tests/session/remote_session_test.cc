@@ -12,11 +12,13 @@
 #include "VantorSyncManager/PublicNames.h"
 #include "VantorSyncManager/VTCPrefsCenter.h"
 #include "platform/dav/TesselSession.h"
+#include "support/Failures.h"
 #include "support/FaultProxy.h"
 #include "support/ShareTest.h"
 
 using testing::StartsWith;
 using testing::ThrowsMessage;
+using vtc::test::ThrowsFailure;
 using vtc::test::TraceCapture;
 
 namespace {
@@ -239,6 +241,49 @@ TEST_F(Locking, ALockCutOffIsRaisedAfterOnePauseAndAFailedUnlockIsKeptForTheRele
   session.reset();  // the release tries once more, and gets through
   EXPECT_EQ(seen("UNLOCK", target), 3u);
   EXPECT_EQ(proxy.requests().back().action, "forwarded");
+}
+
+TEST_F(Locking, ALockThatExpiredIsTakenAgainAndOnlyAMissingTargetIsNotFound) {
+  const std::string client = session->clientsPath() + "/GUID-A.client";
+  session->tesselSession().putData({}, client);
+  session->lockClient();
+  share.forgetLocks();  // expired on the server; the session still holds its token
+  session->lockClient();
+  EXPECT_EQ(session->lockedResources(), std::set<std::string>{client});
+  auto b = open("GUID-B", "Bob's Mac", /*attempts=*/0);
+  EXPECT_THAT([&] { b->lockClient("GUID-A"); }, ThrowsFailure(NubiloLockFailureException));
+
+  // Gone while locked: the stale token set aside, the target is missing.
+  session->tesselSession().deleteResourceAtPath(client);
+  EXPECT_THAT([&] { session->lockClient(); }, ThrowsFailure(NubiloClientRegistrationException));
+  // A missing parent is as missing as the target, with no waiting.
+  EXPECT_THAT([&] { session->lockDataclass("Missing/Inner"); },
+              ThrowsFailure(NubiloResourceNotFoundException));
+  EXPECT_TRUE(time.sleeps().empty());
+}
+
+TEST_F(Locking, ALockWhoseRenewalOrReleaseWasRefusedIsStillReleasedOnTheServer) {
+  const std::string target = schemas + "/Contacts/";
+  session->tesselSession().makeCollectionAtPath(schemas + "/Contacts", false);
+  session->lockDataclass("Contacts");
+  proxy.answer({"LOCK", target, 0}, 423);
+  EXPECT_THAT([&] { session->relockDataclass("Contacts"); },
+              ThrowsFailure(NubiloRelockFailureException));
+  proxy.clear();
+  session->unlockDataclass("Contacts");
+  EXPECT_EQ(seen("UNLOCK", target), 1u);
+  EXPECT_TRUE(session->lockedResources().empty());
+
+  session->lockDataclass("Contacts");
+  proxy.answer({"UNLOCK", target, 0}, 403);
+  session->unlockDataclass("Contacts");
+  EXPECT_EQ(seen("UNLOCK", target), 3u);  // both tries sent
+  proxy.clear();
+  session.reset();  // the release sends it once more, and the server lets go
+  EXPECT_EQ(seen("UNLOCK", target), 4u);
+  auto b = open("GUID-B", "Bob's Mac", /*attempts=*/0);
+  b->lockDataclass("Contacts");
+  EXPECT_EQ(b->lockedResources(), std::set<std::string>{target});
 }
 
 TEST_F(Registry, ADataclassFromUnregisteredToPopulatedToResetToGone) {

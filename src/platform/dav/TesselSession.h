@@ -49,8 +49,12 @@ class TesselSession {
                                       bool includingIntermediateCollections);
   DavTransaction deleteResourceAtPath(const std::string& path);
 
-  // Locks (depth 0, exclusive, write). A lock of a missing resource fails as
-  // not found (result 104, HTTP 404) instead of leaving a lock-null resource.
+  // Locks (depth 0, exclusive, write). A lock of a missing resource, or of
+  // one whose parent is missing, fails as not found (result 104, HTTP 404)
+  // instead of leaving a lock-null resource. A lock of a path whose earlier
+  // lock the server no longer knows sets that lock's token aside and asks
+  // again. A lock leaves the lock store only when an unlock succeeds or a new
+  // lock of the same path replaces it: a refused relock or unlock keeps it.
   DavTransaction lockResourceAtPath(const std::string& path);
   DavTransaction unlockResourceAtPath(const std::string& path);
   DavTransaction _lockResourceAtPath(const std::string& path, double duration,
