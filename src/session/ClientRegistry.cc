@@ -79,7 +79,10 @@ vtc::Dictionary NubiloRemoteSession::getClientInfo(const std::string& guid) {
       stringByAppendingTesselPathComponent(_syncPath, "Clients"), guid + ".client");
   DavTransaction t = _issuePropFindWithRetryAtPath(path, kDAVZeroDepth, {});
   if (t.isSuccessful()) {
-    vtc::Dictionary record = recordFromProperties(t.result().dictionary().get(path).dictionary());
+    // Looked up under the href that was asked for: a server that names the
+    // resource otherwise yields an empty record, not a failure.
+    const vtc::Value& found = t.result().dictionary().get(vtc::davpath::escape(path));
+    vtc::Dictionary record = recordFromProperties(found.dictionary());
     _clientsInfo.set(guid, vtc::Value(record));
     return record;
   }
@@ -112,7 +115,7 @@ vtc::Array NubiloRemoteSession::getAllClientInfo() {
   vtc::Array records;
   if (!t.isSuccessful()) return records;
   for (const auto& [href, props] : t.result().dictionary()) {
-    std::string last = vtc::davpath::lastComponent(href);
+    std::string last = vtc::davpath::lastComponent(vtc::davpath::fromHref(href));
     if (last == ".client") {
       VTC_LOG_ERROR("Invalid client found removing...");
       unregisterClient("");

@@ -65,7 +65,10 @@ class TesselSession {
 
   // PROPFIND: props are full names ("DAV:getetag", namespace + local name);
   // an empty list asks for all properties. The result maps each resource's
-  // unescaped path to a dictionary from full property name to text.
+  // href, as the server sent it, to a dictionary from full property name to
+  // text. A server that echoes the request's escaping keys the resource asked
+  // for by vtc::davpath::escape(path); one that escapes otherwise, or sends
+  // whole URLs, does not.
   DavTransaction _issuePropFindAtPath(const std::string& path, int32_t depth,
                                       const std::vector<std::string>& props, bool includingParent);
   DavTransaction _issuePropFindAtPath(const std::string& path, int32_t depth,
