@@ -11,6 +11,7 @@
 #include "VantorSyncManager/NubiloException.h"
 #include "VantorSyncManager/PublicNames.h"
 #include "VantorSyncManager/VTCPrefsCenter.h"
+#include "common/Format.h"
 #include "platform/dav/TesselSession.h"
 #include "support/Failures.h"
 #include "support/FaultProxy.h"
@@ -35,12 +36,19 @@ class ShareBehindProxy : public vtc::test::ShareTest {
 
   // A client's session, through the proxy.
   std::unique_ptr<NubiloRemoteSession> open(const std::string& guid, const std::string& name,
-                                            int attempts = 3) {
+                                            int attempts = 3, const vtc::Dictionary& more = {}) {
     vtc::Dictionary overrides = clientOverrides(guid);
     overrides.merge({{"host_port", proxy.port()},
                      {"ClientName", name},
                      {"max_lock_acquire_attempts", attempts}});
+    overrides.merge(more);
     return openSession(overrides);
+  }
+  // The messages logged at this level that start with prefix.
+  std::vector<std::string> logs(const std::string& level, const std::string& prefix) const {
+    std::vector<std::string> out = logged.messages(level);
+    std::erase_if(out, [&](const std::string& m) { return !m.starts_with(prefix); });
+    return out;
   }
 
   // How many requests of this method on this path the proxy saw.
@@ -76,6 +84,9 @@ TEST_F(Retry, ATimeOutIsTriedOnceMoreAndTheSecondAnswerReturnedEvenANetworkFailu
   proxy.dropConnection({"PUT", path, 0});
   EXPECT_EQ(quick->putDataWithRetry({'x'}, path).errorType(), kNBNetworkError);
   EXPECT_EQ(seen("PUT", path), 2u);
+  EXPECT_EQ(logged.count("Warning", "putData transaction failed due to timeout, retrying..."), 1u);
+  EXPECT_THAT(logs("Info", "Transaction: "),
+              testing::ElementsAre(StartsWith("Transaction: <DavTransaction PUT " + path)));
   EXPECT_TRUE(time.sleeps().empty());
   // A retry report of two records tied together and to the session; no final one.
   quick->messageTraceTransactionFailure(DavTransaction(), true, 0, "no request, no records");
@@ -107,12 +118,19 @@ TEST_F(Retry, OnlyAMissingDownloadWaitsAndIsTriedAgainOtherFailuresAreReturnedAt
   t = session->moveResourceWithRetryAtPath(a, b, /*allowingOverwrite=*/false);
   EXPECT_FALSE(t.isSuccessful());
   EXPECT_EQ(t.httpStatusCode(), 412);
+  EXPECT_EQ(logged.messages("Warning"),
+            std::vector<std::string>{
+                "moveResorce transaction failed, resource already exists at destination " + b});
   EXPECT_TRUE(session->moveResourceWithRetryAtPath(a, b).isSuccessful());
   EXPECT_TRUE(traces.records().empty());
   EXPECT_TRUE(time.sleeps().empty());
 
   EXPECT_EQ(session->getDataWithRetryAtPath(schemas + "/00001.clog").httpStatusCode(), 404);
   EXPECT_EQ(time.sleeps(), std::vector<double>{30});
+  EXPECT_EQ(
+      logged.count("Warning", "getData transaction failed due to 404 file not found at path " +
+                                  schemas + "/00001.clog, retrying..."),
+      1u);
   ASSERT_EQ(traces.withDomain(kRetry).size(), 2u);
   EXPECT_EQ(field(kRetry, 1, "COM_KORVO_MESSAGE_VALUE"), "1");
   ASSERT_EQ(traces.withDomain(kFinal).size(), 1u);
@@ -134,6 +152,8 @@ TEST_F(Retry, AServerThatWentAwayRaisesANetworkFailure) {
   EXPECT_EQ(field(kFinal, 0, "COM_KORVO_MESSAGE_UUID"), field(kRetry, 0, "COM_KORVO_MESSAGE_UUID"));
   EXPECT_EQ(field(kCode, 0, "COM_KORVO_MESSAGE_SIGNATURE"), "kNBNetworkError");
   EXPECT_TRUE(time.sleeps().empty());
+  EXPECT_EQ(logged.messages("Warning"),
+            std::vector<std::string>{"putData transaction failed due to network error raising..."});
 }
 
 TEST_F(Locking, AContenderWaitsOutItsAttemptsAndLearnsWhoHoldsTheLock) {
@@ -163,13 +183,34 @@ TEST_F(Locking, AContenderWaitsOutItsAttemptsAndLearnsWhoHoldsTheLock) {
     EXPECT_EQ(field(kRetry, i, "COM_KORVO_MESSAGE_VALUE"), std::to_string(i));
   EXPECT_TRUE(traces.withDomain(kFinal).empty());
   EXPECT_TRUE(b->lockedResources().empty());
+  const std::string target = schemas + "/Contacts/";
+  auto attempts = logs("Warning", "Lock attempt ");
+  ASSERT_EQ(attempts.size(), 3u);
+  for (size_t i = 0; i < 3; ++i)
+    EXPECT_EQ(attempts[i], vtc::format("Lock attempt %d of %@ failed, retrying in %d seconds",
+                                       int(i + 1), target, int(pauses[i])));
+  EXPECT_EQ(logs("Warning", "Failed to lock "),
+            std::vector<std::string>{"Failed to lock " + target +
+                                     " after 3 lock attempts, raising exception"});
+
+  // A long configured pause is held to the ceiling.
+  auto c = open("GUID-C", "Carol's Mac", 3, {{"lock_acquire_sleep_seconds", 1000000000}});
+  EXPECT_THAT([&] { c->lockDataclass("Contacts"); }, ThrowsFailure(NubiloLockFailureException));
+  pauses = time.sleeps();
+  ASSERT_EQ(pauses.size(), 6u);
+  EXPECT_TRUE(std::all_of(pauses.begin() + 3, pauses.end(), [](double p) { return p <= 90.0; }));
+  EXPECT_EQ(pauses.back(), 90.0);
+  EXPECT_EQ(logs("Warning", "Lock attempt 3 of ").back(),
+            "Lock attempt 3 of " + target + " failed, retrying in 90 seconds");
 
   // Once the holder lets go, the contender gets the lock at once.
   session->unlockDataclass("Contacts");
   EXPECT_TRUE(session->lockedResources().empty());
   b->lockDataclass("Contacts");
-  EXPECT_EQ(time.sleeps().size(), 3u);
-  EXPECT_EQ(b->lockedResources(), std::set<std::string>{schemas + "/Contacts/"});
+  EXPECT_EQ(time.sleeps().size(), 6u);
+  EXPECT_EQ(b->lockedResources(), std::set<std::string>{target});
+  EXPECT_EQ(logged.count("Info", "Locking dataclass Contacts"), 2u);
+  EXPECT_EQ(logged.count("Info", "Unlocking dataclass Contacts"), 1u);
 }
 
 TEST_F(Locking, WithNoRetriesOneRefusalFailsAtOnceAndAReleasedSessionUnlocksWhatItHeld) {
@@ -180,11 +221,21 @@ TEST_F(Locking, WithNoRetriesOneRefusalFailsAtOnceAndAReleasedSessionUnlocksWhat
   EXPECT_EQ(session->lockedResources(),
             (std::set<std::string>{session->clientsPath() + "/GUID-A.client", schemas + "/"}));
   size_t locks = proxy.count("LOCK");
-  EXPECT_THROW(b->lockClient("GUID-A"), NubiloException);
+  EXPECT_THAT([&] { b->lockClient("GUID-A"); }, ThrowsFailure(NubiloLockFailureException));
   EXPECT_EQ(proxy.count("LOCK") - locks, 1u);
   EXPECT_TRUE(time.sleeps().empty());
   EXPECT_TRUE(traces.records().empty());
+  const std::string client = session->clientsPath() + "/GUID-A.client";
+  EXPECT_EQ(logs("Warning", "Failed to lock "),
+            std::vector<std::string>{"Failed to lock " + client +
+                                     " after 0 lock attempts, raising exception"});
   session.reset();
+  EXPECT_EQ(
+      logs("Warning", "Resource "),
+      (std::vector<std::string>{
+          "Resource " + client + " appears to still be locked when ending session, unlocking...",
+          "Resource " + schemas +
+              "/ appears to still be locked when ending session, unlocking..."}));
   b->lockClient("GUID-A");
   b->lockDataclasses();
   EXPECT_EQ(b->lockedResources().size(), 2u);
@@ -198,6 +249,11 @@ TEST_F(Locking, LocksOnMissingOrForgottenResourcesFail) {
               ThrowsMessage<NubiloException>(StartsWith("NubiloResourceNotFoundException: ")));
   EXPECT_TRUE(time.sleeps().empty());
   EXPECT_EQ(traces.withDomain(kFinal).size(), 2u);
+  EXPECT_EQ(logs("Warning", "Lock transaction failed due to resource not found at "),
+            (std::vector<std::string>{"Lock transaction failed due to resource not found at " +
+                                          session->clientsPath() + "/NOBODY.client",
+                                      "Lock transaction failed due to resource not found at " +
+                                          schemas + "/Unregistered/"}));
   session->unlockClient("NOBODY");  // logged, never raised
 
   // A lock the server forgot, as one that timed out, can be neither renewed
@@ -214,6 +270,10 @@ TEST_F(Locking, LocksOnMissingOrForgottenResourcesFail) {
   EXPECT_EQ(field(kFinal, 2, "MESSAGE"), "Failed to relock resource");
   session->unlockDataclass("Contacts");
   EXPECT_EQ(session->lockedResources().size(), 1u);  // kept for the release to try again
+  const std::string contacts = schemas + "/Contacts/";
+  EXPECT_EQ(logged.count("Warning", "Failed to unlock resource " + contacts + ", retrying..."), 1u);
+  EXPECT_EQ(logged.messages("Error").back(),
+            "Failed to unlock resource (lock not held), " + contacts);
 }
 
 TEST_F(Locking, ALockCutOffIsRaisedAfterOnePauseAndAFailedUnlockIsKeptForTheRelease) {
@@ -296,6 +356,7 @@ TEST_F(Registry, ADataclassFromUnregisteredToPopulatedToResetToGone) {
   EXPECT_THAT(a.getDataclassInfo(dc).keys(),  // registers it
               testing::UnorderedElementsAre("DAV:getetag", "dataclassname", "displayname"));
   EXPECT_EQ(recordAt(*observer, collection).get("dataclassname").string(), dc);
+  EXPECT_EQ(logged.count("Info", "Creating dataclass directory for " + dc), 1u);
   EXPECT_EQ(a.dataclassNames(), std::vector<std::string>{dc});
   EXPECT_TRUE(a.validPropertiesForDataclass(dc));
 
@@ -344,10 +405,16 @@ TEST_F(Registry, ADataclassFromUnregisteredToPopulatedToResetToGone) {
   EXPECT_EQ(proxy.requests().size() - sent, 4u);  // relock, listing, two reads
   a.unlockClients();
 
+  // Unregistered, the dataclass leaves the listing; another one stays.
+  a.getDataclassInfo("com.korvo.Calendars");
+  EXPECT_EQ(a.getAllDataclassInfo().size(), 2u);
   a.unlockDataclass(dc);
   EXPECT_TRUE(a.unregisterDataclass(dc));
   EXPECT_TRUE(recordAt(*observer, collection).empty());
-  EXPECT_TRUE(a.getAllDataclassInfo().empty());
+  vtc::Array left = a.getAllDataclassInfo();
+  ASSERT_EQ(left.size(), 1u);
+  EXPECT_EQ(left[0].dictionary().get("dataclassname").string(), "com.korvo.Calendars");
+  EXPECT_EQ(left[0].dictionary().get("displayname").string(), "com.korvo.Calendars");
   EXPECT_TRUE(a.lockedResources().empty());
 }
 
@@ -358,7 +425,12 @@ TEST_F(Registry, ClientsRegisterAndABrokenRecordIsCleanedUp) {
   EXPECT_TRUE(a->registerClient("GUID-A", "Alice's \x07Mac"));
   EXPECT_TRUE(b->registerClient("GUID-B", "Bob's Mac"));
   EXPECT_TRUE(c->registerClient("GUID C", "Carol's Mac"));
-  EXPECT_THROW(a->registerClient("GUID-A", "again"), NubiloException);
+  EXPECT_THAT([&] { a->registerClient("GUID-A", "again"); },
+              ThrowsFailure(NubiloClientRegistrationException));
+  EXPECT_EQ(logged.count("Warning",
+                         "Attempt to register client that is already registered GUID:GUID-A "
+                         "Name:again"),
+            1u);
 
   vtc::Dictionary record = b->getClientInfo("GUID-A");
   EXPECT_EQ(record.get("clientname").string(), "Alice's Mac");
@@ -368,12 +440,22 @@ TEST_F(Registry, ClientsRegisterAndABrokenRecordIsCleanedUp) {
 
   // Carol's record loses its name: listed once more, then removed, though
   // the server escapes her guid in its href.
+  // A resource registered without a guid is removed unlisted.
   c->setInfoForClient(vtc::Dictionary{{"clientname", kNBRemoveProp}}, "GUID C");
+  a->tesselSession().putData({}, a->clientsPath() + "/.client");
   EXPECT_EQ(a->getAllClientInfo().size(), 3u);
   EXPECT_FALSE(std::filesystem::exists(share.diskPath(a->clientsPath() + "/GUID C.client")));
+  EXPECT_FALSE(std::filesystem::exists(share.diskPath(a->clientsPath() + "/.client")));
+  EXPECT_THAT(logged.messages("Error"),
+              testing::UnorderedElementsAre(
+                  "Invalid client found removing...",
+                  "Missing guid or name found on client /Library/Application%20Support/SyncWorks/"
+                  "Clients/GUID%20C.client removing..."));
+  EXPECT_EQ(logged.count("Info", "Unregistering client GUID C"), 1u);
   EXPECT_EQ(a->getAllClientInfo().size(), 2u);
   EXPECT_THAT([&] { a->getClientInfo("GUID C"); },
               ThrowsFailure(NubiloClientRegistrationException));
+  EXPECT_EQ(logged.messages("Error").back(), "Failed to obtain client info for GUID C");
   EXPECT_TRUE(b->unregisterClient("GUID-B"));
   EXPECT_EQ(a->getAllClientInfo().size(), 1u);
 
@@ -410,6 +492,15 @@ TEST_F(Registry, ARefusedMoveMakesTheResetDeleteChangelogByChangelogRenewingItsL
   ASSERT_EQ(traces.withDomain(kRetry).size(), 1u);
   EXPECT_EQ(field(kRetry, 0, "MESSAGE"), "Failed to move dataclass aside for reset");
   EXPECT_EQ(field(kCode, 0, "COM_KORVO_MESSAGE_SIGNATURE2"), "500");
+  EXPECT_EQ(logged.count("Warning",
+                         "Failed to move Contacts dataclass collection aside for reset "
+                         "(probably too many clogs), reverting to removing clogs "
+                         "individually"),
+            1u);
+  std::vector<std::string> removals = logs("Info", "Removing changelog ");
+  ASSERT_EQ(removals.size(), 6u);
+  EXPECT_EQ(removals.front(), "Removing changelog 3 for dataclass Contacts");
+  EXPECT_EQ(removals.back(), "Removing changelog 8 for dataclass Contacts");
 }
 
 TEST_F(Registry, RegistrationWaitsOutAuthorizationFailuresAndRecordReadsNameTheAccountsTrouble) {
@@ -417,6 +508,9 @@ TEST_F(Registry, RegistrationWaitsOutAuthorizationFailuresAndRecordReadsNameTheA
   proxy.answer({"PROPFIND", client, 0}, 401);
   EXPECT_TRUE(session->registerClient("GUID-B", "Bob"));
   EXPECT_EQ(time.sleeps(), (std::vector<double>{30, 30, 30}));
+  EXPECT_EQ(logged.count("Warning", "Authorization failure accessing " + client +
+                                        ", trying again in 30 seconds"),
+            3u);
   ASSERT_EQ(traces.withDomain(kFinal).size(), 1u);
   EXPECT_EQ(field(kFinal, 0, "MESSAGE"), "Failed to get basic attributes on Client");
   proxy.clear();
