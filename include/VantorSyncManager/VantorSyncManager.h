@@ -1,6 +1,7 @@
 // Umbrella header of the library.
 #pragma once
 
+#include "VantorSyncManager/AssertionHandler.h"
 #include "VantorSyncManager/DavTransaction.h"
 #include "VantorSyncManager/Diagnostics.h"
 #include "VantorSyncManager/Log.h"

@@ -7,6 +7,7 @@
 #include "VantorSyncManager/PublicNames.h"
 #include "VantorSyncManager/StringAdditions.h"
 #include "VantorSyncManager/VTCPrefsCenter.h"
+#include "common/Assertions.h"
 #include "common/Clock.h"
 #include "common/Logging.h"
 #include "platform/dav/DavPaths.h"
@@ -26,6 +27,18 @@ std::string withoutExtension(const std::string& name) {
 }  // namespace
 
 bool NubiloRemoteSession::registerClient(const std::string& guid, const std::string& name) {
+  // An empty guid would register the resource ".client". When the handler's
+  // policy carries on, nothing is registered.
+  if (guid.empty()) {
+    VTC_ASSERTION_FAILURE("NubiloRemoteSession", "registerClient",
+                          "registerClient: client guid is missing!");
+    return false;
+  }
+  if (name.empty()) {
+    VTC_ASSERTION_FAILURE("NubiloRemoteSession", "registerClient",
+                          "registerClient: client name is missing!");
+    return false;
+  }
   std::string strippedName = vtc::strippedClientName(name);
   std::string path = clientPath(guid);
   DavTransaction t = _TesselSession->basicAttributesAtPath(path);

@@ -8,6 +8,7 @@
 #include <filesystem>
 #include <set>
 
+#include "VantorSyncManager/AssertionHandler.h"
 #include "VantorSyncManager/NubiloException.h"
 #include "VantorSyncManager/PublicNames.h"
 #include "VantorSyncManager/VTCPrefsCenter.h"
@@ -531,6 +532,33 @@ TEST_F(Registry, RegistrationWaitsOutAuthorizationFailuresAndRecordReadsNameTheA
               ThrowsMessage<NubiloException>(StartsWith("NubiloAccountExpiredException: ")));
   proxy.answer({"DELETE", client, 0}, 500);
   EXPECT_FALSE(session->unregisterClient("GUID-B"));
+}
+
+TEST_F(Registry, AClientWithoutGuidOrNameIsAnAssertionFailureBeforeAnyRequest) {
+  size_t sent = proxy.requests().size();
+  try {
+    session->registerClient("", "Nameless");
+    FAIL() << "no assertion";
+  } catch (const vtc::AssertionFailure& e) {
+    EXPECT_EQ(e.description(), "registerClient: client guid is missing!");
+    EXPECT_EQ(e.className(), "NubiloRemoteSession");
+    EXPECT_EQ(e.file(), "ClientRegistry.cc");
+    EXPECT_THAT(logged.messages("Error"),
+                testing::ElementsAre("Assertion failure in NubiloRemoteSession::registerClient, "
+                                     "ClientRegistry.cc:" +
+                                     std::to_string(e.line()) +
+                                     ": registerClient: client guid is missing!"));
+  }
+  EXPECT_THAT([&] { session->registerClient("GUID-N", ""); },
+              ThrowsMessage<vtc::AssertionFailure>("registerClient: client name is missing!"));
+  // A policy that carries on registers nothing either.
+  vtc::setAssertionPolicy(vtc::AssertionPolicy::Continue);
+  EXPECT_FALSE(session->registerClient("", "Nameless"));
+  vtc::setAssertionPolicy(vtc::AssertionPolicy::Throw);
+  EXPECT_EQ(logged.messages("Error").size(), 3u);
+  EXPECT_EQ(proxy.requests().size(), sent);
+  EXPECT_FALSE(std::filesystem::exists(share.diskPath(session->clientsPath() + "/.client")));
+  EXPECT_FALSE(VTCPrefsCenter::defaultCenter().clientGuid());
 }
 
 TEST_F(Registry, EntityTagsCompareWithoutTheWeakPrefix) {
