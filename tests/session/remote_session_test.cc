@@ -174,11 +174,10 @@ TEST_F(Locking, AContenderWaitsOutItsAttemptsAndLearnsWhoHoldsTheLock) {
     EXPECT_EQ(holders[0].dictionary().get("clientname").string(), "Alice's Mac");
   }
   EXPECT_EQ(proxy.count("LOCK") - locks, 4u);  // max attempts + 1
-  // Pauses that never shrink, and never pass the ceiling.
+  // Pauses that never shrink.
   std::vector<double> pauses = time.sleeps();
   ASSERT_EQ(pauses.size(), 3u);
   EXPECT_TRUE(std::is_sorted(pauses.begin(), pauses.end()));
-  EXPECT_LE(pauses.back(), 90.0);
   ASSERT_EQ(traces.withDomain(kRetry).size(), 3u);
   for (size_t i = 0; i < 3; ++i)
     EXPECT_EQ(field(kRetry, i, "COM_KORVO_MESSAGE_VALUE"), std::to_string(i));
@@ -194,7 +193,7 @@ TEST_F(Locking, AContenderWaitsOutItsAttemptsAndLearnsWhoHoldsTheLock) {
             std::vector<std::string>{"Failed to lock " + target +
                                      " after 3 lock attempts, raising exception"});
 
-  // A long configured pause is held to the ceiling.
+  // A long configured pause is held to the 90-second ceiling.
   auto c = open("GUID-C", "Carol's Mac", 3, {{"lock_acquire_sleep_seconds", 1000000000}});
   EXPECT_THAT([&] { c->lockDataclass("Contacts"); }, ThrowsFailure(NubiloLockFailureException));
   pauses = time.sleeps();

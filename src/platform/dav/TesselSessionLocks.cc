@@ -103,8 +103,8 @@ DavTransaction TesselSession::_lockResourceAtPath(const std::string& path, doubl
     lock->owner = ne_strdup(owner.c_str());
     ne_lockstore_add(connection_->lockStore(), lock);
   } else if (t.httpStatusCode() == 412 || t.httpStatusCode() == 409) {
-    // Only If-Match fails now (no token was sent), and a 409 names a
-    // missing parent: both mean the target is not there.
+    // With no token of this path sent, a 412 is the If-Match failing; a 409
+    // names a missing parent. Either way the target is not there.
     t.setOutcome(false, 104, 404, t.transactionState());
   }
   return t;
