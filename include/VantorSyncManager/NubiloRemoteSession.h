@@ -148,6 +148,9 @@ class VSM_EXPORT NubiloRemoteSession {
   int64_t calculateStorageConsumedForDataclass(const std::string& dataclass);
 
   // Client registry: one resource per client under the clients collection.
+  // registerClient raises NubiloClientRegistrationException for a client
+  // that exists; an empty guid or name is an assertion failure (false when
+  // the assertion policy carries on).
   bool registerClient(const std::string& guid, const std::string& name);
   bool unregisterClient(const std::string& guid);
   vtc::Dictionary getClientInfo(const std::string& guid);

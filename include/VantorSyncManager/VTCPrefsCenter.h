@@ -68,6 +68,8 @@ class VSM_EXPORT VTCPrefsCenter {
 
   // The client configuration, built once per process.
   const vtc::Dictionary& configuration();
+  // Forgets it, so that the next use builds it again (tests only).
+  void resetConfigurationForTesting();
   vtc::Dictionary defaultConfiguration();
 
   // Maintenance; the last three are kept for older callers.
@@ -86,5 +88,5 @@ class VSM_EXPORT VTCPrefsCenter {
   void set(const std::string& key, vtc::Value value);
 
   std::optional<vtc::Dictionary> _configuration;
-  std::once_flag configurationOnce_;
+  std::mutex configurationMutex_;
 };

@@ -1,9 +1,12 @@
 // Umbrella header of the library.
 #pragma once
 
+#include "VantorSyncManager/AssertionHandler.h"
+#include "VantorSyncManager/DataclassMaintenance.h"
 #include "VantorSyncManager/DavTransaction.h"
 #include "VantorSyncManager/Diagnostics.h"
 #include "VantorSyncManager/HostIdentity.h"
+#include "VantorSyncManager/LegacySession.h"
 #include "VantorSyncManager/Log.h"
 #include "VantorSyncManager/MemberAccount.h"
 #include "VantorSyncManager/NubiloChangeLog.h"

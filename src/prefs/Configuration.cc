@@ -85,8 +85,14 @@ std::string configurationURL(const std::string& host, const std::optional<std::s
 }  // namespace vtc::config
 
 const vtc::Dictionary& VTCPrefsCenter::configuration() {
-  std::call_once(configurationOnce_, [this] { _configuration = defaultConfiguration(); });
+  std::lock_guard<std::mutex> lock(configurationMutex_);
+  if (!_configuration) _configuration = defaultConfiguration();
   return *_configuration;
+}
+
+void VTCPrefsCenter::resetConfigurationForTesting() {
+  std::lock_guard<std::mutex> lock(configurationMutex_);
+  _configuration.reset();
 }
 
 vtc::Dictionary VTCPrefsCenter::defaultConfiguration() {

@@ -7,6 +7,7 @@
 #include "VantorSyncManager/PublicNames.h"
 #include "VantorSyncManager/StringAdditions.h"
 #include "VantorSyncManager/VTCPrefsCenter.h"
+#include "common/Assertions.h"
 #include "common/Clock.h"
 #include "common/Logging.h"
 #include "platform/dav/DavPaths.h"
@@ -26,6 +27,18 @@ std::string withoutExtension(const std::string& name) {
 }  // namespace
 
 bool NubiloRemoteSession::registerClient(const std::string& guid, const std::string& name) {
+  // An empty guid would register the resource ".client". When the handler's
+  // policy carries on, nothing is registered.
+  if (guid.empty()) {
+    VTC_ASSERTION_FAILURE("NubiloRemoteSession", "registerClient",
+                          "registerClient: client guid is missing!");
+    return false;
+  }
+  if (name.empty()) {
+    VTC_ASSERTION_FAILURE("NubiloRemoteSession", "registerClient",
+                          "registerClient: client name is missing!");
+    return false;
+  }
   std::string strippedName = vtc::strippedClientName(name);
   std::string path = clientPath(guid);
   DavTransaction t = _TesselSession->basicAttributesAtPath(path);
@@ -79,7 +92,10 @@ vtc::Dictionary NubiloRemoteSession::getClientInfo(const std::string& guid) {
       stringByAppendingTesselPathComponent(_syncPath, "Clients"), guid + ".client");
   DavTransaction t = _issuePropFindWithRetryAtPath(path, kDAVZeroDepth, {});
   if (t.isSuccessful()) {
-    vtc::Dictionary record = recordFromProperties(t.result().dictionary().get(path).dictionary());
+    // Looked up under the href that was asked for: a server that names the
+    // resource otherwise yields an empty record, not a failure.
+    const vtc::Value& found = t.result().dictionary().get(vtc::davpath::escape(path));
+    vtc::Dictionary record = recordFromProperties(found.dictionary());
     _clientsInfo.set(guid, vtc::Value(record));
     return record;
   }
@@ -112,7 +128,7 @@ vtc::Array NubiloRemoteSession::getAllClientInfo() {
   vtc::Array records;
   if (!t.isSuccessful()) return records;
   for (const auto& [href, props] : t.result().dictionary()) {
-    std::string last = vtc::davpath::lastComponent(href);
+    std::string last = vtc::davpath::lastComponent(vtc::davpath::fromHref(href));
     if (last == ".client") {
       VTC_LOG_ERROR("Invalid client found removing...");
       unregisterClient("");

@@ -85,6 +85,18 @@ TEST_F(Log, LevelWordsInAnyCaseAndThePerHostValueWins) {
   EXPECT_EQ(tail(l[0], 3), "Info|hello there");
 }
 
+TEST_F(Log, AComputerWithTheBugReportingToolLogsInfoUnlessALevelIsSet) {
+  std::string apps = home.path() + "/.local/share/applications";
+  vtc::paths::makeDirectories(apps);
+  std::ofstream(apps + "/Ticketer.desktop") << "[Desktop Entry]\nName=Ticketer\n";
+  auto l = logAllLevels();
+  ASSERT_EQ(l.size(), 4u);  // levels -1 to 2
+  EXPECT_EQ(tail(l.back(), 2), "Info|level 2");
+  vtc::log::resetForTesting();
+  setPreference("LoggingLevel", vtc::Value("error"));
+  EXPECT_EQ(logAllLevels().size(), 2u);
+}
+
 TEST_F(Log, RollsOnlyPastFourMebibytesAndOnlyOncePerProcess) {
   std::string path = vtc::log::logFilePath();
   vtc::paths::makeDirectories(path.substr(0, path.find_last_of('/')));

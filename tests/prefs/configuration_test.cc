@@ -1,16 +1,14 @@
 // The client configuration's four layers, with the signed file served by
 // the Apache fixture and verified with a key made for the test.
-#include <gtest/gtest.h>
+#include <gmock/gmock.h>
 
 #include <algorithm>
 #include <filesystem>
 #include <fstream>
-#include <sstream>
 
 #include "VantorSyncManager/NubiloSignedDocument.h"
 #include "VantorSyncManager/PublicNames.h"
 #include "VantorSyncManager/VTCPrefsCenter.h"
-#include "common/Logging.h"
 #include "platform/network/InterfaceAddresses.h"
 #include "platform/os/SystemVersion.h"
 #include "platform/plist/PlistCodec.h"
@@ -19,6 +17,7 @@
 #include "support/ApacheShare.h"
 #include "support/FakeTime.h"
 #include "support/KeyPair.h"
+#include "support/LogCapture.h"
 #include "support/TestHome.h"
 
 using vtc::prefs::PreferenceStore;
@@ -29,6 +28,7 @@ namespace {
 class Configuration : public ::testing::Test {
  protected:
   vtc::test::TestHome home;
+  vtc::test::LogCapture logged;
   vtc::test::FakeTime time;
   vtc::test::ApacheShare share;
   vtc::test::KeyPair keys{512};
@@ -43,7 +43,6 @@ class Configuration : public ::testing::Test {
     vtc::network::installAddressSource([] { return std::vector<std::string>{"192.168.1.2"}; });
     perUser("ConfigurationHost", vtc::Value("127.0.0.1:" + std::to_string(share.port())));
     prefs.setClientGuid("GUID-1");
-    perHost("LoggingLevel", vtc::Value("info"));
   }
   void TearDown() override {
     vtc::os::setReleaseFileForTesting("");
@@ -79,12 +78,10 @@ class Configuration : public ::testing::Test {
     return PreferenceStore::shared().copyValue("SyncsAfterHysteresis", "com.korvo.syncserver",
                                                Scope::AnyHost);
   }
-  std::string logText() const {
-    std::stringstream s;
-    s << std::ifstream(vtc::log::logFilePath()).rdbuf();
-    return s.str();
+  std::string url() const {
+    return "http://127.0.0.1:" + std::to_string(share.port()) + configPath +
+           "?osBuildVersion=1A234";
   }
-  bool logHas(const std::string& text) const { return logText().find(text) != std::string::npos; }
 };
 
 TEST_F(Configuration, AFreshDownloadIsVerifiedCachedAndOverriddenPerHost) {
@@ -106,10 +103,11 @@ TEST_F(Configuration, AFreshDownloadIsVerifiedCachedAndOverriddenPerHost) {
   EXPECT_EQ(c.get("guid").string(), "GUID-1");
   EXPECT_EQ(prefs.configTTLDate(), time.now() + std::chrono::hours(24));
   EXPECT_EQ(hysteresis().integer(), 45);
-  EXPECT_TRUE(logHas("Downloading new Nubilo Client configuration: http://127.0.0.1:" +
-                     std::to_string(share.port()) + configPath + "?osBuildVersion=1A234"))
-      << logText();
-  EXPECT_TRUE(logHas("Overriding configuration keys with byHost keys for (lock_duration_seconds)"));
+  EXPECT_EQ(logged.messages("Info"),
+            (std::vector<std::string>{
+                "Downloading new Nubilo Client configuration: " + url(),
+                "Cacheing Nubilo Client configuration",
+                "Overriding configuration keys with byHost keys for (lock_duration_seconds)"}));
 
   // Within its lifetime the cached copy serves, without a request or a new hysteresis.
   PreferenceStore::shared().setValue("SyncsAfterHysteresis", vtc::Value(), "com.korvo.syncserver",
@@ -118,6 +116,7 @@ TEST_F(Configuration, AFreshDownloadIsVerifiedCachedAndOverriddenPerHost) {
   EXPECT_EQ(prefs.defaultConfiguration().get("host_name").string(), "dav.example.org");
   EXPECT_EQ(downloads(), 1u);
   EXPECT_TRUE(hysteresis().isNone());
+  EXPECT_EQ(logged.count("Info", "Using cached Nubilo Client configuration"), 1u);
   // After it, a new download.
   time.advance(vtc::Seconds(86400));
   prefs.defaultConfiguration();
@@ -135,21 +134,26 @@ TEST_F(Configuration, WithSyncingOffABadSignatureOrAFailedDownloadTheOtherLayers
   serve(vtc::Dictionary{{"host_name", "evil.example.org"}}, vtc::test::KeyPair(512).privateKey);
   EXPECT_EQ(prefs.defaultConfiguration().get("host_name").string(), "sync.nubilo.example");
   EXPECT_TRUE(share.accessEntries().empty());
-  EXPECT_TRUE(logHas("Syncing not enabled and no cached config file, using default configuration"));
+  EXPECT_EQ(logged.messages("Info"),
+            std::vector<std::string>{
+                "Syncing not enabled and no cached config file, using default configuration"});
 
   prefs.setSyncTurnedOn(true);
   EXPECT_EQ(prefs.defaultConfiguration().get("host_name").string(), "sync.nubilo.example");
-  EXPECT_TRUE(
-      logHas("|Error|Failed to validate signature on config file, using default configuration"));
+  const std::string badSignature =
+      "Failed to validate signature on config file, using default configuration";
+  EXPECT_EQ(logged.messages("Error"), std::vector<std::string>{badSignature});
 
   std::filesystem::remove(share.diskPath(configPath));
   prefs.setConfigTTLDate(std::nullopt);
   EXPECT_EQ(prefs.defaultConfiguration().get("host_name").string(), "sync.nubilo.example");
-  std::string log = logText();
-  size_t failed = log.find("|Error|failed to download Nubilo configuration file from http://");
-  ASSERT_NE(failed, std::string::npos) << log;
-  EXPECT_NE(log.find("|Error|Failed to validate signature on config file", failed),
-            std::string::npos);
+  std::vector<std::string> errors = logged.messages("Error");
+  ASSERT_EQ(errors.size(), 3u);
+  // The fetch's own words stand between the URL and the closing blank.
+  EXPECT_THAT(errors[1], testing::StartsWith("failed to download Nubilo configuration file from " +
+                                             url() + " with error: "));
+  EXPECT_THAT(errors[1], testing::EndsWith(" using default configuration "));
+  EXPECT_EQ(errors[2], badSignature);
   EXPECT_FALSE(prefs.configTTLDate());  // a failed download does not move it
 }
 

@@ -19,6 +19,7 @@
 #include "platform/secrets/CredentialStore.h"
 #include "support/ApacheShare.h"
 #include "support/FakeTime.h"
+#include "support/LogCapture.h"
 #include "support/SessionBus.h"
 #include "support/TestHome.h"
 
@@ -70,6 +71,28 @@ TEST_F(PrefsCenter, FailureGuardsCountUpAFailedTagExpiresAndASuccessClearsThemAl
        {"FailedCount.Contacts", "etag.Contacts", "anchorClog.Contacts", "anchorCount.Contacts"})
     EXPECT_TRUE(perHost(key).isNone()) << key;
   EXPECT_EQ(perHost("anchorClog.Calendars").integer(), 12);  // other dataclasses untouched
+}
+
+TEST_F(PrefsCenter, AStoredFailedTagIsBelievedForTheConfiguredTimeOnly) {
+  vtc::test::LogCapture logged;
+  PreferenceStore::shared().setValue("inconsistency_ttl", vtc::Value(60), kVantorDefaultsKey,
+                                     Scope::AnyHost);
+  prefs.setFailedETag("\"t1\"", "Contacts");
+  EXPECT_EQ(perHost("etag.Contacts").string(), "\"t1\"");
+  EXPECT_EQ(perHost("etagTTL.Contacts").date(), time.now() + std::chrono::seconds(60));
+  EXPECT_THAT(logged.messages("Info"),
+              testing::Contains(testing::StartsWith(
+                  "Storing failed etag \"t1\" for dataclass Contacts with TTL date of 20")));
+  time.advance(vtc::Seconds(59));
+  EXPECT_EQ(prefs.failedETagForDataclass("Contacts"), "\"t1\"");
+  time.advance(vtc::Seconds(2));
+  EXPECT_FALSE(prefs.failedETagForDataclass("Contacts"));
+}
+
+TEST_F(PrefsCenter, AClientNameIsStoredWithoutControlCharacters) {
+  prefs.setClientName("Alice's\tMac\x07\n");
+  EXPECT_EQ(prefs.clientName(), "Alice'sMac");
+  EXPECT_EQ(perHost("ClientName").string(), "Alice'sMac");  // on disk too
 }
 
 TEST_F(PrefsCenter, ModesDefaultToSixAndAreSeenAcrossProcessesAfterAResync) {

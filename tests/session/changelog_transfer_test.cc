@@ -15,11 +15,10 @@
 #include "VantorSyncManager/HostIdentity.h"
 #include "VantorSyncManager/NubiloException.h"
 #include "VantorSyncManager/PublicNames.h"
-#include "common/Logging.h"
+#include "common/Format.h"
 #include "platform/dav/TesselSession.h"
 #include "platform/os/HostIdentity.h"
 #include "platform/plist/PlistCodec.h"
-#include "platform/prefs/PreferenceStore.h"
 #include "session/SyncReport.h"
 #include "support/FaultProxy.h"
 #include "support/Processes.h"
@@ -74,16 +73,7 @@ class Transfer : public vtc::test::ShareTest {
   vtc::test::FaultProxy proxy{share.port()};
   std::unique_ptr<NubiloRemoteSession> session;
 
-  void SetUp() override {
-    // Info lines are part of what is checked.
-    auto& store = vtc::prefs::PreferenceStore::shared();
-    store.setValue("LoggingLevel", vtc::Value("info"), "com.korvo.VantorSync",
-                   vtc::prefs::Scope::AnyHost);
-    ASSERT_TRUE(store.synchronize("com.korvo.VantorSync", vtc::prefs::Scope::AnyHost));
-    vtc::log::resetForTesting();
-    session = open("GUID-A", 1);
-  }
-  void TearDown() override { vtc::log::resetForTesting(); }
+  void SetUp() override { session = open("GUID-A", 1); }
 
   // A session through the proxy, waiting readTimeout seconds for an answer.
   std::unique_ptr<NubiloRemoteSession> open(const std::string& guid, int readTimeout = 30) const {
@@ -128,21 +118,6 @@ class Transfer : public vtc::test::ShareTest {
       ASSERT_TRUE(
           session->commitChanges(someChanges(1, "c" + std::to_string(i)), dataclass, i, i == 1));
   }
-  // "Level|message" of every line logged so far.
-  std::vector<std::string> logLines() const {
-    std::ifstream in(vtc::log::logFilePath());
-    std::vector<std::string> out;
-    for (std::string line; std::getline(in, line);) {
-      size_t first = line.find('|');
-      size_t second = first == std::string::npos ? first : line.find('|', first + 1);
-      if (second != std::string::npos) out.push_back(line.substr(second + 1));
-    }
-    return out;
-  }
-  size_t logged(const std::string& line) const {
-    auto all = logLines();
-    return std::count(all.begin(), all.end(), line);
-  }
 };
 
 using Commit = Transfer;
@@ -166,7 +141,7 @@ TEST_F(Commit, PublishesWithThreeRequestsBeyondTheLockAndLeavesNoTemporaryFile) 
   EXPECT_EQ(r.get("maxversion").string(), "00001");
   EXPECT_FALSE(r.find("minversion"));  // only a reset commit sets it
   EXPECT_EQ(r.get("lastsync").string(), vtc::textOf(vtc::Value(time.now())));
-  EXPECT_EQ(logged("Info|com.korvo.Contacts Uploading changeLog with index 1"), 1u);
+  EXPECT_EQ(logged.count("Info", "com.korvo.Contacts Uploading changeLog with index 1"), 1u);
 
   // What another computer reads back: the changes and the creator headers.
   auto log = NubiloChangeLog::createChangeLogWithData(
@@ -200,13 +175,15 @@ TEST_F(Commit, AnExistingChangelogIsOverwrittenOnlyWhenADayOld) {
   EXPECT_FALSE(hasTemporaryFile(kDataclass));
   EXPECT_EQ(maxversion(kDataclass), "00002");
   EXPECT_EQ(session->fetchChangeLogForDataclass(kDataclass, 2), (vtc::Bytes{'o', 'l', 'd'}));
-  EXPECT_THAT(logLines(), testing::Contains(StartsWith("Warning|Last modified date for " + final)));
+  EXPECT_THAT(logged.messages("Warning"),
+              testing::Contains(StartsWith("Last modified date for " + final)));
 
   // 25 hours: a leftover of an old failed commit, overwritten.
   time.advance(std::chrono::hours(2));
   EXPECT_TRUE(session->commitChanges(someChanges(1, "now"), kDataclass, 2, false));
-  EXPECT_EQ(logged("Warning|Last Modified date more than 1 day ago which likely indicates a stale "
-                   "changelog, overwriting..."),
+  EXPECT_EQ(logged.count("Warning",
+                         "Last Modified date more than 1 day ago which likely indicates a stale "
+                         "changelog, overwriting..."),
             1u);
   EXPECT_EQ(NubiloChangeLog(session->fetchChangeLogForDataclass(kDataclass, 2)).changes(),
             someChanges(1, "now"));
@@ -303,8 +280,8 @@ TEST_F(Commit, ATimedOutUploadIsTriedExactlyOnceMoreUnderANewName) {
   ASSERT_EQ(puts.size(), 2u);
   EXPECT_NE(puts[0], puts[1]);
   EXPECT_THAT(puts[1], StartsWith(quick->changeLogPathForDataclass(kDataclass, 1) + "."));
-  EXPECT_THAT(logLines(),
-              testing::Contains("Info|com.korvo.Contacts Upload of changeLog with index 1 failed "
+  EXPECT_THAT(logged.messages("Info"),
+              testing::Contains("com.korvo.Contacts Upload of changeLog with index 1 failed "
                                 "due to timeout retrying with new tmp path " +
                                 puts[1] + "..."));
   EXPECT_EQ(maxversion(kDataclass), "00001");
@@ -474,14 +451,14 @@ TEST_F(Fetch, GrowingBatchesAHoleInsideTheRangeAndMappedLargeChangelogs) {
         static_cast<int64_t>(std::filesystem::file_size(dataclassFolder(kDataclass) + "/" + name));
   EXPECT_EQ(fetched.StorageConsumed, total);
   for (const char* batch : {"1 to 5", "6 to 14", "15 to 20"})
-    EXPECT_EQ(logged(std::string("Info|Processing batched clogs from ") + batch +
-                     " for com.korvo.Contacts"),
+    EXPECT_EQ(logged.count("Info", std::string("Processing batched clogs from ") + batch +
+                                       " for com.korvo.Contacts"),
               1u)
         << batch;
-  EXPECT_EQ(logged("Info|Downloaded changelog 3 (" +
-                   std::to_string(
-                       std::filesystem::file_size(dataclassFolder(kDataclass) + "/00003.clog")) +
-                   " bytes) of 20 for dataclass com.korvo.Contacts"),
+  EXPECT_EQ(logged.count("Info", "Downloaded changelog 3 (" +
+                                     std::to_string(std::filesystem::file_size(
+                                         dataclassFolder(kDataclass) + "/00003.clog")) +
+                                     " bytes) of 20 for dataclass com.korvo.Contacts"),
             1u);
 
   // A single index; a 404 there is a failed download. Inside a range it is
@@ -636,8 +613,8 @@ TEST_F(Transfer, ReportsAreFlattenedAndStoredUnderTheMachinesUUID) {
   std::ofstream(home.path() + "/machine-id") << "0123456789abcdef0123456789abcdef\n";
   vtc::os::setIdentityFilesForTesting(home.path() + "/missing", home.path() + "/missing-too");
   EXPECT_FALSE(getHostUUIDString());
-  EXPECT_THAT(logLines(),
-              testing::Contains("Warning|getHostUUIDString: unable to determine UUID for host. "
+  EXPECT_THAT(logged.messages("Warning"),
+              testing::Contains("getHostUUIDString: unable to determine UUID for host. "
                                 "Error: 2"));
   vtc::os::setIdentityFilesForTesting(home.path() + "/missing", home.path() + "/machine-id");
   EXPECT_EQ(getHostUUIDString(), "01234567-89AB-CDEF-0123-456789ABCDEF");

@@ -8,15 +8,19 @@
 #include <filesystem>
 #include <set>
 
+#include "VantorSyncManager/AssertionHandler.h"
 #include "VantorSyncManager/NubiloException.h"
 #include "VantorSyncManager/PublicNames.h"
 #include "VantorSyncManager/VTCPrefsCenter.h"
+#include "common/Format.h"
 #include "platform/dav/TesselSession.h"
+#include "support/Failures.h"
 #include "support/FaultProxy.h"
 #include "support/ShareTest.h"
 
 using testing::StartsWith;
 using testing::ThrowsMessage;
+using vtc::test::ThrowsFailure;
 using vtc::test::TraceCapture;
 
 namespace {
@@ -33,12 +37,19 @@ class ShareBehindProxy : public vtc::test::ShareTest {
 
   // A client's session, through the proxy.
   std::unique_ptr<NubiloRemoteSession> open(const std::string& guid, const std::string& name,
-                                            int attempts = 3) {
+                                            int attempts = 3, const vtc::Dictionary& more = {}) {
     vtc::Dictionary overrides = clientOverrides(guid);
     overrides.merge({{"host_port", proxy.port()},
                      {"ClientName", name},
                      {"max_lock_acquire_attempts", attempts}});
+    overrides.merge(more);
     return openSession(overrides);
+  }
+  // The messages logged at this level that start with prefix.
+  std::vector<std::string> logs(const std::string& level, const std::string& prefix) const {
+    std::vector<std::string> out = logged.messages(level);
+    std::erase_if(out, [&](const std::string& m) { return !m.starts_with(prefix); });
+    return out;
   }
 
   // How many requests of this method on this path the proxy saw.
@@ -74,6 +85,9 @@ TEST_F(Retry, ATimeOutIsTriedOnceMoreAndTheSecondAnswerReturnedEvenANetworkFailu
   proxy.dropConnection({"PUT", path, 0});
   EXPECT_EQ(quick->putDataWithRetry({'x'}, path).errorType(), kNBNetworkError);
   EXPECT_EQ(seen("PUT", path), 2u);
+  EXPECT_EQ(logged.count("Warning", "putData transaction failed due to timeout, retrying..."), 1u);
+  EXPECT_THAT(logs("Info", "Transaction: "),
+              testing::ElementsAre(StartsWith("Transaction: <DavTransaction PUT " + path)));
   EXPECT_TRUE(time.sleeps().empty());
   // A retry report of two records tied together and to the session; no final one.
   quick->messageTraceTransactionFailure(DavTransaction(), true, 0, "no request, no records");
@@ -105,12 +119,19 @@ TEST_F(Retry, OnlyAMissingDownloadWaitsAndIsTriedAgainOtherFailuresAreReturnedAt
   t = session->moveResourceWithRetryAtPath(a, b, /*allowingOverwrite=*/false);
   EXPECT_FALSE(t.isSuccessful());
   EXPECT_EQ(t.httpStatusCode(), 412);
+  EXPECT_EQ(logged.messages("Warning"),
+            std::vector<std::string>{
+                "moveResorce transaction failed, resource already exists at destination " + b});
   EXPECT_TRUE(session->moveResourceWithRetryAtPath(a, b).isSuccessful());
   EXPECT_TRUE(traces.records().empty());
   EXPECT_TRUE(time.sleeps().empty());
 
   EXPECT_EQ(session->getDataWithRetryAtPath(schemas + "/00001.clog").httpStatusCode(), 404);
   EXPECT_EQ(time.sleeps(), std::vector<double>{30});
+  EXPECT_EQ(
+      logged.count("Warning", "getData transaction failed due to 404 file not found at path " +
+                                  schemas + "/00001.clog, retrying..."),
+      1u);
   ASSERT_EQ(traces.withDomain(kRetry).size(), 2u);
   EXPECT_EQ(field(kRetry, 1, "COM_KORVO_MESSAGE_VALUE"), "1");
   ASSERT_EQ(traces.withDomain(kFinal).size(), 1u);
@@ -132,6 +153,8 @@ TEST_F(Retry, AServerThatWentAwayRaisesANetworkFailure) {
   EXPECT_EQ(field(kFinal, 0, "COM_KORVO_MESSAGE_UUID"), field(kRetry, 0, "COM_KORVO_MESSAGE_UUID"));
   EXPECT_EQ(field(kCode, 0, "COM_KORVO_MESSAGE_SIGNATURE"), "kNBNetworkError");
   EXPECT_TRUE(time.sleeps().empty());
+  EXPECT_EQ(logged.messages("Warning"),
+            std::vector<std::string>{"putData transaction failed due to network error raising..."});
 }
 
 TEST_F(Locking, AContenderWaitsOutItsAttemptsAndLearnsWhoHoldsTheLock) {
@@ -151,23 +174,43 @@ TEST_F(Locking, AContenderWaitsOutItsAttemptsAndLearnsWhoHoldsTheLock) {
     EXPECT_EQ(holders[0].dictionary().get("clientname").string(), "Alice's Mac");
   }
   EXPECT_EQ(proxy.count("LOCK") - locks, 4u);  // max attempts + 1
-  // Pauses that never shrink, and never pass the ceiling.
+  // Pauses that never shrink.
   std::vector<double> pauses = time.sleeps();
   ASSERT_EQ(pauses.size(), 3u);
   EXPECT_TRUE(std::is_sorted(pauses.begin(), pauses.end()));
-  EXPECT_LE(pauses.back(), 90.0);
   ASSERT_EQ(traces.withDomain(kRetry).size(), 3u);
   for (size_t i = 0; i < 3; ++i)
     EXPECT_EQ(field(kRetry, i, "COM_KORVO_MESSAGE_VALUE"), std::to_string(i));
   EXPECT_TRUE(traces.withDomain(kFinal).empty());
   EXPECT_TRUE(b->lockedResources().empty());
+  const std::string target = schemas + "/Contacts/";
+  auto attempts = logs("Warning", "Lock attempt ");
+  ASSERT_EQ(attempts.size(), 3u);
+  for (size_t i = 0; i < 3; ++i)
+    EXPECT_EQ(attempts[i], vtc::format("Lock attempt %d of %@ failed, retrying in %d seconds",
+                                       int(i + 1), target, int(pauses[i])));
+  EXPECT_EQ(logs("Warning", "Failed to lock "),
+            std::vector<std::string>{"Failed to lock " + target +
+                                     " after 3 lock attempts, raising exception"});
+
+  // A long configured pause is held to the 90-second ceiling.
+  auto c = open("GUID-C", "Carol's Mac", 3, {{"lock_acquire_sleep_seconds", 1000000000}});
+  EXPECT_THAT([&] { c->lockDataclass("Contacts"); }, ThrowsFailure(NubiloLockFailureException));
+  pauses = time.sleeps();
+  ASSERT_EQ(pauses.size(), 6u);
+  EXPECT_TRUE(std::all_of(pauses.begin() + 3, pauses.end(), [](double p) { return p <= 90.0; }));
+  EXPECT_EQ(pauses.back(), 90.0);
+  EXPECT_EQ(logs("Warning", "Lock attempt 3 of ").back(),
+            "Lock attempt 3 of " + target + " failed, retrying in 90 seconds");
 
   // Once the holder lets go, the contender gets the lock at once.
   session->unlockDataclass("Contacts");
   EXPECT_TRUE(session->lockedResources().empty());
   b->lockDataclass("Contacts");
-  EXPECT_EQ(time.sleeps().size(), 3u);
-  EXPECT_EQ(b->lockedResources(), std::set<std::string>{schemas + "/Contacts/"});
+  EXPECT_EQ(time.sleeps().size(), 6u);
+  EXPECT_EQ(b->lockedResources(), std::set<std::string>{target});
+  EXPECT_EQ(logged.count("Info", "Locking dataclass Contacts"), 2u);
+  EXPECT_EQ(logged.count("Info", "Unlocking dataclass Contacts"), 1u);
 }
 
 TEST_F(Locking, WithNoRetriesOneRefusalFailsAtOnceAndAReleasedSessionUnlocksWhatItHeld) {
@@ -178,11 +221,21 @@ TEST_F(Locking, WithNoRetriesOneRefusalFailsAtOnceAndAReleasedSessionUnlocksWhat
   EXPECT_EQ(session->lockedResources(),
             (std::set<std::string>{session->clientsPath() + "/GUID-A.client", schemas + "/"}));
   size_t locks = proxy.count("LOCK");
-  EXPECT_THROW(b->lockClient("GUID-A"), NubiloException);
+  EXPECT_THAT([&] { b->lockClient("GUID-A"); }, ThrowsFailure(NubiloLockFailureException));
   EXPECT_EQ(proxy.count("LOCK") - locks, 1u);
   EXPECT_TRUE(time.sleeps().empty());
   EXPECT_TRUE(traces.records().empty());
+  const std::string client = session->clientsPath() + "/GUID-A.client";
+  EXPECT_EQ(logs("Warning", "Failed to lock "),
+            std::vector<std::string>{"Failed to lock " + client +
+                                     " after 0 lock attempts, raising exception"});
   session.reset();
+  EXPECT_EQ(
+      logs("Warning", "Resource "),
+      (std::vector<std::string>{
+          "Resource " + client + " appears to still be locked when ending session, unlocking...",
+          "Resource " + schemas +
+              "/ appears to still be locked when ending session, unlocking..."}));
   b->lockClient("GUID-A");
   b->lockDataclasses();
   EXPECT_EQ(b->lockedResources().size(), 2u);
@@ -196,6 +249,11 @@ TEST_F(Locking, LocksOnMissingOrForgottenResourcesFail) {
               ThrowsMessage<NubiloException>(StartsWith("NubiloResourceNotFoundException: ")));
   EXPECT_TRUE(time.sleeps().empty());
   EXPECT_EQ(traces.withDomain(kFinal).size(), 2u);
+  EXPECT_EQ(logs("Warning", "Lock transaction failed due to resource not found at "),
+            (std::vector<std::string>{"Lock transaction failed due to resource not found at " +
+                                          session->clientsPath() + "/NOBODY.client",
+                                      "Lock transaction failed due to resource not found at " +
+                                          schemas + "/Unregistered/"}));
   session->unlockClient("NOBODY");  // logged, never raised
 
   // A lock the server forgot, as one that timed out, can be neither renewed
@@ -212,6 +270,10 @@ TEST_F(Locking, LocksOnMissingOrForgottenResourcesFail) {
   EXPECT_EQ(field(kFinal, 2, "MESSAGE"), "Failed to relock resource");
   session->unlockDataclass("Contacts");
   EXPECT_EQ(session->lockedResources().size(), 1u);  // kept for the release to try again
+  const std::string contacts = schemas + "/Contacts/";
+  EXPECT_EQ(logged.count("Warning", "Failed to unlock resource " + contacts + ", retrying..."), 1u);
+  EXPECT_EQ(logged.messages("Error").back(),
+            "Failed to unlock resource (lock not held), " + contacts);
 }
 
 TEST_F(Locking, ALockCutOffIsRaisedAfterOnePauseAndAFailedUnlockIsKeptForTheRelease) {
@@ -241,6 +303,49 @@ TEST_F(Locking, ALockCutOffIsRaisedAfterOnePauseAndAFailedUnlockIsKeptForTheRele
   EXPECT_EQ(proxy.requests().back().action, "forwarded");
 }
 
+TEST_F(Locking, ALockThatExpiredIsTakenAgainAndOnlyAMissingTargetIsNotFound) {
+  const std::string client = session->clientsPath() + "/GUID-A.client";
+  session->tesselSession().putData({}, client);
+  session->lockClient();
+  share.forgetLocks();  // expired on the server; the session still holds its token
+  session->lockClient();
+  EXPECT_EQ(session->lockedResources(), std::set<std::string>{client});
+  auto b = open("GUID-B", "Bob's Mac", /*attempts=*/0);
+  EXPECT_THAT([&] { b->lockClient("GUID-A"); }, ThrowsFailure(NubiloLockFailureException));
+
+  // Gone while locked: the stale token set aside, the target is missing.
+  session->tesselSession().deleteResourceAtPath(client);
+  EXPECT_THAT([&] { session->lockClient(); }, ThrowsFailure(NubiloClientRegistrationException));
+  // A missing parent is as missing as the target, with no waiting.
+  EXPECT_THAT([&] { session->lockDataclass("Missing/Inner"); },
+              ThrowsFailure(NubiloResourceNotFoundException));
+  EXPECT_TRUE(time.sleeps().empty());
+}
+
+TEST_F(Locking, ALockWhoseRenewalOrReleaseWasRefusedIsStillReleasedOnTheServer) {
+  const std::string target = schemas + "/Contacts/";
+  session->tesselSession().makeCollectionAtPath(schemas + "/Contacts", false);
+  session->lockDataclass("Contacts");
+  proxy.answer({"LOCK", target, 0}, 423);
+  EXPECT_THAT([&] { session->relockDataclass("Contacts"); },
+              ThrowsFailure(NubiloRelockFailureException));
+  proxy.clear();
+  session->unlockDataclass("Contacts");
+  EXPECT_EQ(seen("UNLOCK", target), 1u);
+  EXPECT_TRUE(session->lockedResources().empty());
+
+  session->lockDataclass("Contacts");
+  proxy.answer({"UNLOCK", target, 0}, 403);
+  session->unlockDataclass("Contacts");
+  EXPECT_EQ(seen("UNLOCK", target), 3u);  // both tries sent
+  proxy.clear();
+  session.reset();  // the release sends it once more, and the server lets go
+  EXPECT_EQ(seen("UNLOCK", target), 4u);
+  auto b = open("GUID-B", "Bob's Mac", /*attempts=*/0);
+  b->lockDataclass("Contacts");
+  EXPECT_EQ(b->lockedResources(), std::set<std::string>{target});
+}
+
 TEST_F(Registry, ADataclassFromUnregisteredToPopulatedToResetToGone) {
   const std::string dc = "com.korvo.Contacts";
   NubiloRemoteSession& a = *session;
@@ -251,6 +356,7 @@ TEST_F(Registry, ADataclassFromUnregisteredToPopulatedToResetToGone) {
   EXPECT_THAT(a.getDataclassInfo(dc).keys(),  // registers it
               testing::UnorderedElementsAre("DAV:getetag", "dataclassname", "displayname"));
   EXPECT_EQ(recordAt(*observer, collection).get("dataclassname").string(), dc);
+  EXPECT_EQ(logged.count("Info", "Creating dataclass directory for " + dc), 1u);
   EXPECT_EQ(a.dataclassNames(), std::vector<std::string>{dc});
   EXPECT_TRUE(a.validPropertiesForDataclass(dc));
 
@@ -299,37 +405,65 @@ TEST_F(Registry, ADataclassFromUnregisteredToPopulatedToResetToGone) {
   EXPECT_EQ(proxy.requests().size() - sent, 4u);  // relock, listing, two reads
   a.unlockClients();
 
+  // Unregistered, the dataclass leaves the listing; another one stays.
+  a.getDataclassInfo("com.korvo.Calendars");
+  EXPECT_EQ(a.getAllDataclassInfo().size(), 2u);
   a.unlockDataclass(dc);
   EXPECT_TRUE(a.unregisterDataclass(dc));
   EXPECT_TRUE(recordAt(*observer, collection).empty());
-  EXPECT_TRUE(a.getAllDataclassInfo().empty());
+  vtc::Array left = a.getAllDataclassInfo();
+  ASSERT_EQ(left.size(), 1u);
+  EXPECT_EQ(left[0].dictionary().get("dataclassname").string(), "com.korvo.Calendars");
+  EXPECT_EQ(left[0].dictionary().get("displayname").string(), "com.korvo.Calendars");
   EXPECT_TRUE(a.lockedResources().empty());
 }
 
 TEST_F(Registry, ClientsRegisterAndABrokenRecordIsCleanedUp) {
   auto& a = session;
   auto b = open("GUID-B", "Bob's Mac");
-  auto c = open("GUID-C", "Carol's Mac");
+  auto c = open("GUID C", "Carol's Mac");
   EXPECT_TRUE(a->registerClient("GUID-A", "Alice's \x07Mac"));
   EXPECT_TRUE(b->registerClient("GUID-B", "Bob's Mac"));
-  EXPECT_TRUE(c->registerClient("GUID-C", "Carol's Mac"));
-  EXPECT_THROW(a->registerClient("GUID-A", "again"), NubiloException);
+  EXPECT_TRUE(c->registerClient("GUID C", "Carol's Mac"));
+  EXPECT_THAT([&] { a->registerClient("GUID-A", "again"); },
+              ThrowsFailure(NubiloClientRegistrationException));
+  EXPECT_EQ(logged.count("Warning",
+                         "Attempt to register client that is already registered GUID:GUID-A "
+                         "Name:again"),
+            1u);
 
   vtc::Dictionary record = b->getClientInfo("GUID-A");
   EXPECT_EQ(record.get("clientname").string(), "Alice's Mac");
   EXPECT_EQ(record.get("classname").string(), "bramble");
   EXPECT_EQ(record.get("buildversion").string(), "VantorSyncClient-488.5");
-  EXPECT_EQ(VTCPrefsCenter::defaultCenter().clientGuid(), "GUID-C");  // the last to register here
+  EXPECT_EQ(VTCPrefsCenter::defaultCenter().clientGuid(), "GUID C");  // the last to register here
 
-  // Carol's record loses its name: listed once more, then removed.
-  c->setInfoForClient(vtc::Dictionary{{"clientname", kNBRemoveProp}}, "GUID-C");
+  // Carol's record loses its name: listed once more, then removed, though
+  // the server escapes her guid in its href.
+  // A resource registered without a guid is removed unlisted.
+  c->setInfoForClient(vtc::Dictionary{{"clientname", kNBRemoveProp}}, "GUID C");
+  a->tesselSession().putData({}, a->clientsPath() + "/.client");
   EXPECT_EQ(a->getAllClientInfo().size(), 3u);
-  EXPECT_FALSE(std::filesystem::exists(share.diskPath(a->clientsPath() + "/GUID-C.client")));
+  EXPECT_FALSE(std::filesystem::exists(share.diskPath(a->clientsPath() + "/GUID C.client")));
+  EXPECT_FALSE(std::filesystem::exists(share.diskPath(a->clientsPath() + "/.client")));
+  EXPECT_THAT(logged.messages("Error"),
+              testing::UnorderedElementsAre(
+                  "Invalid client found removing...",
+                  "Missing guid or name found on client /Library/Application%20Support/SyncWorks/"
+                  "Clients/GUID%20C.client removing..."));
+  EXPECT_EQ(logged.count("Info", "Unregistering client GUID C"), 1u);
   EXPECT_EQ(a->getAllClientInfo().size(), 2u);
-  EXPECT_THAT([&] { a->getClientInfo("GUID-C"); },
-              ThrowsMessage<NubiloException>(StartsWith("NubiloClientRegistrationException: ")));
+  EXPECT_THAT([&] { a->getClientInfo("GUID C"); },
+              ThrowsFailure(NubiloClientRegistrationException));
+  EXPECT_EQ(logged.messages("Error").back(), "Failed to obtain client info for GUID C");
   EXPECT_TRUE(b->unregisterClient("GUID-B"));
   EXPECT_EQ(a->getAllClientInfo().size(), 1u);
+
+  // A record is looked up under the href asked for: the server spells this
+  // one's "&" unescaped, and the record comes back empty, not as a failure.
+  EXPECT_TRUE(a->registerClient("G&1", "Gee"));
+  EXPECT_TRUE(a->getClientInfo("G&1").empty());
+  EXPECT_EQ(a->getAllClientInfo().size(), 2u);
 }
 
 TEST_F(Registry, ARefusedMoveMakesTheResetDeleteChangelogByChangelogRenewingItsLocks) {
@@ -358,6 +492,15 @@ TEST_F(Registry, ARefusedMoveMakesTheResetDeleteChangelogByChangelogRenewingItsL
   ASSERT_EQ(traces.withDomain(kRetry).size(), 1u);
   EXPECT_EQ(field(kRetry, 0, "MESSAGE"), "Failed to move dataclass aside for reset");
   EXPECT_EQ(field(kCode, 0, "COM_KORVO_MESSAGE_SIGNATURE2"), "500");
+  EXPECT_EQ(logged.count("Warning",
+                         "Failed to move Contacts dataclass collection aside for reset "
+                         "(probably too many clogs), reverting to removing clogs "
+                         "individually"),
+            1u);
+  std::vector<std::string> removals = logs("Info", "Removing changelog ");
+  ASSERT_EQ(removals.size(), 6u);
+  EXPECT_EQ(removals.front(), "Removing changelog 3 for dataclass Contacts");
+  EXPECT_EQ(removals.back(), "Removing changelog 8 for dataclass Contacts");
 }
 
 TEST_F(Registry, RegistrationWaitsOutAuthorizationFailuresAndRecordReadsNameTheAccountsTrouble) {
@@ -365,6 +508,9 @@ TEST_F(Registry, RegistrationWaitsOutAuthorizationFailuresAndRecordReadsNameTheA
   proxy.answer({"PROPFIND", client, 0}, 401);
   EXPECT_TRUE(session->registerClient("GUID-B", "Bob"));
   EXPECT_EQ(time.sleeps(), (std::vector<double>{30, 30, 30}));
+  EXPECT_EQ(logged.count("Warning", "Authorization failure accessing " + client +
+                                        ", trying again in 30 seconds"),
+            3u);
   ASSERT_EQ(traces.withDomain(kFinal).size(), 1u);
   EXPECT_EQ(field(kFinal, 0, "MESSAGE"), "Failed to get basic attributes on Client");
   proxy.clear();
@@ -385,6 +531,33 @@ TEST_F(Registry, RegistrationWaitsOutAuthorizationFailuresAndRecordReadsNameTheA
               ThrowsMessage<NubiloException>(StartsWith("NubiloAccountExpiredException: ")));
   proxy.answer({"DELETE", client, 0}, 500);
   EXPECT_FALSE(session->unregisterClient("GUID-B"));
+}
+
+TEST_F(Registry, AClientWithoutGuidOrNameIsAnAssertionFailureBeforeAnyRequest) {
+  size_t sent = proxy.requests().size();
+  try {
+    session->registerClient("", "Nameless");
+    FAIL() << "no assertion";
+  } catch (const vtc::AssertionFailure& e) {
+    EXPECT_EQ(e.description(), "registerClient: client guid is missing!");
+    EXPECT_EQ(e.className(), "NubiloRemoteSession");
+    EXPECT_EQ(e.file(), "ClientRegistry.cc");
+    EXPECT_THAT(logged.messages("Error"),
+                testing::ElementsAre("Assertion failure in NubiloRemoteSession::registerClient, "
+                                     "ClientRegistry.cc:" +
+                                     std::to_string(e.line()) +
+                                     ": registerClient: client guid is missing!"));
+  }
+  EXPECT_THAT([&] { session->registerClient("GUID-N", ""); },
+              ThrowsMessage<vtc::AssertionFailure>("registerClient: client name is missing!"));
+  // A policy that carries on registers nothing either.
+  vtc::setAssertionPolicy(vtc::AssertionPolicy::Continue);
+  EXPECT_FALSE(session->registerClient("", "Nameless"));
+  vtc::setAssertionPolicy(vtc::AssertionPolicy::Throw);
+  EXPECT_EQ(logged.messages("Error").size(), 3u);
+  EXPECT_EQ(proxy.requests().size(), sent);
+  EXPECT_FALSE(std::filesystem::exists(share.diskPath(session->clientsPath() + "/.client")));
+  EXPECT_FALSE(VTCPrefsCenter::defaultCenter().clientGuid());
 }
 
 TEST_F(Registry, EntityTagsCompareWithoutTheWeakPrefix) {

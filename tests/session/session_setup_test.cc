@@ -13,11 +13,13 @@
 #include "VantorSyncManager/NubiloException.h"
 #include "VantorSyncManager/PublicNames.h"
 #include "platform/dav/TesselSession.h"
+#include "support/Failures.h"
 #include "support/ShareTest.h"
 
 using testing::HasSubstr;
 using testing::ThrowsMessage;
 using vtc::test::ApacheShare;
+using vtc::test::ThrowsFailure;
 
 namespace {
 
@@ -41,6 +43,7 @@ TEST_F(SessionSetup, CreatesTheSyncAreaNotesTheRespondingServerAndRemovesTheArea
   EXPECT_EQ(session->clientsPath(), sync + "/Clients");
   EXPECT_EQ(session->schemasPath(), sync + "/Schemas");
   EXPECT_EQ(session->respondingServer(), "dav-test-1");
+  EXPECT_EQ(logged.count("Info", "Responding server: dav-test-1"), 1u);
   EXPECT_EQ(session->eventUUID().size(), 36u);
   EXPECT_TRUE(time.sleeps().empty());
 
@@ -66,6 +69,9 @@ TEST_F(SessionSetup, AWrongPasswordFailsAtOnceAndAServerDownAfterRetriesThroughT
           "NubiloLoginFailureException: Failed to validate credentials for alice"));
   EXPECT_TRUE(time.sleeps().empty());
   EXPECT_TRUE(traces.records().empty());
+  EXPECT_EQ(
+      logged.messages("Error"),
+      std::vector<std::string>{"Failed to validate credentials for alice, Raising exception"});
 
   vtc::Dictionary down{{"host_port", vtc::test::freeLoopbackPort()}};
   EXPECT_THAT([&] { openSession(down); },
@@ -82,10 +88,16 @@ TEST_F(SessionSetup, AWrongPasswordFailsAtOnceAndAServerDownAfterRetriesThroughT
   EXPECT_EQ(traces.field(finals[1], "COM_KORVO_MESSAGE_SIGNATURE"), "Raised Exception");
   EXPECT_EQ(traces.field(retries[0], "COM_KORVO_MESSAGE_EVENT"),
             traces.field(finals[1], "COM_KORVO_MESSAGE_EVENT"));
+  std::vector<std::string> warnings = logged.messages("Warning");
+  ASSERT_EQ(warnings.size(), 3u);
+  EXPECT_THAT(warnings[0], testing::MatchesRegex("Failed to validate credentials due to error "
+                                                 "<DavTransaction .*>, retrying\\.\\.\\."));
+  EXPECT_EQ(logged.messages("Error").back(),
+            "Failed to validate credentials due to NetworkError for alice, Raising exception");
 
   // With no retries allowed, the one check is all.
   down.set("max_lock_acquire_attempts", 0);
-  EXPECT_THROW(openSession(down), NubiloException);
+  EXPECT_THAT([&] { openSession(down); }, ThrowsFailure(NubiloNetworkFailureException));
   EXPECT_EQ(time.sleeps().size(), 3u);
   retries = traces.withDomain("com.korvo.sync.nubilosession.retrytransaction");
   ASSERT_EQ(retries.size(), 5u);

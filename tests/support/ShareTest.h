@@ -1,5 +1,6 @@
-// The common ground of the session tests: a temporary home, fake time,
-// captured message traces and a private share, and sessions opened on it.
+// The common ground of the session tests: a temporary home, its log read
+// back (at Info), fake time, captured message traces and a private share,
+// and sessions opened on it.
 #pragma once
 
 #include <gtest/gtest.h>
@@ -10,6 +11,7 @@
 #include "VantorSyncManager/NubiloRemoteSession.h"
 #include "support/ApacheShare.h"
 #include "support/FakeTime.h"
+#include "support/LogCapture.h"
 #include "support/TestHome.h"
 #include "support/TraceCapture.h"
 
@@ -18,6 +20,7 @@ namespace vtc::test {
 class ShareTest : public ::testing::Test {
  protected:
   TestHome home;
+  LogCapture logged;
   FakeTime time;
   TraceCapture traces;
   ApacheShare share;

@@ -4,6 +4,7 @@
 
 #include <filesystem>
 
+#include "VantorSyncManager/VTCPrefsCenter.h"
 #include "common/Logging.h"
 #include "platform/prefs/PreferenceStore.h"
 
@@ -16,8 +17,9 @@ TestHome::TestHome() {
   setenv("HOME", path_.c_str(), 1);
   unsetenv("XDG_CACHE_HOME");
   unsetenv("XDG_DATA_HOME");
-  // Preferences and the log belong to a home.
+  // Preferences, the configuration built from them and the log belong to a home.
   prefs::PreferenceStore::shared().resetForTesting();
+  VTCPrefsCenter::defaultCenter().resetConfigurationForTesting();
   log::resetForTesting();
 }
 

@@ -38,7 +38,8 @@ std::vector<PropfindEntry> readMultistatus(const XmlElement& root) {
     const XmlElement* href = response->child(kDav, "href");
     if (!href) continue;
     PropfindEntry entry;
-    entry.path = davpath::fromHref(trim(href->allText()));
+    entry.href = trim(href->allText());
+    entry.path = davpath::fromHref(entry.href);
     for (const XmlElement* propstat : response->childrenNamed(kDav, "propstat")) {
       if (statusCode(propstat->child(kDav, "status")) / 100 != 2) continue;
       const XmlElement* prop = propstat->child(kDav, "prop");

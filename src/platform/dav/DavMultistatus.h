@@ -13,6 +13,7 @@
 namespace vtc {
 
 struct PropfindEntry {
+  std::string href;       // the href as the server sent it
   std::string path;       // unescaped path of the href
   Dictionary properties;  // full property name -> text (2xx propstats only)
   const XmlElement* lockDiscovery = nullptr;

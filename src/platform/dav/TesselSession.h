@@ -49,10 +49,14 @@ class TesselSession {
                                       bool includingIntermediateCollections);
   DavTransaction deleteResourceAtPath(const std::string& path);
 
-  // Locks (depth 0, exclusive, write). A lock of a missing resource fails as
-  // not found (result 104, HTTP 404) instead of leaving a lock-null resource.
-  // A granted lock is checked in the lock discovery; one that the server
-  // gave to another client at the same moment fails as locked (HTTP 423).
+  // Locks (depth 0, exclusive, write). A lock of a missing resource, or of
+  // one whose parent is missing, fails as not found (result 104, HTTP 404)
+  // instead of leaving a lock-null resource. A lock of a path whose earlier
+  // lock the server no longer knows sets that lock's token aside and asks
+  // again. A granted lock is checked in the lock discovery; one that the
+  // server gave to another client at the same moment fails as locked (HTTP
+  // 423). A lock leaves the lock store only when an unlock succeeds or a new
+  // lock of the same path replaces it: a refused relock or unlock keeps it.
   DavTransaction lockResourceAtPath(const std::string& path);
   DavTransaction unlockResourceAtPath(const std::string& path);
   DavTransaction _lockResourceAtPath(const std::string& path, double duration,
@@ -63,7 +67,10 @@ class TesselSession {
 
   // PROPFIND: props are full names ("DAV:getetag", namespace + local name);
   // an empty list asks for all properties. The result maps each resource's
-  // unescaped path to a dictionary from full property name to text.
+  // href, as the server sent it, to a dictionary from full property name to
+  // text. A server that echoes the request's escaping keys the resource asked
+  // for by vtc::davpath::escape(path); one that escapes otherwise, or sends
+  // whole URLs, does not.
   DavTransaction _issuePropFindAtPath(const std::string& path, int32_t depth,
                                       const std::vector<std::string>& props, bool includingParent);
   DavTransaction _issuePropFindAtPath(const std::string& path, int32_t depth,

@@ -51,32 +51,45 @@ DavTransaction TesselSession::_lockResourceAtPath(const std::string& path, doubl
       "</lockscope><locktype><write/></locktype><owner>" +
       owner + "</owner></lockinfo>\n";
   std::string token;
-  DavTransaction t = connection_->perform("LOCK", path, [&] {
-    // Built here rather than by neon's lock call, which marks the request
-    // non-idempotent and so opens a new connection for every lock.
-    ne_request* req = ne_request_create(connection_->session(), "LOCK", escaped.c_str());
-    ne_set_request_body_buffer(req, body.data(), body.size());
-    ne_add_request_header(req, "Content-Type", "application/xml");
-    ne_add_depth_header(req, NE_DEPTH_ZERO);
-    ne_print_request_header(req, "Timeout", "Second-%ld", seconds);
-    // Without it the server would lock a missing resource into being.
-    ne_add_request_header(req, "If-Match", "*");
-    ne_lock_using_parent(req, escaped.c_str());
-    ne_lock_using_resource(req, escaped.c_str(), NE_DEPTH_ZERO);
-    int ret = vtc::dispatchExpectingSuccess(req);
-    if (ret == NE_OK) {
-      const char* header = ne_get_response_header(req, "Lock-Token");
-      token = header ? header : "";
-      if (token.size() > 2 && token.front() == '<' && token.back() == '>')
-        token = token.substr(1, token.size() - 2);
-      if (token.empty()) {
-        ne_set_error(connection_->session(), "LOCK answer without a lock token");
-        ret = NE_ERROR;
+  auto send = [&] {
+    return connection_->perform("LOCK", path, [&] {
+      // Built here rather than by neon's lock call, which marks the request
+      // non-idempotent and so opens a new connection for every lock.
+      ne_request* req = ne_request_create(connection_->session(), "LOCK", escaped.c_str());
+      ne_set_request_body_buffer(req, body.data(), body.size());
+      ne_add_request_header(req, "Content-Type", "application/xml");
+      ne_add_depth_header(req, NE_DEPTH_ZERO);
+      ne_print_request_header(req, "Timeout", "Second-%ld", seconds);
+      // Without it the server would lock a missing resource into being.
+      ne_add_request_header(req, "If-Match", "*");
+      ne_lock_using_parent(req, escaped.c_str());
+      ne_lock_using_resource(req, escaped.c_str(), NE_DEPTH_ZERO);
+      int ret = vtc::dispatchExpectingSuccess(req);
+      if (ret == NE_OK) {
+        const char* header = ne_get_response_header(req, "Lock-Token");
+        token = header ? header : "";
+        if (token.size() > 2 && token.front() == '<' && token.back() == '>')
+          token = token.substr(1, token.size() - 2);
+        if (token.empty()) {
+          ne_set_error(connection_->session(), "LOCK answer without a lock token");
+          ret = NE_ERROR;
+        }
       }
+      ne_request_destroy(req);
+      return ret;
+    });
+  };
+  DavTransaction t = send();
+  if (!t.isSuccessful() && t.httpStatusCode() == 412) {
+    // A precondition failed: the target is missing (If-Match) or the token of
+    // an earlier lock of this path, sent in the If header, is one the server
+    // no longer knows. Either way that lock is gone; without its token the
+    // answer tells the two apart.
+    if (struct ne_lock* stale = findLock(*connection_, escaped)) {
+      forgetLock(*connection_, stale);
+      t = send();
     }
-    ne_request_destroy(req);
-    return ret;
-  });
+  }
   if (t.isSuccessful()) {
     if (struct ne_lock* old = findLock(*connection_, escaped)) forgetLock(*connection_, old);
     struct ne_lock* lock = ne_lock_create();
@@ -97,7 +110,9 @@ DavTransaction TesselSession::_lockResourceAtPath(const std::string& path, doubl
       t.setOutcome(false, 153, 423, vtc::kTransactionCompleted);
       t.setErrorText("the server gave this lock to another client at the same moment");
     }
-  } else if (t.httpStatusCode() == 412) {
+  } else if (t.httpStatusCode() == 412 || t.httpStatusCode() == 409) {
+    // With no token of this path sent, a 412 is the If-Match failing; a 409
+    // names a missing parent. Either way the target is not there.
     t.setOutcome(false, 104, 404, t.transactionState());
   }
   return t;
@@ -134,12 +149,9 @@ DavTransaction TesselSession::_relockResourceAtPath(const std::string& path, dou
     ne_request_destroy(req);
     return ret;
   });
-  if (t.isSuccessful()) {
-    lock->timeout = seconds;
-  } else if (t.httpStatusCode() / 100 == 4) {
-    // The server no longer knows the lock: stop presenting its token.
-    forgetLock(*connection_, lock);
-  }
+  // A refused renewal keeps the lock: it may still be held on the server,
+  // and only an unlock that succeeds, or a new lock of the path, ends it here.
+  if (t.isSuccessful()) lock->timeout = seconds;
   return t;
 }
 
@@ -149,7 +161,9 @@ DavTransaction TesselSession::_unlockResourceAtPath(const std::string& path) {
   if (!lock) return notHeld("UNLOCK", path);
   DavTransaction t =
       connection_->perform("UNLOCK", path, [&] { return ne_unlock(connection_->session(), lock); });
-  if (t.isSuccessful() || t.httpStatusCode() / 100 == 4) forgetLock(*connection_, lock);
+  // Kept after a failure, so that a second try, or the release of the
+  // session, still sends the token.
+  if (t.isSuccessful()) forgetLock(*connection_, lock);
   return t;
 }
 

@@ -80,7 +80,7 @@ DavTransaction TesselSession::propfind(const std::string& path, int32_t depth,
     vtc::Dictionary result;
     for (auto& entry : entries) {
       if (!includingParent && depth > 0 && vtc::davpath::canonical(entry.path) == self) continue;
-      result.set(entry.path, vtc::Value(std::move(entry.properties)));
+      result.set(entry.href, vtc::Value(std::move(entry.properties)));
     }
     t.setResult(vtc::Value(std::move(result)));
   });

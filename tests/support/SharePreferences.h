@@ -1,0 +1,14 @@
+// Points this home's per-user preferences at a share, so that the preference
+// store's configuration opens sessions on it, the way a user's setup does.
+#pragma once
+
+#include "support/ApacheShare.h"
+
+namespace vtc::test {
+
+// Writes the share's server and locking keys (not the client identity) as
+// per-user preferences; port, when given, is that of a proxy in front of it.
+// Call before the first use of the preference store's configuration.
+void storeShareInPreferences(const ApacheShare& share, int port = 0);
+
+}  // namespace vtc::test
