@@ -20,13 +20,14 @@ double nowSeconds() {
 struct Competing {
   Value value;  // none for a clear
   std::string client;
+  std::string origin;
   double pushed;
 };
 
 }  // namespace
 
 void SqliteEngine::push(const std::string& client, const std::string& dataclass,
-                        const std::vector<SyncEngineChange>& changes) {
+                        const std::vector<SyncEngineChange>& changes, const PushOptions& options) {
   // Checked first: nothing of a push with an invalid value is applied.
   for (const SyncEngineChange& change : changes) {
     for (const Value& pc : change.changes()) {
@@ -48,11 +49,12 @@ void SqliteEngine::push(const std::string& client, const std::string& dataclass,
                   "ON CONFLICT(dataclass, id) DO UPDATE SET properties = excluded.properties");
   Statement remove(db_.handle(), "DELETE FROM records WHERE dataclass = ?1 AND id = ?2");
   Statement unseen(db_.handle(),
-                   "SELECT client, changes, pushed FROM journal WHERE dataclass = ?1 AND "
+                   "SELECT client, changes, pushed, origin FROM journal WHERE dataclass = ?1 AND "
                    "record = ?2 AND seq > ?3 AND client != ?4 ORDER BY seq");
-  Statement journal(db_.handle(),
-                    "INSERT INTO journal (dataclass, record, client, type, changes, pushed) "
-                    "VALUES (?1, ?2, ?3, ?4, ?5, ?6)");
+  Statement journal(
+      db_.handle(),
+      "INSERT INTO journal (dataclass, record, client, type, changes, pushed, origin) "
+      "VALUES (?1, ?2, ?3, ?4, ?5, ?6, ?7)");
 
   for (const SyncEngineChange& change : changes) {
     const std::string& id = change.recordIdentifier();
@@ -69,7 +71,7 @@ void SqliteEngine::push(const std::string& client, const std::string& dataclass,
       }
       remove.bind(1, dataclass).bind(2, id).run();
       journal.bind(1, dataclass).bind(2, id).bind(3, client).bind(4, int64_t{type});
-      journal.bind(5, encode(Value(Array{}))).bind(6, now).run();
+      journal.bind(5, encode(Value(Array{}))).bind(6, now).bind(7, options.origin).run();
       continue;
     }
     if (!exists) type = SyncEngineChange::kAdd;  // a modify of an unknown record adds it
@@ -82,7 +84,8 @@ void SqliteEngine::push(const std::string& client, const std::string& dataclass,
         const Value list = decode(unseen.blob(1));
         for (const Value& pc : list.array()) {
           const Dictionary& d = pc.dictionary();
-          competing[d.get("name").string()] = {d.get("value"), unseen.text(0), unseen.real(2)};
+          competing[d.get("name").string()] = {d.get("value"), unseen.text(0), unseen.text(3),
+                                               unseen.real(2)};
         }
       }
       unseen.reset();
@@ -102,6 +105,14 @@ void SqliteEngine::push(const std::string& client, const std::string& dataclass,
         VTC_LOG_INFO("Conflict on %@ of record %@ in %@: kept %@ from %@, dropped %@ from %@", name,
                      id, dataclass, kept, oursWins ? client : other->second.client, lost,
                      oursWins ? other->second.client : client);
+        if (options.onConflict) {
+          Conflict c{dataclass, id, name, kept, lost, {}, {}, {}, {}, currentClock().now()};
+          c.keptClient = oursWins ? client : other->second.client;
+          c.lostClient = oursWins ? other->second.client : client;
+          c.keptOrigin = oursWins ? options.origin : other->second.origin;
+          c.lostOrigin = oursWins ? other->second.origin : options.origin;
+          options.onConflict(c);
+        }
         if (!oursWins) continue;
       }
       if (d.get("action").string() == "set")
@@ -112,8 +123,9 @@ void SqliteEngine::push(const std::string& client, const std::string& dataclass,
     }
     write.bind(1, dataclass).bind(2, id).bind(3, encode(Value(properties))).run();
     journal.bind(1, dataclass).bind(2, id).bind(3, client).bind(4, int64_t{type});
-    journal.bind(5, encode(Value(applied))).bind(6, now).run();
+    journal.bind(5, encode(Value(applied))).bind(6, now).bind(7, options.origin).run();
   }
+  writeState(client, dataclass, options.state);
   t.commit();
 }
 

@@ -103,6 +103,18 @@ void Database::exec(const char* sql) {
   }
 }
 
+void Database::copyFrom(const std::string& path) {
+  Database source(path);
+  sqlite3_backup* backup = sqlite3_backup_init(db_, "main", source.handle(), "main");
+  if (!backup)
+    throw EngineError(std::string("cannot copy the sync engine database: ") + sqlite3_errmsg(db_));
+  const int stepped = sqlite3_backup_step(backup, -1);
+  sqlite3_backup_finish(backup);
+  if (stepped != SQLITE_DONE)
+    throw EngineError("cannot copy the sync engine database " + path + ": " +
+                      sqlite3_errstr(stepped));
+}
+
 Transaction::Transaction(Database& db) : db_(db) {
   db_.exec("BEGIN IMMEDIATE");
 }

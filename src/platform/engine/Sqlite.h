@@ -46,6 +46,8 @@ class Database {
   ~Database();
   sqlite3* handle() const { return db_; }
   void exec(const char* sql);
+  // Replaces this database's content with a copy of the database at path.
+  void copyFrom(const std::string& path);
 
  private:
   sqlite3* db_ = nullptr;

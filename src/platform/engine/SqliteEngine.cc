@@ -14,7 +14,7 @@ namespace vtc::engine {
 
 namespace {
 
-constexpr int kSchemaVersion = 1;
+constexpr int kSchemaVersion = 2;
 constexpr const char* kEngineVersion = "1.0";
 
 // Each step moves the database from version (index) to (index + 1).
@@ -33,6 +33,12 @@ const char* const kMigrations[] = {
        CREATE TABLE schemas (dataclass TEXT PRIMARY KEY, versions BLOB NOT NULL);
        CREATE TABLE plans (id INTEGER PRIMARY KEY AUTOINCREMENT, status INTEGER NOT NULL,
                            participants BLOB NOT NULL, began REAL NOT NULL, ended REAL);)",
+    R"(ALTER TABLE journal ADD COLUMN origin TEXT NOT NULL DEFAULT '';
+       CREATE TABLE client_states (client TEXT NOT NULL, dataclass TEXT NOT NULL,
+                                   state BLOB NOT NULL, PRIMARY KEY (client, dataclass));
+       CREATE TABLE item_states (client TEXT NOT NULL, dataclass TEXT NOT NULL,
+                                 item TEXT NOT NULL, state BLOB NOT NULL,
+                                 PRIMARY KEY (client, dataclass, item));)",
 };
 
 double seconds(Date d) {
@@ -60,9 +66,22 @@ std::unique_ptr<SyncEngine> SyncEngine::open(const std::string& path) {
   return std::make_unique<SqliteEngine>(path);
 }
 
-SqliteEngine::SqliteEngine(const std::string& path) : path_(path), db_(path) {
+std::unique_ptr<SyncEngine> SyncEngine::openInMemoryCopy() {
+  std::string folder = VTCPrefsCenter::applicationSupportDirectory().value_or(
+      paths::join(paths::applicationSupportDirectory(), "NubiloSyncClient"));
+  paths::makeDirectories(folder, 0700);
+  return std::make_unique<SqliteEngine>(paths::join(folder, "SyncEngine.sqlite"), true);
+}
+
+SqliteEngine::SqliteEngine(const std::string& path) : SqliteEngine(path, false) {}
+
+SqliteEngine::SqliteEngine(const std::string& path, bool inMemoryCopy)
+    : path_(path), db_(inMemoryCopy ? ":memory:" : path) {
   try {
-    db_.exec("PRAGMA journal_mode=WAL; PRAGMA synchronous=NORMAL; PRAGMA foreign_keys=ON;");
+    if (inMemoryCopy)
+      db_.copyFrom(path);
+    else
+      db_.exec("PRAGMA journal_mode=WAL; PRAGMA synchronous=NORMAL; PRAGMA foreign_keys=ON;");
     migrate();
   } catch (const EngineError& e) {
     // A damaged file is reported and left where it is for inspection.
@@ -198,12 +217,82 @@ int64_t SqliteEngine::anchorOf(const std::string& client, const std::string& dat
 }
 
 void SqliteEngine::acknowledge(const std::string& client, const std::string& dataclass,
-                               int64_t anchor) {
+                               int64_t anchor, const StateUpdate& state) {
+  Transaction t(db_);
   Statement s(db_.handle(),
               "INSERT INTO anchors (client, dataclass, seq, needs_truth) VALUES (?1, ?2, ?3, 0) "
               "ON CONFLICT(client, dataclass) DO UPDATE SET seq = MAX(seq, excluded.seq), "
               "needs_truth = 0");
   s.bind(1, client).bind(2, dataclass).bind(3, anchor).run();
+  writeState(client, dataclass, state);
+  t.commit();
+}
+
+std::vector<SyncEngineChange> SqliteEngine::records(const std::string& dataclass) {
+  Statement all(db_.handle(), "SELECT id, properties FROM records WHERE dataclass = ?1");
+  all.bind(1, dataclass);
+  std::vector<SyncEngineChange> truth;
+  while (all.step()) {
+    Array sets;
+    const Value properties = decode(all.blob(1));
+    for (const auto& [name, value] : properties.dictionary())
+      sets.push_back(Value(Dictionary{{"action", "set"}, {"name", name}, {"value", value}}));
+    truth.emplace_back(SyncEngineChange::kAdd, all.text(0), std::move(sets));
+  }
+  return truth;
+}
+
+int64_t SqliteEngine::recordCount(const std::string& dataclass) {
+  Statement count(db_.handle(), "SELECT COUNT(*) FROM records WHERE dataclass = ?1");
+  count.bind(1, dataclass);
+  count.step();
+  return count.integer(0);
+}
+
+Value SqliteEngine::clientState(const std::string& client, const std::string& dataclass) {
+  Statement s(db_.handle(), "SELECT state FROM client_states WHERE client = ?1 AND dataclass = ?2");
+  s.bind(1, client).bind(2, dataclass);
+  return s.step() ? decode(s.blob(0)) : Value();
+}
+
+std::map<std::string, Value> SqliteEngine::itemStates(const std::string& client,
+                                                      const std::string& dataclass) {
+  Statement s(db_.handle(),
+              "SELECT item, state FROM item_states WHERE client = ?1 AND dataclass = ?2");
+  s.bind(1, client).bind(2, dataclass);
+  std::map<std::string, Value> states;
+  while (s.step()) states.emplace(s.text(0), decode(s.blob(1)));
+  return states;
+}
+
+void SqliteEngine::saveState(const std::string& client, const std::string& dataclass,
+                             const StateUpdate& state) {
+  Transaction t(db_);
+  writeState(client, dataclass, state);
+  t.commit();
+}
+
+void SqliteEngine::writeState(const std::string& client, const std::string& dataclass,
+                              const StateUpdate& state) {
+  if (state.clientState) {
+    Statement s(db_.handle(),
+                "INSERT INTO client_states (client, dataclass, state) VALUES (?1, ?2, ?3) "
+                "ON CONFLICT(client, dataclass) DO UPDATE SET state = excluded.state");
+    s.bind(1, client).bind(2, dataclass).bind(3, encode(*state.clientState)).run();
+  }
+  if (state.items.empty()) return;
+  Statement put(db_.handle(),
+                "INSERT INTO item_states (client, dataclass, item, state) VALUES (?1, ?2, ?3, ?4) "
+                "ON CONFLICT(client, dataclass, item) DO UPDATE SET state = excluded.state");
+  Statement drop(db_.handle(),
+                 "DELETE FROM item_states WHERE client = ?1 AND dataclass = ?2 AND item = ?3");
+  for (const auto& [item, value] : state.items) {
+    if (value) {
+      put.bind(1, client).bind(2, dataclass).bind(3, item).bind(4, encode(*value)).run();
+    } else {
+      drop.bind(1, client).bind(2, dataclass).bind(3, item).run();
+    }
+  }
 }
 
 void SqliteEngine::resetClient(const std::string& client, const std::string& dataclass) {

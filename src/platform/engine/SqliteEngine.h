@@ -11,6 +11,11 @@ namespace vtc::engine {
 class SqliteEngine final : public SyncEngine {
  public:
   explicit SqliteEngine(const std::string& path);
+  // A database in memory holding a copy of the one at path.
+  SqliteEngine(const std::string& path, bool inMemoryCopy);
+
+  using SyncEngine::acknowledge;
+  using SyncEngine::push;
 
   std::string version() override;
   void registerClient(const std::string& client, const Dictionary& description) override;
@@ -23,10 +28,17 @@ class SqliteEngine final : public SyncEngine {
   void setSchemaVersions(const std::string& dataclass, const Array& versions) override;
   Array schemaVersions(const std::string& dataclass) override;
   void push(const std::string& client, const std::string& dataclass,
-            const std::vector<SyncEngineChange>& changes) override;
+            const std::vector<SyncEngineChange>& changes, const PushOptions& options) override;
   PullResult pull(const std::string& client, const std::string& dataclass) override;
-  void acknowledge(const std::string& client, const std::string& dataclass,
-                   int64_t anchor) override;
+  void acknowledge(const std::string& client, const std::string& dataclass, int64_t anchor,
+                   const StateUpdate& state) override;
+  std::vector<SyncEngineChange> records(const std::string& dataclass) override;
+  int64_t recordCount(const std::string& dataclass) override;
+  Value clientState(const std::string& client, const std::string& dataclass) override;
+  std::map<std::string, Value> itemStates(const std::string& client,
+                                          const std::string& dataclass) override;
+  void saveState(const std::string& client, const std::string& dataclass,
+                 const StateUpdate& state) override;
   void resetClient(const std::string& client, const std::string& dataclass) override;
   int64_t beginSyncPlan(const std::vector<std::string>& participants) override;
   void setSyncPlanStatus(int64_t plan, int32_t status) override;
@@ -35,6 +47,8 @@ class SqliteEngine final : public SyncEngine {
 
  private:
   void migrate();
+  void writeState(const std::string& client, const std::string& dataclass,
+                  const StateUpdate& state);
   Dictionary clientSettings(const std::string& client);
   void storeClientSettings(const std::string& client, const Dictionary& settings);
   int64_t anchorOf(const std::string& client, const std::string& dataclass, bool* needsTruth);

@@ -7,9 +7,13 @@
 #pragma once
 
 #include <cstdint>
+#include <functional>
+#include <map>
 #include <memory>
+#include <optional>
 #include <stdexcept>
 #include <string>
+#include <utility>
 #include <vector>
 
 #include "VantorSyncManager/SyncEngineChange.h"
@@ -23,8 +27,44 @@ class EngineError : public std::runtime_error {
 };
 
 struct PullResult {
-  std::vector<SyncEngineChange> changes;  // one per record, coalesced
-  int64_t anchor = 0;                     // acknowledge this once the changes are applied
+  // One per record, coalesced. A modify carries the current value of every
+  // property that others changed (a clear where it is gone); an add carries
+  // the whole record and replaces what the client had under its identifier.
+  std::vector<SyncEngineChange> changes;
+  int64_t anchor = 0;  // acknowledge this once the changes are applied
+  // After a reset the changes are the whole truth: the client drops every
+  // record they do not name.
+  bool isTruth = false;
+};
+
+// One property edited by two clients between their pulls: the value kept
+// and the value that lost (none for a clear), with who made each.
+struct Conflict {
+  std::string dataclass;
+  std::string record;
+  std::string property;
+  Value kept;
+  Value lost;
+  std::string keptClient, lostClient;
+  std::string keptOrigin, lostOrigin;  // the computers, where the pushes named them
+  Date date;
+};
+
+// What a client remembers beside its changes, saved in the same transaction
+// as a push or an acknowledgement, so that a crash never separates them: a
+// state of its own and a state per item (none removes an item's state).
+struct StateUpdate {
+  std::optional<Value> clientState;
+  std::vector<std::pair<std::string, std::optional<Value>>> items;
+  bool empty() const { return !clientState && items.empty(); }
+};
+
+struct PushOptions {
+  std::string origin;  // the computer that made the changes, for conflict records
+  // Told of every conflict, inside the push's transaction: a failure raised
+  // here undoes the whole push.
+  std::function<void(const Conflict&)> onConflict;
+  StateUpdate state;
 };
 
 struct SyncPlan {
@@ -38,6 +78,9 @@ class SyncEngine {
   // The engine of this user (support folder), or of the database at path.
   static std::unique_ptr<SyncEngine> open();
   static std::unique_ptr<SyncEngine> open(const std::string& path);
+  // An engine on a copy of this user's database held in memory: everything
+  // done to it is forgotten when it closes (a dry run).
+  static std::unique_ptr<SyncEngine> openInMemoryCopy();
   virtual ~SyncEngine() = default;
 
   virtual std::string version() = 0;
@@ -57,11 +100,29 @@ class SyncEngine {
   virtual Array schemaVersions(const std::string& dataclass) = 0;
 
   // Change exchange. A push is applied whole or not at all.
+  void push(const std::string& client, const std::string& dataclass,
+            const std::vector<SyncEngineChange>& changes) {
+    push(client, dataclass, changes, PushOptions{});
+  }
   virtual void push(const std::string& client, const std::string& dataclass,
-                    const std::vector<SyncEngineChange>& changes) = 0;
+                    const std::vector<SyncEngineChange>& changes, const PushOptions& options) = 0;
   virtual PullResult pull(const std::string& client, const std::string& dataclass) = 0;
-  virtual void acknowledge(const std::string& client, const std::string& dataclass,
-                           int64_t anchor) = 0;
+  void acknowledge(const std::string& client, const std::string& dataclass, int64_t anchor) {
+    acknowledge(client, dataclass, anchor, StateUpdate{});
+  }
+  virtual void acknowledge(const std::string& client, const std::string& dataclass, int64_t anchor,
+                           const StateUpdate& state) = 0;
+
+  // The whole truth of a dataclass, as adds, and how many records it has.
+  virtual std::vector<SyncEngineChange> records(const std::string& dataclass) = 0;
+  virtual int64_t recordCount(const std::string& dataclass) = 0;
+
+  // A client's remembered states (see StateUpdate).
+  virtual Value clientState(const std::string& client, const std::string& dataclass) = 0;
+  virtual std::map<std::string, Value> itemStates(const std::string& client,
+                                                  const std::string& dataclass) = 0;
+  virtual void saveState(const std::string& client, const std::string& dataclass,
+                         const StateUpdate& state) = 0;
   // The client's next pull is the whole truth, as adds.
   virtual void resetClient(const std::string& client, const std::string& dataclass) = 0;
 

@@ -105,6 +105,74 @@ TEST_F(Engine, ConflictingEditsAreSettledByPushTimeThenClientAndLogged) {
                                    "dropped Bee from app.b"));
 }
 
+// Pulls carry the values that stand now: a client is never sent back its own
+// winning value, and the loser of a conflict gets the winner's.
+TEST_F(Engine, PullsCarryCurrentValuesAndConflictsAreToldWithTheirComputers) {
+  push("vdir", {SyncEngineChange(1, "r1", Array{set("FN", Value("Ann")), set("TEL", Value("1"))})});
+  sync("vdir");
+  sync("net");
+  std::vector<vtc::engine::Conflict> conflicts;
+  vtc::engine::PushOptions fromMacB{"Mac B", [&](const auto& c) { conflicts.push_back(c); }, {}};
+  // The folder edits FN and TEL; then the network brings FN from Mac B.
+  push("vdir",
+       {SyncEngineChange(2, "r1", Array{set("FN", Value("Local")), set("TEL", Value("2"))})});
+  time.advance(vtc::Seconds(1));
+  engine->push("net", "Contacts", {SyncEngineChange(2, "r1", Array{set("FN", Value("Remote"))})},
+               fromMacB);
+  ASSERT_EQ(conflicts.size(), 1u);
+  EXPECT_EQ(conflicts[0].property, "FN");
+  EXPECT_EQ(conflicts[0].kept, Value("Remote"));
+  EXPECT_EQ(conflicts[0].lost, Value("Local"));
+  EXPECT_EQ(conflicts[0].keptOrigin, "Mac B");
+  EXPECT_EQ(conflicts[0].lostClient, "vdir");
+  // The folder gets the winner; the network gets only TEL, not its own FN.
+  EXPECT_EQ(sync("vdir"), Changes{SyncEngineChange(2, "r1", Array{set("FN", Value("Remote"))})});
+  EXPECT_EQ(sync("net"), Changes{SyncEngineChange(2, "r1", Array{set("TEL", Value("2"))})});
+
+  // A conflict handler that fails undoes the whole push.
+  push("vdir", renamed("x"));
+  time.advance(vtc::Seconds(1));
+  vtc::engine::PushOptions failing{
+      "Mac B", [](const auto&) { throw std::runtime_error("disk"); }, {}};
+  EXPECT_THROW(engine->push("net", "Contacts",
+                            {SyncEngineChange(2, "r1", Array{set("name", Value("y"))}),
+                             SyncEngineChange(1, "r9", Array{set("n", Value(9))})},
+                            failing),
+               std::runtime_error);
+  EXPECT_EQ(engine->recordCount("Contacts"), 1);
+
+  // Deleted and added again by others: the client's copy is replaced whole.
+  sync("vdir");
+  push("net", {SyncEngineChange(3, "r1", Array{})});
+  push("net", {SyncEngineChange(1, "r1", Array{set("FN", Value("New"))})});
+  EXPECT_EQ(sync("vdir"), Changes{SyncEngineChange(1, "r1", Array{set("FN", Value("New"))})});
+}
+
+TEST_F(Engine, StatesTravelWithPushesAndAcknowledgementsAndADryRunForgetsEverything) {
+  vtc::engine::StateUpdate state{Value(Dictionary{{"index", 4}}), {{"a.vcf", Value("A")}}};
+  engine->push("vdir", "Contacts", {SyncEngineChange(1, "a.vcf", Array{set("FN", Value("A"))})},
+               {"", {}, state});
+  EXPECT_EQ(engine->clientState("vdir", "Contacts"), Value(Dictionary{{"index", 4}}));
+  EXPECT_EQ(engine->itemStates("vdir", "Contacts").at("a.vcf"), Value("A"));
+  auto pulled = engine->pull("net", "Contacts");
+  engine->acknowledge("net", "Contacts", pulled.anchor,
+                      {std::nullopt, {{"a.vcf", std::nullopt}, {"b.vcf", Value("B")}}});
+  EXPECT_EQ(engine->itemStates("net", "Contacts").size(), 1u);
+  EXPECT_TRUE(engine->pull("net", "Contacts").changes.empty());
+  EXPECT_TRUE(engine->clientState("net", "Contacts").isNone());
+
+  // A copy in memory: what is done to it never reaches the file.
+  ::setenv("XDG_DATA_HOME", home.path().c_str(), 1);
+  auto real = SyncEngine::open();
+  real->push("vdir", "Contacts", {SyncEngineChange(1, "kept", Array{set("n", Value(1))})});
+  auto copy = SyncEngine::openInMemoryCopy();
+  EXPECT_EQ(copy->recordCount("Contacts"), 1);
+  copy->push("vdir", "Contacts", {SyncEngineChange(1, "dry", Array{set("n", Value(2))})});
+  EXPECT_EQ(copy->recordCount("Contacts"), 2);
+  EXPECT_EQ(SyncEngine::open()->recordCount("Contacts"), 1);
+  ::unsetenv("XDG_DATA_HOME");
+}
+
 TEST_F(Engine, ResetsBadInputAndOddChanges) {
   // A reset client gets the whole truth as adds, once.
   push("app.a", {SyncEngineChange(1, "r1", Array{set("n", Value(1))}),
