@@ -16,6 +16,7 @@
 #include "VantorSyncManager/NubiloSignedDocument.h"
 #include "VantorSyncManager/PublicNames.h"
 #include "VantorSyncManager/StringAdditions.h"
+#include "VantorSyncManager/SyncStatus.h"
 #include "VantorSyncManager/SyncEngineChange.h"
 #include "VantorSyncManager/VTCConfiguration.h"
 #include "VantorSyncManager/VTCPrefsCenter.h"
