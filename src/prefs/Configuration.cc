@@ -120,7 +120,12 @@ vtc::Dictionary VTCPrefsCenter::defaultConfiguration() {
     }
   }
   const bool syncing = syncTurnedOn();
-  if (!data && syncing) {
+  // A self-hosted share has no configuration server: an empty host says so,
+  // and nothing is downloaded or waited for.
+  const bool noServer = hostOverride.isString() && hostOverride.string().empty();
+  if (!data && syncing && noServer) {
+    VTC_LOG_INFO("No configuration server is set, using the default configuration");
+  } else if (!data && syncing) {
     VTC_LOG_INFO("Downloading new Nubilo Client configuration: %@", url);
     std::string error;
     data = vtc::fetchURL(url, &error);
@@ -147,7 +152,7 @@ vtc::Dictionary VTCPrefsCenter::defaultConfiguration() {
   if (data) signedLayer = config::verifiedConfiguration(*data);
   if (signedLayer) {
     configuration.merge(*signedLayer);
-  } else if (syncing) {
+  } else if (syncing && !noServer) {
     VTC_LOG_ERROR("Failed to validate signature on config file, using default configuration");
   } else {
     VTC_LOG_INFO("Syncing not enabled and no cached config file, using default configuration");

@@ -157,6 +157,15 @@ TEST_F(Configuration, WithSyncingOffABadSignatureOrAFailedDownloadTheOtherLayers
   EXPECT_FALSE(prefs.configTTLDate());  // a failed download does not move it
 }
 
+TEST_F(Configuration, AShareWithoutAConfigurationServerIsNeitherAskedNorComplainedAbout) {
+  prefs.setSyncTurnedOn(true);
+  perUser("ConfigurationHost", vtc::Value(""));
+  perUser("host_name", vtc::Value("dav.example.org"));
+  EXPECT_EQ(prefs.defaultConfiguration().get("host_name").string(), "dav.example.org");
+  EXPECT_TRUE(share.accessEntries().empty());
+  EXPECT_TRUE(logged.messages("Error").empty());
+}
+
 TEST(ConfigurationDefaults, TheListEndsAtTheFirstAbsentValue) {
   vtc::Dictionary firstRun = vtc::config::builtInDefaults(std::nullopt, std::string("alice"));
   EXPECT_FALSE(firstRun.contains("guid"));
