@@ -4,6 +4,9 @@
 #include <ne_basic.h>
 #include <ne_locks.h>
 
+#include <set>
+
+#include "VantorSyncManager/PublicNames.h"
 #include "platform/dav/DavConnection.h"
 #include "platform/dav/DavPaths.h"
 
@@ -40,6 +43,28 @@ DavTransaction TesselSession::makeCollectionAtPath(const std::string& path,
 }
 
 DavTransaction TesselSession::_makeCollectionsAtPaths(const std::vector<std::string>& paths) {
+  // One request in the usual case: a listing of the common parent shows that
+  // every collection is there already.
+  if (!paths.empty()) {
+    const std::string parent = vtc::davpath::parent(paths.front());
+    std::set<std::string> wanted;
+    for (const std::string& path : paths)
+      if (vtc::davpath::parent(path) == parent) wanted.insert(vtc::davpath::canonical(path));
+    if (wanted.size() == paths.size()) {
+      DavTransaction listing = listCollectionAtPath(parent);
+      if (listing.isSuccessful()) {
+        for (const vtc::Value& entry : listing.result().array())
+          if (entry.dictionary().get(vtc::kDavIsCollection).boolean())
+            wanted.erase(vtc::davpath::canonical(entry.dictionary().get(kNBURI).string()));
+        if (wanted.empty()) {
+          DavTransaction done("MKCOL", paths.back());
+          done.setOutcome(true, 1, listing.httpStatusCode(), listing.transactionState());
+          done.setResponseHeaders(listing._responseHeaders());
+          return done;
+        }
+      }
+    }
+  }
   DavTransaction last("MKCOL", paths.empty() ? std::string() : paths.back());
   for (const std::string& path : paths) {
     last = makeCollectionAtPath(path, true);

@@ -113,6 +113,11 @@ class TesselSession {
   bool isSynchronous() const { return synchronous_; }
   // Whether this session holds a lock on path in its lock store.
   bool holdsLockOnPath(const std::string& path) const;
+  // The token of the lock held on path, or none.
+  std::optional<std::string> lockTokenForPath(const std::string& path) const;
+  // Gives back a lock known by its token alone (one left by a process that
+  // ended without unlocking). Nothing is kept in the lock store.
+  DavTransaction unlockResourceWithToken(const std::string& path, const std::string& token);
 
  private:
   DavTransaction propfind(const std::string& path, int32_t depth,

@@ -178,3 +178,21 @@ DavTransaction TesselSession::unlockResourceAtPath(const std::string& path) {
 bool TesselSession::holdsLockOnPath(const std::string& path) const {
   return findLock(*connection_, vtc::davpath::escape(path)) != nullptr;
 }
+
+std::optional<std::string> TesselSession::lockTokenForPath(const std::string& path) const {
+  struct ne_lock* lock = findLock(*connection_, vtc::davpath::escape(path));
+  if (!lock || !lock->token) return std::nullopt;
+  return std::string(lock->token);
+}
+
+DavTransaction TesselSession::unlockResourceWithToken(const std::string& path,
+                                                      const std::string& token) {
+  std::string escaped = vtc::davpath::escape(path);
+  return connection_->perform("UNLOCK", path, [&] {
+    ne_request* req = ne_request_create(connection_->session(), "UNLOCK", escaped.c_str());
+    ne_print_request_header(req, "Lock-Token", "<%s>", token.c_str());
+    int ret = vtc::dispatchExpectingSuccess(req);
+    ne_request_destroy(req);
+    return ret;
+  });
+}

@@ -1,0 +1,38 @@
+// The sync client's commands. Each returns the process's exit status and
+// writes its output to out; failures raise SyncFailure.
+#pragma once
+
+#include <iosfwd>
+#include <optional>
+#include <string>
+#include <vector>
+
+#include "client/run/SyncRun.h"
+
+namespace vtc::client {
+
+struct Output {
+  std::ostream& out;
+  std::ostream& err;
+  int verbosity = 1;  // 0 quiet, 1 normal, 2 verbose
+};
+
+struct SetupRequest {
+  std::string url;
+  std::string member;
+  std::optional<std::string> passwordCommand;
+  bool passwordFromStdin = false;
+};
+
+int setupCommand(const SetupRequest& request, Output& output);
+int addCommand(const std::string& kind, const std::string& folder,
+               const std::optional<std::string>& dataclass, Output& output);
+int removeCommand(const std::string& dataclass, Output& output);
+int syncCommand(const RunRequest& request, Output& output);
+int conflictsCommand(Output& output);
+int statusCommand(Output& output);
+
+// The whole command line; the entry point of nubilosyncclient.
+int runCommandLine(int argc, char** argv);
+
+}  // namespace vtc::client

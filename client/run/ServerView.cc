@@ -1,0 +1,67 @@
+#include "client/run/ServerView.h"
+
+#include "VantorSyncManager/NubiloException.h"
+#include "VantorSyncManager/PublicNames.h"
+#include "common/Format.h"
+#include "platform/dav/DavPaths.h"
+
+namespace vtc::client {
+
+namespace {
+
+std::optional<int64_t> version(const Value* v) {
+  if (!v || !v->isString() || v->string().empty()) return std::nullopt;
+  return v->integer();
+}
+
+}  // namespace
+
+DataclassRecord DataclassRecord::fromRecord(const Dictionary& record) {
+  return {version(record.find("minversion")), version(record.find("maxversion")),
+          record.get("status").string(), record.get("DAV:getetag").string()};
+}
+
+ServerView ServerView::read(NubiloRemoteSession& session) {
+  DavTransaction t = session._issuePropFindWithRetryAtPath(session.schemasPath(), kDAVOneDepth, {});
+  if (!t.isSuccessful())
+    throw NubiloException(NubiloTransactionFailureException,
+                          format("The dataclass records could not be read %@", t));
+  ServerView view;
+  const std::string& ns = session.syncNamespace();
+  const std::string self = davpath::canonical(session.schemasPath());
+  for (const auto& [href, properties] : t.result().dictionary()) {
+    const std::string path = davpath::canonical(davpath::fromHref(href));
+    if (path == self) continue;
+    Dictionary record;
+    for (const auto& [name, value] : properties.dictionary())
+      if (name.size() > ns.size() && name.compare(0, ns.size(), ns) == 0)
+        record.set(name.substr(ns.size()), value);
+    if (const Value* etag = properties.dictionary().find("DAV:getetag"))
+      record.set("DAV:getetag", *etag);
+    view.records_[davpath::lastComponent(path)] = DataclassRecord::fromRecord(record);
+  }
+  return view;
+}
+
+std::optional<DataclassRecord> ServerView::record(const std::string& dataclass) const {
+  auto it = records_.find(dataclass);
+  if (it == records_.end()) return std::nullopt;
+  return it->second;
+}
+
+NetworkState NetworkState::fromValue(const Value& value) {
+  const Dictionary& d = value.dictionary();
+  NetworkState s;
+  if (const Value* i = d.find("Index")) s.index = i->integer();
+  if (const Value* m = d.find("MinVersion")) s.minversion = m->integer();
+  return s;
+}
+
+Value NetworkState::toValue() const {
+  Dictionary d;
+  if (index) d.set("Index", Value(*index));
+  if (minversion) d.set("MinVersion", Value(*minversion));
+  return Value(d);
+}
+
+}  // namespace vtc::client

@@ -1,0 +1,165 @@
+#include "client/run/SyncRun.h"
+
+#include <unistd.h>
+
+#include <chrono>
+
+#include "VantorSyncManager/Diagnostics.h"
+#include "VantorSyncManager/NubiloException.h"
+#include "VantorSyncManager/PublicNames.h"
+#include "VantorSyncManager/SyncStatus.h"
+#include "VantorSyncManager/VTCPrefsCenter.h"
+#include "client/run/Account.h"
+#include "client/run/SyncOwner.h"
+#include "common/Clock.h"
+#include "common/Logging.h"
+
+namespace vtc::client {
+
+namespace {
+
+std::string failureSentence(const std::string& dataclass, const NubiloException& e) {
+  if (e.name() == NubiloNetworkFailureException)
+    return "The server stopped answering while syncing " + dataclass +
+           "; the next sync carries on from where this one stopped.";
+  if (e.name() == NubiloLockFailureException)
+    return dataclass + " is locked by another computer that is syncing it; try again shortly.";
+  if (e.name() == NubiloTesselFullException)
+    return "The share is full; " + dataclass + " could not be sent. Free some space on it.";
+  if (e.name() == NubiloServerIncoherencyException)
+    return "Another computer sent changes to " + dataclass +
+           " at the same moment; the next sync takes them in first.";
+  return "Syncing " + dataclass + " failed: " + e.reason();
+}
+
+FailureKind failureKind(const NubiloException& e) {
+  if (e.name() == NubiloNetworkFailureException) return FailureKind::Unreachable;
+  if (e.name() == NubiloLoginFailureException) return FailureKind::Login;
+  return FailureKind::Other;
+}
+
+Dictionary summaryEntry(const DataclassOutcome& o, Date start, Date end, const std::string* error) {
+  Dictionary entry{{"SyncDuration", std::chrono::duration<double>(end - start).count()},
+                   {"SyncStart", Value(start)},
+                   {"SyncEnd", Value(end)},
+                   {"ClogCount", o.changelogsFetched},
+                   {"SyncMode", o.mode}};
+  if (error) entry.set("Error", Value(*error));
+  return entry;
+}
+
+}  // namespace
+
+int RunResult::exitStatus() const {
+  return failures.empty() ? 0 : static_cast<int>(failures.front().kind);
+}
+
+RunResult runSync(const RunRequest& request) {
+  VTCPrefsCenter& prefs = VTCPrefsCenter::defaultCenter();
+  if (!prefs.syncTurnedOn())
+    throw SyncFailure(FailureKind::Usage,
+                      "Syncing is not set up on this computer; run `nubilosyncclient setup URL "
+                      "--user NAME`.");
+  std::vector<Collection> collections;
+  if (request.dataclasses.empty()) {
+    collections = configuredCollections();
+  } else {
+    for (const std::string& name : request.dataclasses) {
+      auto c = configuredCollection(name);
+      if (!c)
+        throw SyncFailure(FailureKind::Usage,
+                          name +
+                              " is not synced on this computer; add a folder for it with "
+                              "`nubilosyncclient add contacts|calendars FOLDER`.");
+      collections.push_back(*c);
+    }
+  }
+  if (collections.empty())
+    throw SyncFailure(FailureKind::Usage,
+                      "No folder is synced yet; add one with `nubilosyncclient add "
+                      "contacts|calendars FOLDER`.");
+
+  auto owner = SyncOwner::acquire();
+  const Date runStart = currentClock().now();
+  const auto [member, password] = storedCredentials();
+  auto session = openSession(member, password, prefs.configuration());
+  HeldLocks locks(*session);
+  if (!request.dryRun) locks.releaseLeftovers();
+  auto engine =
+      request.dryRun ? engine::SyncEngine::openInMemoryCopy() : engine::SyncEngine::open();
+  getNubiloClient();  // registers this client with the engine
+
+  std::vector<std::string> participants{kNetworkClient};
+  for (const Collection& c : collections) participants.push_back(folderClient(c.dataclass));
+  const int64_t plan = engine->beginSyncPlan(participants);
+  engine->setSyncPlanStatus(plan, 7);
+
+  SyncOptions options;
+  options.dryRun = request.dryRun;
+  options.maxDeletePercent = request.maxDeletePercent;
+  options.computerName = prefs.clientName().value_or("this computer");
+  ConflictStore conflicts;
+
+  RunResult result;
+  Dictionary summary{{"SyncType", request.periodic ? "periodic" : "manual"}};
+  bool usedServer = false;
+  try {
+    ServerView view = ServerView::read(*session);
+    for (const Collection& collection : collections) {
+      const Date start = currentClock().now();
+      if (!request.dryRun) prefs.setLastAttemptedSyncDateForDataclass(collection.dataclass);
+      DataclassSync sync(*session, *engine, collection, options, conflicts, locks);
+      std::optional<DataclassFailure> failure;
+      DataclassOutcome outcome;
+      outcome.dataclass = collection.dataclass;
+      try {
+        outcome = sync.run(view.record(collection.dataclass));
+      } catch (const SyncFailure& e) {
+        failure = DataclassFailure{collection.dataclass, e.what(), e.kind()};
+      } catch (const NubiloException& e) {
+        failure = DataclassFailure{collection.dataclass, failureSentence(collection.dataclass, e),
+                                   failureKind(e)};
+        VTC_LOG_ERROR("Sync of %@ failed: %@", collection.dataclass, e);
+      } catch (const std::exception& e) {
+        failure = DataclassFailure{collection.dataclass,
+                                   "Syncing " + collection.dataclass + " failed: " + e.what(),
+                                   FailureKind::Other};
+        VTC_LOG_ERROR("Sync of %@ failed: %@", collection.dataclass, e.what());
+      }
+      usedServer = usedServer || outcome.usedServer || failure.has_value();
+      if (!request.dryRun) prefs.setSyncSuccessful(!failure, collection.dataclass);
+      summary.set(collection.dataclass,
+                  Value(summaryEntry(outcome, start, currentClock().now(),
+                                     failure ? &failure->sentence : nullptr)));
+      result.outcomes.push_back(outcome);
+      if (failure) {
+        result.failures.push_back(*failure);
+        // Without the server there is nothing more to do this run.
+        if (failure->kind == FailureKind::Unreachable) break;
+      }
+    }
+  } catch (const NubiloException& e) {
+    engine->endSyncPlan(plan);
+    throw SyncFailure(failureKind(e), failureSentence("the account", e));
+  }
+  engine->endSyncPlan(plan);
+  locks.clear();
+
+  if (!request.dryRun && usedServer) {
+    summary.set("GlobalSyncDuration",
+                Value(std::chrono::duration<double>(currentClock().now() - runStart).count()));
+    Dictionary statistics;
+    for (const DataclassOutcome& o : result.outcomes) {
+      statistics.set("LastSentChanges." + o.dataclass, Value(static_cast<int64_t>(o.sentChanges)));
+      statistics.set("LastReceivedChanges." + o.dataclass,
+                     Value(static_cast<int64_t>(o.receivedChanges)));
+    }
+    VTCLogStatistics(statistics);
+    session->sendReportingInfo(summary);
+  }
+  if (!request.dryRun && result.failures.empty())
+    prefs.setLastSuccessfulSyncDate(currentClock().now());
+  return result;
+}
+
+}  // namespace vtc::client

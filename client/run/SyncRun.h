@@ -1,0 +1,39 @@
+// One run of the sync client: the owner lock, the session from the stored
+// account, every requested dataclass in turn, then the preferences, the
+// last-sync notification, statistics and the report of the run.
+#pragma once
+
+#include <string>
+#include <vector>
+
+#include "client/run/DataclassSync.h"
+#include "client/run/SyncFailure.h"
+
+namespace vtc::client {
+
+struct RunRequest {
+  std::vector<std::string> dataclasses;  // empty: every configured one
+  bool dryRun = false;
+  int maxDeletePercent = 50;
+  bool periodic = false;  // started by the schedule
+};
+
+struct DataclassFailure {
+  std::string dataclass;
+  std::string sentence;
+  FailureKind kind;
+};
+
+struct RunResult {
+  std::vector<DataclassOutcome> outcomes;
+  std::vector<DataclassFailure> failures;
+  // 0, or the exit status of the first failure.
+  int exitStatus() const;
+};
+
+// Raises SyncFailure for what stops the whole run (no account, another run,
+// a login refused, an unreachable server); a dataclass's own failure is
+// recorded in the result and the next dataclass is synced.
+RunResult runSync(const RunRequest& request);
+
+}  // namespace vtc::client
