@@ -34,6 +34,7 @@ struct ItemState {
   Value toValue() const;
   static std::optional<ItemState> fromValue(const Value& value);
   bool sameFileAs(const ItemState& other) const;  // size, times and inode
+  friend bool operator==(const ItemState&, const ItemState&) = default;
 };
 
 struct ScanResult {
@@ -45,6 +46,7 @@ struct ScanResult {
   std::vector<std::string> invalid;  // files that are not valid items (skipped, Warning logged)
   // The state of every valid item file now present (known ones included):
   // what the sync stores once the scan's changes are safely in the engine.
+  // A known file that is now invalid or unreadable keeps its known state.
   std::map<std::string, ItemState> states;
   size_t filesRead = 0;  // how many item files had to be read
 };
@@ -67,10 +69,15 @@ class VdirCollection {
 
   // Writes an item's bytes atomically, if the file is still as `expected`
   // says (none: the file must not exist). On Written, *state is the new
-  // state (fields from the bytes written).
+  // state (fields from the bytes written). Failed: the bytes are not a valid
+  // item, or a step failed (logged as an Error); the file may then already
+  // hold the new bytes, which the next scan will see. A new file is private
+  // (mode 0600); a replaced one keeps its mode. A name that is not an item
+  // file name of this kind raises std::invalid_argument.
   WriteOutcome write(const std::string& name, const std::string& bytes,
                      const std::optional<ItemState>& expected, ItemState* state) const;
-  // Removes an item's file, if it is still as `expected` says.
+  // Removes an item's file, if it is still as `expected` says; a file that
+  // is gone already counts as Removed.
   WriteOutcome remove(const std::string& name, const ItemState& expected) const;
   // The bytes of an item file; none when it cannot be read.
   std::optional<std::string> read(const std::string& name) const;

@@ -1,0 +1,57 @@
+#include "client/stores/ItemFiles.h"
+
+#include <unistd.h>
+
+#include <cerrno>
+
+namespace vtc::client {
+
+FileDescriptor::~FileDescriptor() {
+  close();  // a failure here concerns only files already read or given up
+}
+
+bool FileDescriptor::close() {
+  if (fd_ < 0) return true;
+  int fd = fd_;
+  fd_ = -1;
+  return ::close(fd) == 0;
+}
+
+ItemState fileState(const struct stat& st) {
+  constexpr int64_t kBillion = 1000000000;
+  ItemState state;
+  state.size = st.st_size;
+  state.modifiedNanoseconds = st.st_mtim.tv_sec * kBillion + st.st_mtim.tv_nsec;
+  state.changedNanoseconds = st.st_ctim.tv_sec * kBillion + st.st_ctim.tv_nsec;
+  state.inode = st.st_ino;
+  return state;
+}
+
+bool isItemFileName(std::string_view name, ItemKind kind) {
+  std::string_view extension = itemExtension(kind);
+  return !name.starts_with('.') && name.size() > extension.size() && name.ends_with(extension);
+}
+
+std::optional<std::string> readWhole(int fd) {
+  std::string bytes;
+  char buffer[16384];
+  for (;;) {
+    ssize_t n = ::read(fd, buffer, sizeof buffer);
+    if (n == 0) return bytes;
+    if (n < 0 && errno == EINTR) continue;
+    if (n < 0) return std::nullopt;
+    bytes.append(buffer, static_cast<size_t>(n));
+  }
+}
+
+bool writeWhole(int fd, std::string_view bytes) {
+  while (!bytes.empty()) {
+    ssize_t n = ::write(fd, bytes.data(), bytes.size());
+    if (n < 0 && errno == EINTR) continue;
+    if (n <= 0) return false;
+    bytes.remove_prefix(static_cast<size_t>(n));
+  }
+  return true;
+}
+
+}  // namespace vtc::client

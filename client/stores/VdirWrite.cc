@@ -1,0 +1,159 @@
+// Writing and removing item files. A file is replaced by renaming a fully
+// written and flushed temporary file over it, so that readers see the old
+// bytes or the new ones, never a part; a new item's file is put in place
+// only if no file of that name has appeared meanwhile. Before that, the
+// file on disk is compared with what the caller last saw, and a file
+// changed since is left alone: its change reaches the sync at the next
+// scan. What remains is the instant between that check and the rename; no
+// lock guards a vdir folder against the other programs that use it.
+#include <fcntl.h>
+#include <sys/stat.h>
+#include <unistd.h>
+
+#include <cerrno>
+#include <cstdio>
+#include <cstring>
+#include <stdexcept>
+
+#include "client/stores/ItemFiles.h"
+#include "client/stores/ItemLayout.h"
+#include "client/stores/VdirCollection.h"
+#include "common/Logging.h"
+#include "common/Uuid.h"
+#include "platform/fs/LocalPaths.h"
+
+namespace vtc::client {
+
+namespace {
+
+// New item files are private: they hold people's contacts and calendars.
+constexpr mode_t kNewFileMode = 0600;
+
+void requireItemName(const std::string& name, ItemKind kind) {
+  if (!isItemFileName(name, kind) || name.find('/') != std::string::npos)
+    throw std::invalid_argument(format("Not an item file name: %@", name));
+}
+
+// Gone: an expected file is absent. Unknown: stat failed (errno says why).
+enum class OnDisk { AsExpected, Changed, Gone, Unknown };
+
+// Whether the file `name` is still as `expected` says (none: absent); its
+// permission bits go to *mode.
+OnDisk compareWithDisk(int dirFd, const std::string& name, const std::optional<ItemState>& expected,
+                       mode_t* mode = nullptr) {
+  struct stat st {};
+  if (::fstatat(dirFd, name.c_str(), &st, 0) != 0) {
+    if (errno != ENOENT) return OnDisk::Unknown;
+    return expected ? OnDisk::Gone : OnDisk::AsExpected;
+  }
+  if (mode) *mode = st.st_mode & 07777;
+  return expected && fileState(st).sameFileAs(*expected) ? OnDisk::AsExpected : OnDisk::Changed;
+}
+
+// Puts a new item's file in place unless the name is taken. Where the file
+// system cannot rename without replacing, a hard link does the same.
+bool placeNewFile(int dirFd, const std::string& temporary, const std::string& name) {
+  if (::renameat2(dirFd, temporary.c_str(), dirFd, name.c_str(), RENAME_NOREPLACE) == 0)
+    return true;
+  if (errno != EINVAL && errno != ENOSYS) return false;
+  if (::linkat(dirFd, temporary.c_str(), dirFd, name.c_str(), 0) != 0) return false;
+  ::unlinkat(dirFd, temporary.c_str(), 0);  // a leftover is hidden and never read
+  return true;
+}
+
+}  // namespace
+
+WriteOutcome VdirCollection::write(const std::string& name, const std::string& bytes,
+                                   const std::optional<ItemState>& expected,
+                                   ItemState* state) const {
+  requireItemName(name, kind_);
+  std::string path = paths::join(folder_, name);
+  std::string problem;
+  std::optional<ItemLayout> layout = readItemLayout(kind_, bytes, &problem);
+  if (!layout) {
+    VTC_LOG_ERROR("Not writing %@: the new bytes are not a valid item (%@)", path, problem);
+    return WriteOutcome::Failed;
+  }
+  auto failed = [&](const char* step) {
+    VTC_LOG_ERROR("Could not write %@ (%s): %s", path, step, strerror(errno));
+    return WriteOutcome::Failed;
+  };
+  auto skipped = [&] {
+    VTC_LOG_INFO("Not writing %@: it changed on disk since it was last read", path);
+    return WriteOutcome::SkippedChangedOnDisk;
+  };
+
+  FileDescriptor dir(::open(folder_.c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC));
+  if (!dir.valid()) return failed("opening the folder");
+  mode_t mode = kNewFileMode;
+  OnDisk before = compareWithDisk(dir.get(), name, expected, &mode);
+  if (before == OnDisk::Unknown) return failed("examining the file");
+  if (before != OnDisk::AsExpected) return skipped();
+
+  std::string temporary = "." + makeUUIDString() + ".tmp";
+  FileDescriptor file(
+      ::openat(dir.get(), temporary.c_str(), O_WRONLY | O_CREAT | O_EXCL | O_CLOEXEC, mode));
+  if (!file.valid()) return failed("creating a temporary file");
+  // The name is ours alone (O_EXCL), so it can go on every way out.
+  struct TemporaryName {
+    int dirFd;
+    const std::string& name;
+    bool placed = false;
+    ~TemporaryName() {
+      if (!placed) ::unlinkat(dirFd, name.c_str(), 0);
+    }
+  } cleanup{dir.get(), temporary};
+
+  if (::fchmod(file.get(), mode) != 0) return failed("setting the permissions");
+  if (!writeWhole(file.get(), bytes)) return failed("writing");
+  if (::fsync(file.get()) != 0) return failed("flushing");
+
+  // Writing took time: look again, right before the rename.
+  OnDisk now = compareWithDisk(dir.get(), name, expected);
+  if (now == OnDisk::Unknown) return failed("examining the file");
+  if (now != OnDisk::AsExpected) return skipped();
+  if (expected) {
+    if (::renameat(dir.get(), temporary.c_str(), dir.get(), name.c_str()) != 0)
+      return failed("renaming");
+  } else if (!placeNewFile(dir.get(), temporary, name)) {
+    if (errno == EEXIST) return skipped();
+    return failed("renaming");
+  }
+  cleanup.placed = true;
+
+  // The state after the rename, which sets the change time.
+  struct stat st {};
+  if (::fstat(file.get(), &st) != 0) return failed("reading its state");
+  if (!file.close()) return failed("closing");
+  // Until the folder is flushed, a crash can bring back the old file; the
+  // caller must then not take the new state as written.
+  if (::fsync(dir.get()) != 0) return failed("flushing the folder");
+  if (state) {
+    *state = fileState(st);
+    state->fields = std::move(layout->fields);
+  }
+  return WriteOutcome::Written;
+}
+
+WriteOutcome VdirCollection::remove(const std::string& name, const ItemState& expected) const {
+  requireItemName(name, kind_);
+  std::string path = paths::join(folder_, name);
+  auto failed = [&](const char* step) {
+    VTC_LOG_ERROR("Could not remove %@ (%s): %s", path, step, strerror(errno));
+    return WriteOutcome::Failed;
+  };
+  FileDescriptor dir(::open(folder_.c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC));
+  if (!dir.valid()) return failed("opening the folder");
+  OnDisk before = compareWithDisk(dir.get(), name, expected);
+  if (before == OnDisk::Unknown) return failed("examining the file");
+  if (before == OnDisk::Gone) return WriteOutcome::Removed;  // nothing left to keep
+  if (before == OnDisk::Changed) {
+    VTC_LOG_INFO("Not removing %@: it changed on disk since it was last read", path);
+    return WriteOutcome::SkippedChangedOnDisk;
+  }
+  if (::unlinkat(dir.get(), name.c_str(), 0) != 0 && errno != ENOENT) return failed("unlinking");
+  if (::fsync(dir.get()) != 0) return failed("flushing the folder");
+  return WriteOutcome::Removed;
+}
+
+}  // namespace vtc::client
