@@ -196,7 +196,7 @@ std::vector<SyncEngineChange> DataclassSync::folderChanges(
 
 void DataclassSync::checkLocalDeletes(const ScanResult& scan,
                                       const std::map<std::string, ItemState>& known) {
-  if (known.empty()) return;
+  if (known.empty() || options_.maxDeletePercent >= 100) return;
   const std::string& dataclass = collection_.dataclass;
   if (scan.states.empty() && scan.invalid.empty())
     throw SyncFailure(FailureKind::DeleteRefused,
@@ -415,8 +415,20 @@ void DataclassSync::commit(Remote& remote) {
   state.clientState = remote.state.toValue();
   engine_.acknowledge(kNetworkClient, dataclass, pending.anchor, state);
   outcome_.committedIndex = index;
-  if (firstCommit && !remote.record.etag.empty())
-    session_.setOtherClientStatus("needstruth", dataclass);
+  if (firstCommit) markOthersNeedingTruth();
+}
+
+void DataclassSync::markOthersNeedingTruth() {
+  session_.lockClients();
+  locks_.record();
+  try {
+    session_.setOtherClientStatus("needstruth", collection_.dataclass);
+  } catch (...) {
+    session_.unlockClients();
+    throw;
+  }
+  session_.unlockClients();
+  locks_.record();
 }
 
 void DataclassSync::compactIfLong(Remote& remote) {
@@ -454,7 +466,7 @@ void DataclassSync::compactIfLong(Remote& remote) {
   const int64_t index = max + 1;
   session_.relockDataclass(dataclass);
   session_.commitChanges(engine_.records(dataclass), dataclass, index, true);
-  session_.setOtherClientStatus("needstruth", dataclass);
+  markOthersNeedingTruth();
   const auto halfLock = std::chrono::duration_cast<Date::duration>(
       std::chrono::duration<double>(session_.lockDuration() / 2.0));
   Date renewBy = currentClock().now() + halfLock;

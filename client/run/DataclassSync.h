@@ -57,6 +57,8 @@ class DataclassSync {
   // listed: the dataclass's record from the server view (none: not on the
   // share). Raises SyncFailure or the library's failures.
   DataclassOutcome run(const std::optional<DataclassRecord>& listed);
+  // What the run got to, also after a failure.
+  const DataclassOutcome& outcome() const { return outcome_; }
 
  private:
   struct Remote;  // what the server side of one run found and decided
@@ -70,6 +72,8 @@ class DataclassSync {
   void applyRemote(Remote& remote, const engine::PullResult& pending);
   void commit(Remote& remote);
   void compactIfLong(Remote& remote);
+  // After a reset commit: every other computer takes the truth in once.
+  void markOthersNeedingTruth();
   void writeFolder();
   engine::PushOptions pushOptions(const std::string& origin, engine::StateUpdate state = {});
 

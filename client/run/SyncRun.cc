@@ -126,7 +126,8 @@ RunResult runSync(const RunRequest& request) {
                                    FailureKind::Other};
         VTC_LOG_ERROR("Sync of %@ failed: %@", collection.dataclass, e.what());
       }
-      usedServer = usedServer || outcome.usedServer || failure.has_value();
+      if (failure) outcome = sync.outcome();
+      usedServer = usedServer || outcome.usedServer;
       if (!request.dryRun) prefs.setSyncSuccessful(!failure, collection.dataclass);
       summary.set(collection.dataclass,
                   Value(summaryEntry(outcome, start, currentClock().now(),

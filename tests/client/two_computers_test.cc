@@ -1,0 +1,140 @@
+// Two and three computers of one account syncing their vdir folders through
+// a real share: each computer a home of its own and nubilosyncclient a
+// separate process, run as a person runs it.
+#include <gmock/gmock.h>
+
+#include <filesystem>
+
+#include "support/ApacheShare.h"
+#include "support/Computer.h"
+#include "support/TestHome.h"
+
+using testing::HasSubstr;
+using vtc::test::Computer;
+
+namespace {
+
+std::string card(const std::string& uid, const std::string& fn, const std::string& email,
+                 const std::string& tel) {
+  return "BEGIN:VCARD\r\nVERSION:3.0\r\nUID:" + uid + "\r\nFN:" + fn + "\r\nN:" + fn +
+         ";;;;\r\nEMAIL;TYPE=work:" + email + "\r\nTEL:" + tel + "\r\nEND:VCARD\r\n";
+}
+
+class Account : public ::testing::Test {
+ protected:
+  vtc::test::TestHome home;
+  vtc::test::ApacheShare share;
+  std::string url = "http://127.0.0.1:" + std::to_string(share.port()) + "/sync";
+  Computer a{"Mac A"};
+  Computer b{"Mac B"};
+
+  void SetUp() override {
+    a.join(url, vtc::test::ApacheShare::kUser, vtc::test::ApacheShare::kPassword);
+    b.join(url, vtc::test::ApacheShare::kUser, vtc::test::ApacheShare::kPassword);
+  }
+  // Syncs and expects success; the output for further checks.
+  Computer::Result sync(const Computer& c, std::vector<std::string> more = {}) {
+    std::vector<std::string> args{"sync"};
+    args.insert(args.end(), more.begin(), more.end());
+    Computer::Result r = c.run(args);
+    EXPECT_EQ(r.status, 0) << c.name() << ": " << r.err << r.out;
+    return r;
+  }
+  static std::map<std::string, std::string> contactsOf(const Computer& c) {
+    return Computer::files(c.contacts());
+  }
+};
+
+TEST_F(Account, AFirstSyncGoesBothWaysAndLeavesEqualFolders) {
+  Computer::write(a.contacts() + "/ann.vcf", card("ann", "Ann", "ann@example.org", "1"));
+  Computer::write(a.contacts() + "/bob.vcf", card("bob", "Bob", "bob@example.org", "2"));
+  Computer::write(b.contacts() + "/cat.vcf", card("cat", "Cat", "cat@example.org", "3"));
+  Computer::write(b.contacts() + "/displayname", "Friends");  // the user's, never synced
+
+  EXPECT_THAT(sync(a).out, HasSubstr("com.korvo.Contacts: sent 2 changes"));
+  EXPECT_THAT(sync(b).out, HasSubstr("received 2 changes"));
+  sync(a);
+  EXPECT_EQ(contactsOf(a).size(), 3u);
+  EXPECT_EQ(contactsOf(a)["cat.vcf"], card("cat", "Cat", "cat@example.org", "3"));
+  auto bFiles = contactsOf(b);
+  bFiles.erase("displayname");
+  EXPECT_EQ(contactsOf(a), bFiles);
+  EXPECT_FALSE(std::filesystem::exists(a.contacts() + "/displayname"));
+}
+
+TEST_F(Account, EditsOfDifferentFieldsMergeDeletesTravelAndAConflictEndsTheSameEverywhere) {
+  Computer::write(a.contacts() + "/ann.vcf", card("ann", "Ann", "ann@example.org", "1"));
+  Computer::write(a.contacts() + "/bob.vcf", card("bob", "Bob", "bob@example.org", "2"));
+  sync(a);
+  sync(b);
+
+  // A changes Ann's phone, B her e-mail: both survive.
+  Computer::write(a.contacts() + "/ann.vcf", card("ann", "Ann", "ann@example.org", "100"));
+  Computer::write(b.contacts() + "/ann.vcf", card("ann", "Ann", "ann@work.example", "1"));
+  // Both rename Bob (FN and N); A's names reach the share first and win
+  // everywhere.
+  Computer::write(a.contacts() + "/bob.vcf", card("bob", "Robert", "bob@example.org", "2"));
+  Computer::write(b.contacts() + "/bob.vcf", card("bob", "Bobby", "bob@example.org", "2"));
+  sync(a);
+  EXPECT_THAT(sync(b).out, HasSubstr("kept 2 conflicts"));
+  sync(a);
+  EXPECT_EQ(contactsOf(a)["ann.vcf"], card("ann", "Ann", "ann@work.example", "100"));
+  EXPECT_EQ(contactsOf(a)["bob.vcf"], card("bob", "Robert", "bob@example.org", "2"));
+  EXPECT_EQ(contactsOf(a), contactsOf(b));
+  Computer::Result conflicts = b.run({"conflicts"});
+  EXPECT_THAT(conflicts.out, HasSubstr("bob.vcf  FN"));
+  EXPECT_THAT(conflicts.out, HasSubstr("FN:Bobby"));
+  EXPECT_THAT(conflicts.out, HasSubstr("from Mac A"));
+  EXPECT_THAT(a.run({"conflicts"}).out, HasSubstr("No conflicts"));
+
+  // A delete travels; the other computer's files stay as they are.
+  std::filesystem::remove(b.contacts() + "/ann.vcf");
+  sync(b);
+  sync(a);
+  EXPECT_EQ(contactsOf(a).count("ann.vcf"), 0u);
+  EXPECT_EQ(contactsOf(a), contactsOf(b));
+}
+
+TEST_F(Account, ADryRunSaysWhatWouldHappenAndWritesNothingAnywhere) {
+  Computer::write(a.contacts() + "/ann.vcf", card("ann", "Ann", "ann@example.org", "1"));
+  sync(a);
+  Computer::write(b.contacts() + "/cat.vcf", card("cat", "Cat", "cat@example.org", "3"));
+  const size_t requests = share.accessEntries().size();
+  Computer::Result dry = b.run({"sync", "--dry-run"});
+  EXPECT_EQ(dry.status, 0) << dry.err;
+  EXPECT_THAT(dry.out, HasSubstr("com.korvo.Contacts (dry run): would send 1 change, receive 1 "
+                                 "change and write 1 file"));
+  const auto entries = share.accessEntries();
+  for (size_t i = requests; i < entries.size(); ++i)
+    EXPECT_THAT(entries[i].method, testing::AnyOf("PROPFIND", "GET")) << i;
+  EXPECT_EQ(contactsOf(b).size(), 1u);
+  // Nothing was taken in either: the real sync does all of it.
+  EXPECT_THAT(sync(b).out, HasSubstr("sent 1 change, received 1 change, wrote 1 file"));
+}
+
+TEST_F(Account, TheDeleteGuardRefusesBeforeAnythingIsWrittenAnywhere) {
+  for (int i = 0; i < 4; ++i)
+    Computer::write(a.contacts() + "/p" + std::to_string(i) + ".vcf",
+                    card("p" + std::to_string(i), "P", "p@example.org", std::to_string(i)));
+  sync(a);
+  sync(b);
+  for (int i = 0; i < 3; ++i)
+    std::filesystem::remove(a.contacts() + "/p" + std::to_string(i) + ".vcf");
+  const size_t requests = share.accessEntries().size();
+  Computer::Result refused = a.run({"sync"});
+  EXPECT_EQ(refused.status, 6);
+  EXPECT_THAT(refused.err, HasSubstr("would delete 3 of its 4 items on the other computers (75%"));
+  EXPECT_THAT(refused.err, HasSubstr("--max-delete 100"));
+  for (size_t i = requests; i < share.accessEntries().size(); ++i)
+    EXPECT_THAT(share.accessEntries()[i].method, testing::AnyOf("PROPFIND", "GET"));
+  sync(b);
+  EXPECT_EQ(contactsOf(b).size(), 4u);
+  // An emptied folder is never "delete everything"; a higher limit lets it through.
+  std::filesystem::remove(a.contacts() + "/p3.vcf");
+  EXPECT_THAT(a.run({"sync"}).err, HasSubstr("is empty but held 4 items"));
+  sync(a, {"--max-delete", "100"});
+  sync(b, {"--max-delete", "100"});
+  EXPECT_TRUE(contactsOf(b).empty());
+}
+
+}  // namespace

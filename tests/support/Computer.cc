@@ -1,0 +1,146 @@
+#include "support/Computer.h"
+
+#include <fcntl.h>
+#include <sys/wait.h>
+#include <unistd.h>
+
+#include <filesystem>
+#include <fstream>
+#include <sstream>
+#include <stdexcept>
+
+#include "platform/os/HostIdentity.h"
+#include "platform/plist/PlistCodec.h"
+
+extern char** environ;
+
+namespace vtc::test {
+
+std::string clientProgram() {
+  return VSM_CLIENT_PROGRAM;
+}
+
+Computer::Computer(const std::string& name) : name_(name) {
+  char tmpl[] = "/tmp/vsm-computer-XXXXXX";
+  home_ = ::mkdtemp(tmpl);
+  const std::string byHost = home_ + "/Library/Preferences/ByHost";
+  std::filesystem::create_directories(byHost);
+  plist::writeFileAtomically(byHost + "/com.korvo.VantorSync." + os::machineId() + ".plist",
+                             Value(Dictionary{{"ClientName", name}, {"LoggingLevel", "info"}}));
+}
+
+Computer::~Computer() {
+  std::error_code ignored;
+  std::filesystem::remove_all(home_, ignored);
+}
+
+std::vector<std::string> Computer::environment() const {
+  std::vector<std::string> env;
+  for (char** e = environ; *e; ++e) {
+    std::string entry = *e;
+    if (entry.starts_with("HOME=") || entry.starts_with("XDG_")) continue;
+    env.push_back(entry);
+  }
+  env.push_back("HOME=" + home_);
+  return env;
+}
+
+pid_t Computer::start(const std::vector<std::string>& args) const {
+  std::vector<std::string> argv{clientProgram()};
+  argv.insert(argv.end(), args.begin(), args.end());
+  std::vector<std::string> env = environment();
+  const std::string out = home_ + "/.last-out", err = home_ + "/.last-err";
+  pid_t pid = ::fork();
+  if (pid == 0) {
+    int o = ::open(out.c_str(), O_WRONLY | O_CREAT | O_TRUNC, 0644);
+    int e = ::open(err.c_str(), O_WRONLY | O_CREAT | O_TRUNC, 0644);
+    int in = ::open("/dev/null", O_RDONLY);
+    ::dup2(in, 0);
+    ::dup2(o, 1);
+    ::dup2(e, 2);
+    std::vector<char*> cargv, cenv;
+    for (auto& a : argv) cargv.push_back(a.data());
+    cargv.push_back(nullptr);
+    for (auto& v : env) cenv.push_back(v.data());
+    cenv.push_back(nullptr);
+    ::execve(cargv[0], cargv.data(), cenv.data());
+    ::_exit(127);
+  }
+  return pid;
+}
+
+Computer::Result Computer::finish(pid_t pid) const {
+  int status = 0;
+  ::waitpid(pid, &status, 0);
+  Result r;
+  r.status = WIFEXITED(status) ? WEXITSTATUS(status) : 128 + WTERMSIG(status);
+  r.out = read(home_ + "/.last-out");
+  r.err = read(home_ + "/.last-err");
+  return r;
+}
+
+Computer::Result Computer::run(const std::vector<std::string>& args,
+                               const std::string& input) const {
+  if (input.empty()) return finish(start(args));
+  // With input: through a shell pipe, so the program reads a non-terminal.
+  const std::string inputFile = home_ + "/.last-in";
+  write(inputFile, input);
+  std::vector<std::string> shell{"/bin/sh", "-c", "exec \"$0\" \"$@\" < '" + inputFile + "'",
+                                 clientProgram()};
+  shell.insert(shell.end(), args.begin(), args.end());
+  std::vector<std::string> env = environment();
+  const std::string out = home_ + "/.last-out", err = home_ + "/.last-err";
+  pid_t pid = ::fork();
+  if (pid == 0) {
+    int o = ::open(out.c_str(), O_WRONLY | O_CREAT | O_TRUNC, 0644);
+    int e = ::open(err.c_str(), O_WRONLY | O_CREAT | O_TRUNC, 0644);
+    ::dup2(o, 1);
+    ::dup2(e, 2);
+    std::vector<char*> cargv, cenv;
+    for (auto& a : shell) cargv.push_back(a.data());
+    cargv.push_back(nullptr);
+    for (auto& v : env) cenv.push_back(v.data());
+    cenv.push_back(nullptr);
+    ::execve(cargv[0], cargv.data(), cenv.data());
+    ::_exit(127);
+  }
+  return finish(pid);
+}
+
+void Computer::join(const std::string& url, const std::string& user,
+                    const std::string& password) const {
+  for (const auto& args : std::vector<std::vector<std::string>>{
+           {"setup", url, "--user", user, "--password-command", "printf '%s' '" + password + "'"},
+           {"add", "contacts", contacts()},
+           {"add", "calendars", calendars()}}) {
+    Result r = run(args);
+    if (r.status != 0)
+      throw std::runtime_error(name_ + ": nubilosyncclient failed: " + r.err + r.out);
+  }
+}
+
+std::map<std::string, std::string> Computer::files(const std::string& folder) {
+  std::map<std::string, std::string> all;
+  std::error_code error;
+  for (auto it = std::filesystem::directory_iterator(folder, error);
+       !error && it != std::filesystem::directory_iterator(); it.increment(error)) {
+    const std::string name = it->path().filename().string();
+    if (name.starts_with(".") || !it->is_regular_file()) continue;
+    all[name] = read(it->path().string());
+  }
+  return all;
+}
+
+void Computer::write(const std::string& path, const std::string& content) {
+  std::filesystem::create_directories(std::filesystem::path(path).parent_path());
+  std::ofstream(path, std::ios::binary) << content;
+}
+
+std::string Computer::read(const std::string& path) {
+  std::ifstream in(path, std::ios::binary);
+  std::stringstream s;
+  s << in.rdbuf();
+  return s.str();
+}
+
+}  // namespace vtc::test

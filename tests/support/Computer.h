@@ -1,0 +1,56 @@
+// One computer of an account in a test: a home folder of its own, and
+// nubilosyncclient run there as a separate process, as a person would run
+// it. Its contacts and calendars folders are vdir folders in that home.
+#pragma once
+
+#include <sys/types.h>
+
+#include <map>
+#include <string>
+#include <vector>
+
+namespace vtc::test {
+
+class Computer {
+ public:
+  struct Result {
+    int status = -1;
+    std::string out;
+    std::string err;
+  };
+
+  // A fresh home whose per-host preferences name the computer.
+  explicit Computer(const std::string& name);
+  ~Computer();
+  Computer(const Computer&) = delete;
+  Computer& operator=(const Computer&) = delete;
+
+  const std::string& name() const { return name_; }
+  const std::string& home() const { return home_; }
+  std::string contacts() const { return home_ + "/contacts"; }
+  std::string calendars() const { return home_ + "/calendars"; }
+
+  // Runs nubilosyncclient with these arguments and waits for it.
+  Result run(const std::vector<std::string>& args, const std::string& input = {}) const;
+  // Starts it without waiting; finish() waits and collects.
+  pid_t start(const std::vector<std::string>& args) const;
+  Result finish(pid_t pid) const;
+
+  // setup against the share with a password command, then the two folders.
+  void join(const std::string& url, const std::string& user, const std::string& password) const;
+
+  // The item files of a folder, name -> content.
+  static std::map<std::string, std::string> files(const std::string& folder);
+  static void write(const std::string& path, const std::string& content);
+  static std::string read(const std::string& path);
+
+ private:
+  std::vector<std::string> environment() const;
+  std::string name_;
+  std::string home_;
+};
+
+// The path of the built nubilosyncclient.
+std::string clientProgram();
+
+}  // namespace vtc::test
