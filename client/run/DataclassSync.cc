@@ -55,6 +55,9 @@ std::map<std::string, ItemState> statesOf(const std::map<std::string, Value>& st
   return states;
 }
 
+// The delete guard looks at proportions only from this many deletes on.
+constexpr size_t kDeletesThatAlwaysPass = 2;
+
 std::string percentText(size_t part, size_t whole) {
   return std::to_string(whole ? part * 100 / whole : 0) + "%";
 }
@@ -196,7 +199,8 @@ std::vector<SyncEngineChange> DataclassSync::folderChanges(
 
 void DataclassSync::checkLocalDeletes(const ScanResult& scan,
                                       const std::map<std::string, ItemState>& known) {
-  if (known.empty() || options_.maxDeletePercent >= 100) return;
+  // A few deletes always pass: deleting one of two contacts is no accident.
+  if (known.size() <= kDeletesThatAlwaysPass || options_.maxDeletePercent >= 100) return;
   const std::string& dataclass = collection_.dataclass;
   if (scan.states.empty() && scan.invalid.empty())
     throw SyncFailure(FailureKind::DeleteRefused,
@@ -205,7 +209,8 @@ void DataclassSync::checkLocalDeletes(const ScanResult& scan,
                           " items; if they are meant to go everywhere, run `nubilosyncclient "
                           "sync " +
                           dataclass + " --max-delete 100`.");
-  if (scan.deleted.size() * 100 > known.size() * static_cast<size_t>(options_.maxDeletePercent))
+  if (scan.deleted.size() > kDeletesThatAlwaysPass &&
+      scan.deleted.size() * 100 > known.size() * static_cast<size_t>(options_.maxDeletePercent))
     throw SyncFailure(FailureKind::DeleteRefused,
                       "Syncing " + dataclass + " would delete " +
                           std::to_string(scan.deleted.size()) + " of its " +
@@ -324,7 +329,7 @@ DataclassSync::Remote DataclassSync::fetch(bool slow, const DataclassRecord& rec
         if (change.type() == SyncEngineChange::kDelete) deleted.insert(change.recordIdentifier());
     deletes = deleted.size();
   }
-  if (records > 0 &&
+  if (deletes > kDeletesThatAlwaysPass &&
       deletes * 100 > static_cast<size_t>(records) * static_cast<size_t>(options_.maxDeletePercent))
     throw SyncFailure(FailureKind::DeleteRefused,
                       "Syncing " + dataclass + " would delete " + std::to_string(deletes) +

@@ -137,4 +137,63 @@ TEST_F(Account, TheDeleteGuardRefusesBeforeAnythingIsWrittenAnywhere) {
   EXPECT_TRUE(contactsOf(b).empty());
 }
 
+TEST_F(Account, ANewComputerJoiningAnAccountWithHistoryGetsItAllAndKeepsItsOwn) {
+  Computer::write(a.contacts() + "/ann.vcf", card("ann", "Ann", "ann@example.org", "1"));
+  sync(a);
+  Computer::write(a.contacts() + "/ann.vcf", card("ann", "Ann", "ann@example.org", "11"));
+  sync(a);
+  Computer::write(a.contacts() + "/bob.vcf", card("bob", "Bob", "bob@example.org", "2"));
+  std::filesystem::remove(a.contacts() + "/ann.vcf");
+  Computer::write(a.contacts() + "/eve.vcf", card("eve", "Eve", "eve@example.org", "5"));
+  sync(a);
+
+  Computer c{"Mac C"};
+  c.join(url, vtc::test::ApacheShare::kUser, vtc::test::ApacheShare::kPassword);
+  Computer::write(c.contacts() + "/dan.vcf", card("dan", "Dan", "dan@example.org", "4"));
+  EXPECT_THAT(sync(c).out, HasSubstr("(slow sync)"));
+  sync(a);
+  EXPECT_EQ(contactsOf(c).size(), 3u);
+  EXPECT_EQ(contactsOf(c), contactsOf(a));
+  EXPECT_EQ(contactsOf(c).count("ann.vcf"), 0u);
+}
+
+// A long history is written again as one reset commit. A computer with an
+// edit it had not sent, and one that was away throughout, both take the new
+// truth in once and lose nothing.
+TEST_F(Account, CompactionKeepsAnUnsentEditAndAComputerAwayThroughoutConverges) {
+  Computer c{"Mac C"};
+  c.join(url, vtc::test::ApacheShare::kUser, vtc::test::ApacheShare::kPassword);
+  Computer::write(a.contacts() + "/ann.vcf", card("ann", "Ann", "ann@example.org", "1"));
+  Computer::write(a.contacts() + "/bob.vcf", card("bob", "Bob", "bob@example.org", "2"));
+  sync(a);
+  sync(b);
+  sync(c);
+  a.setPreference("compaction_max_changelogs", vtc::Value(3));
+
+  Computer::write(b.contacts() + "/bob.vcf", card("bob", "Bob", "bob@home.example", "2"));
+  bool compacted = false;
+  for (int i = 0; i < 4; ++i) {
+    Computer::write(a.contacts() + "/ann.vcf",
+                    card("ann", "Ann", "ann@example.org", std::to_string(100 + i)));
+    const bool now = sync(a).out.find("history compacted") != std::string::npos;
+    compacted = compacted || now;
+  }
+  EXPECT_TRUE(compacted);
+  const std::string collection = share.diskPath(std::string("/sync/Schemas/com.korvo.Contacts"));
+  size_t changelogs = 0;
+  for (const auto& e : std::filesystem::directory_iterator(collection))
+    changelogs += e.path().extension() == ".clog";
+  EXPECT_LE(changelogs, 3u);
+
+  EXPECT_THAT(sync(b).out, HasSubstr("(slow sync)"));
+  sync(c);
+  sync(a);
+  const std::string bob = card("bob", "Bob", "bob@home.example", "2");
+  for (const Computer* each : {&a, &b, &c}) {
+    EXPECT_EQ(contactsOf(*each)["bob.vcf"], bob) << each->name();
+    EXPECT_EQ(contactsOf(*each)["ann.vcf"], card("ann", "Ann", "ann@example.org", "103"))
+        << each->name();
+  }
+}
+
 }  // namespace

@@ -23,10 +23,19 @@ std::string clientProgram() {
 Computer::Computer(const std::string& name) : name_(name) {
   char tmpl[] = "/tmp/vsm-computer-XXXXXX";
   home_ = ::mkdtemp(tmpl);
-  const std::string byHost = home_ + "/Library/Preferences/ByHost";
-  std::filesystem::create_directories(byHost);
-  plist::writeFileAtomically(byHost + "/com.korvo.VantorSync." + os::machineId() + ".plist",
+  std::filesystem::create_directories(std::filesystem::path(perHostFile()).parent_path());
+  plist::writeFileAtomically(perHostFile(),
                              Value(Dictionary{{"ClientName", name}, {"LoggingLevel", "info"}}));
+}
+
+std::string Computer::perHostFile() const {
+  return home_ + "/Library/Preferences/ByHost/com.korvo.VantorSync." + os::machineId() + ".plist";
+}
+
+void Computer::setPreference(const std::string& key, const Value& value) const {
+  Value all = plist::readFile(perHostFile()).value_or(Value(Dictionary{}));
+  all.mutableDictionary().set(key, value);
+  plist::writeFileAtomically(perHostFile(), all);
 }
 
 Computer::~Computer() {

@@ -9,6 +9,8 @@
 #include <string>
 #include <vector>
 
+#include "VantorSyncManager/Value.h"
+
 namespace vtc::test {
 
 class Computer {
@@ -39,6 +41,10 @@ class Computer {
   // setup against the share with a password command, then the two folders.
   void join(const std::string& url, const std::string& user, const std::string& password) const;
 
+  // Sets a per-host preference (the configuration's last layer); call it
+  // while no client runs on this computer.
+  void setPreference(const std::string& key, const Value& value) const;
+
   // The item files of a folder, name -> content.
   static std::map<std::string, std::string> files(const std::string& folder);
   static void write(const std::string& path, const std::string& content);
@@ -46,6 +52,7 @@ class Computer {
 
  private:
   std::vector<std::string> environment() const;
+  std::string perHostFile() const;
   std::string name_;
   std::string home_;
 };

@@ -1,5 +1,7 @@
 #include "support/FaultProxy.h"
 
+#include <chrono>
+
 #include <poll.h>
 #include <sys/eventfd.h>
 #include <sys/socket.h>
@@ -135,7 +137,10 @@ void FaultProxy::serve(int client) {
           open = false;
         else if (rule.status != 0)
           open = sendAll(client, answerWith(rule.status));
-        else
+        else if (rule.action == "delayed") {
+          std::this_thread::sleep_for(std::chrono::milliseconds(rule.delayMs));
+          open = sendAll(server, std::string_view(pending).substr(0, length));
+        } else
           open = sendAll(server, std::string_view(pending).substr(0, length));
         pending.erase(0, length);
       }

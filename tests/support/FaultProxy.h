@@ -24,7 +24,7 @@ class FaultProxy {
   struct Seen {
     std::string method;
     std::string path;
-    std::string action;  // "forwarded", "timed out", "dropped" or "answered <status>"
+    std::string action;  // "forwarded", "timed out", "dropped", "delayed" or "answered <status>"
   };
 
   explicit FaultProxy(int targetPort);
@@ -41,6 +41,10 @@ class FaultProxy {
   void answer(Match match, int status) {
     add({std::move(match), "answered " + std::to_string(status), status});
   }
+  // Holds the request this long, then forwards it.
+  void delay(Match match, int milliseconds) {
+    add({std::move(match), "delayed", 0, 0, milliseconds});
+  }
   void clear();
 
   std::vector<Seen> requests() const;
@@ -53,6 +57,7 @@ class FaultProxy {
     std::string action = "forwarded";
     int status = 0;  // of an answer
     int seen = 0;    // matching requests so far
+    int delayMs = 0;
   };
 
   void add(Rule rule);
