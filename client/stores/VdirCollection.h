@@ -64,8 +64,10 @@ class VdirCollection {
 
   // Compares the folder with the known states. Invalid files are reported,
   // never counted as deleted or changed. An unreadable folder raises
-  // std::runtime_error (never "everything deleted").
-  ScanResult scan(const std::map<std::string, ItemState>& known) const;
+  // std::runtime_error (never "everything deleted"). Known states handed
+  // over with std::move are not copied: those that still hold move into
+  // the result.
+  ScanResult scan(std::map<std::string, ItemState> known) const;
 
   // Writes an item's bytes atomically, if the file is still as `expected`
   // says (none: the file must not exist). On Written, *state is the new

@@ -11,6 +11,7 @@
 #include <fstream>
 #include <stdexcept>
 
+#include "client/stores/ItemFiles.h"
 #include "client/stores/VdirCollection.h"
 #include "common/Logging.h"
 #include "platform/prefs/PreferenceStore.h"
@@ -197,11 +198,21 @@ TEST_F(VdirFolder, FilesChangedSinceTheyWereReadAreNeverOverwrittenOrRemoved) {
             WriteOutcome::SkippedChangedOnDisk);
   EXPECT_EQ(contents("b.vcf"), card("Grace, made here"));
 
+  // Should the name appear in the instant between that check and the
+  // rename, the rename still does not replace it.
+  put(".temporary", card("Grace, from the sync"));
+  vtc::client::FileDescriptor dir(::open(folder.c_str(), O_RDONLY | O_DIRECTORY));
+  EXPECT_FALSE(vtc::client::placeNewFile(dir.get(), ".temporary", "b.vcf"));
+  EXPECT_EQ(errno, EEXIST);
+  EXPECT_EQ(contents("b.vcf"), card("Grace, made here"));
+  EXPECT_TRUE(vtc::client::placeNewFile(dir.get(), ".temporary", "c.vcf"));
+  EXPECT_EQ(contents("c.vcf"), card("Grace, from the sync"));
+
   // A removal of the file as it was read; a file already gone counts as removed.
   state = store.scan({}).states.at("a.vcf");
   EXPECT_EQ(store.remove("a.vcf", state), WriteOutcome::Removed);
   EXPECT_EQ(store.remove("a.vcf", state), WriteOutcome::Removed);
-  EXPECT_EQ(folderEntries(), (std::vector<std::string>{"b.vcf"}));
+  EXPECT_EQ(folderEntries(), (std::vector<std::string>{"b.vcf", "c.vcf"}));
 }
 
 TEST_F(VdirFolder, StatesSurviveAsValuesAndBadValuesAreRefused) {
