@@ -50,10 +50,11 @@ std::vector<std::string> itemFileNames(DIR* dir, const std::string& folder, Item
   return names;
 }
 
-// One file of a scan, in name order: its state goes to result.states, its
-// fields to added or changed when they are new. `known` is its state from
-// before, if any; when that state still holds, scan() leaves it to the
-// caller to move into result.states and returns true.
+// One file of a scan, in name order: its new state goes to result.states,
+// its fields to added or changed when they are new. `known` is its state
+// from before, if any; keepsKnownState() is true when that state is to be
+// kept as it is (the file is unchanged, or unusable and so skipped), which
+// the caller moves into result.states.
 class FileScan {
  public:
   FileScan(const std::string& folder, ItemKind kind, int dirFd, ScanResult& result)

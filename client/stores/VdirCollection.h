@@ -4,10 +4,15 @@
 //
 // A scan stats every item file and reads only those whose size, change time
 // or inode differ from what was known; it reports the items added, changed
-// (their fields differ from the known ones) and deleted. Writes are atomic
-// (a temporary file in the folder, fsync, rename) and never overwrite a file
-// that changed since it was last read or written: such a write is skipped
-// and left for the next sync.
+// (their fields differ from the known ones) and deleted. A file rewritten
+// in place at the same size within one tick of the file system's clock
+// after it was read goes unseen until it changes again; programs that save
+// by renaming a new file into place always give it a new inode.
+//
+// Writes are atomic (a temporary file in the folder, fsync, rename, fsync
+// of the folder) and never overwrite a file that changed since it was last
+// read or written: such a write is skipped and left for the next sync.
+// A collection object is immutable: concurrent calls on it are safe.
 #pragma once
 
 #include <cstdint>

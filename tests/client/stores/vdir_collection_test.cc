@@ -136,9 +136,8 @@ TEST_F(VdirFolder, InvalidFilesAreSkippedWithAWarningNeverDeletedAndComeBackWhen
 }
 
 TEST_F(VdirFolder, AMissingFolderRaisesInsteadOfLookingEmpty) {
-  ScanResult known = store.scan({});
   put("a.vcf", card("Ada"));
-  known = store.scan({});
+  ScanResult known = store.scan({});
   fs::remove_all(folder);
   EXPECT_FALSE(store.exists());
   try {
@@ -149,7 +148,6 @@ TEST_F(VdirFolder, AMissingFolderRaisesInsteadOfLookingEmpty) {
   }
   put("../contacts", "a file now");
   EXPECT_THROW(store.scan(known.states), std::runtime_error);
-  EXPECT_FALSE(store.exists());
 }
 
 TEST_F(VdirFolder, WritesAreAtomicAndTheirStateIsWhatTheNextScanSees) {
@@ -218,11 +216,7 @@ TEST_F(VdirFolder, FilesChangedSinceTheyWereReadAreNeverOverwrittenOrRemoved) {
 TEST_F(VdirFolder, StatesSurviveAsValuesAndBadValuesAreRefused) {
   ItemState state = written("a.vcf", card("Ada"));
   state.inode = 0xFFFFFFFF00000001ULL;  // above what a signed integer holds
-  auto back = ItemState::fromValue(state.toValue());
-  ASSERT_TRUE(back);
-  EXPECT_TRUE(back->sameFileAs(state));
-  EXPECT_EQ(back->fields, state.fields);
-
+  EXPECT_EQ(ItemState::fromValue(state.toValue()), state);
   vtc::Dictionary value = state.toValue().dictionary();
   value.set("size", "12");
   EXPECT_FALSE(ItemState::fromValue(vtc::Value(value)));
