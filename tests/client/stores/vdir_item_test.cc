@@ -109,7 +109,11 @@ TEST(VdirItem, BytesThatAreNotOneWholeItemAreInvalid) {
       "BEGIN:VCALENDAR\r\nEND:VCALENDAR\r\n",                                      // other kind
   };
   for (const char* card : cards) EXPECT_FALSE(splitItem(ItemKind::Contacts, card)) << card;
-  EXPECT_TRUE(splitItem(ItemKind::Contacts, "\r\nBEGIN:VCARD\r\nFN:x\r\nEND:VCARD\r\n\r\n"));
+  // Blank lines around the item and a byte order mark are no harm, and stay.
+  std::string framed = "\xEF\xBB\xBF\r\nBEGIN:VCARD\r\nFN:x\r\nEND:VCARD\r\n\r\n";
+  EXPECT_EQ(fieldsOf(ItemKind::Contacts, framed).keys(), std::vector<std::string>{"FN"});
+  EXPECT_EQ(applyFieldChanges(ItemKind::Contacts, framed, Array{setField("FN", "FN:y\r\n")}),
+            "\xEF\xBB\xBF\r\nBEGIN:VCARD\r\nFN:y\r\nEND:VCARD\r\n\r\n");
 
   const char* calendars[] = {
       "BEGIN:VCALENDAR\nBEGIN:VEVENT\nSUMMARY:no uid\nEND:VEVENT\nEND:VCALENDAR\n",
@@ -252,7 +256,9 @@ TEST(VdirItem, CalendarChangesLandInTheirComponentAndEmptiedOccurrencesGo) {
   const std::string moved = "VEVENT/weekly@example.org/20250310T090000/";
   const std::string next = "VEVENT/weekly@example.org/20250317T090000/";
   Array changes{
+      setField(moved + "VALARM", "BEGIN:VALARM\r\nTRIGGER:-PT1H\r\nEND:VALARM\r\n"),
       setField(moved + "SUMMARY", "SUMMARY:Planning (late)\r\n"),
+      setField(moved + "LOCATION", "LOCATION:Garden\r\n"),   // before the new alarm
       setField(master + "LOCATION", "LOCATION:Room 4\r\n"),  // before the alarms
       setField(master + "VALARM",
                "BEGIN:VALARM\r\nACTION:DISPLAY\r\nTRIGGER:-PT5M\r\nEND:VALARM\r\n"),
@@ -276,7 +282,8 @@ TEST(VdirItem, CalendarChangesLandInTheirComponentAndEmptiedOccurrencesGo) {
       "ATTENDEE;CN=Grace:mailto:grace@example.org\nLOCATION:Room 4\n"
       "BEGIN:VALARM\nACTION:DISPLAY\nTRIGGER:-PT5M\nEND:VALARM\n");
   replace("SUMMARY:Planning (afternoon)\nEND:VEVENT\n",
-          "SUMMARY:Planning (late)\nEND:VEVENT\n"
+          "SUMMARY:Planning (late)\nLOCATION:Garden\n"
+          "BEGIN:VALARM\nTRIGGER:-PT1H\nEND:VALARM\nEND:VEVENT\n"
           "BEGIN:VEVENT\nSUMMARY:Planning (remote)\nUID:weekly@example.org\n"
           "RECURRENCE-ID;TZID=Europe/Berlin:20250317T090000\nEND:VEVENT\n");
   EXPECT_EQ(out, expected);
