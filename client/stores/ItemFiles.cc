@@ -1,6 +1,9 @@
 #include "client/stores/ItemFiles.h"
 
+#include <fcntl.h>
 #include <unistd.h>
+
+#include <cstdio>
 
 #include <cerrno>
 
@@ -51,6 +54,16 @@ bool writeWhole(int fd, std::string_view bytes) {
     if (n <= 0) return false;
     bytes.remove_prefix(static_cast<size_t>(n));
   }
+  return true;
+}
+
+bool placeNewFile(int dirFd, const std::string& temporary, const std::string& name) {
+  if (::renameat2(dirFd, temporary.c_str(), dirFd, name.c_str(), RENAME_NOREPLACE) == 0)
+    return true;
+  if (errno != EINVAL && errno != ENOSYS) return false;
+  // The file system cannot rename without replacing; a hard link does the same.
+  if (::linkat(dirFd, temporary.c_str(), dirFd, name.c_str(), 0) != 0) return false;
+  ::unlinkat(dirFd, temporary.c_str(), 0);  // a leftover is hidden and never read
   return true;
 }
 

@@ -42,4 +42,9 @@ std::optional<std::string> readWhole(int fd);
 // Writes all bytes; false on any error (errno says which).
 bool writeWhole(int fd, std::string_view bytes);
 
+// Renames `temporary` to `name` in the folder unless a file of that name
+// exists, atomically; false with errno EEXIST when one does, and then both
+// files are as they were.
+bool placeNewFile(int dirFd, const std::string& temporary, const std::string& name);
+
 }  // namespace vtc::client

@@ -22,8 +22,15 @@ std::string componentName(std::string_view text) {
 
 class LayoutReader {
  public:
-  LayoutReader(ItemKind kind, std::string_view bytes)
-      : kind_(kind), bytes_(bytes), lines_(readContentLines(bytes)) {}
+  LayoutReader(ItemKind kind, std::string_view bytes) : kind_(kind), bytes_(bytes) {
+    // Some programs start their files with a byte order mark; it stays.
+    constexpr std::string_view kByteOrderMark = "\xEF\xBB\xBF";
+    if (bytes_.starts_with(kByteOrderMark)) {
+      layout_.units.push_back({Role::Blank, bytes_.substr(0, kByteOrderMark.size()), {}, {}});
+      bytes_.remove_prefix(kByteOrderMark.size());
+    }
+    lines_ = readContentLines(bytes_);
+  }
 
   std::optional<ItemLayout> read(std::string* problem) {
     bool ok = kind_ == ItemKind::Contacts ? readCard() : readCalendar();

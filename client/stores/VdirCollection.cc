@@ -33,6 +33,77 @@ const char* formatName(ItemKind kind) {
   return kind == ItemKind::Contacts ? "vCard" : "iCalendar item";
 }
 
+// The names of the folder's item files, sorted. A listing cut short by an
+// error raises: it would make every file after the error look deleted.
+std::vector<std::string> itemFileNames(DIR* dir, const std::string& folder, ItemKind kind) {
+  std::vector<std::string> names;
+  for (;;) {
+    errno = 0;
+    const dirent* entry = ::readdir(dir);
+    if (!entry) {
+      if (errno != 0) throw unreadableFolder(folder, errno);
+      break;
+    }
+    if (isItemFileName(entry->d_name, kind)) names.emplace_back(entry->d_name);
+  }
+  std::sort(names.begin(), names.end());
+  return names;
+}
+
+// One file of a scan, in name order: its new state goes to result.states,
+// its fields to added or changed when they are new. `known` is its state
+// from before, if any; keepsKnownState() is true when that state is to be
+// kept as it is (the file is unchanged, or unusable and so skipped), which
+// the caller moves into result.states.
+class FileScan {
+ public:
+  FileScan(const std::string& folder, ItemKind kind, int dirFd, ScanResult& result)
+      : folder_(folder), kind_(kind), dirFd_(dirFd), result_(result) {}
+
+  bool keepsKnownState(const std::string& name, const ItemState* known) {
+    struct stat st {};
+    if (::fstatat(dirFd_, name.c_str(), &st, 0) != 0) {
+      if (errno == ENOENT) return false;  // removed since the listing, so gone
+      return skip(name, known, strerror(errno));
+    }
+    if (!S_ISREG(st.st_mode)) return false;
+    if (known && known->sameFileAs(fileState(st))) return true;
+
+    FileDescriptor file(::openat(dirFd_, name.c_str(), O_RDONLY | O_CLOEXEC));
+    std::optional<std::string> bytes;
+    // The state of what is read: a change after this fstat shows at the next scan.
+    if (file.valid() && ::fstat(file.get(), &st) == 0) bytes = readWhole(file.get());
+    if (!bytes) return errno != ENOENT && skip(name, known, strerror(errno));
+    ++result_.filesRead;
+    std::string problem;
+    std::optional<ItemLayout> layout = readItemLayout(kind_, *bytes, &problem);
+    if (!layout)
+      return skip(name, known, format("it is not a valid %s (%@)", formatName(kind_), problem));
+    ItemState state = fileState(st);
+    state.fields = std::move(layout->fields);
+    if (!known)
+      result_.added.emplace_hint(result_.added.end(), name, state.fields);
+    else if (!(known->fields == state.fields))
+      result_.changed.emplace_hint(result_.changed.end(), name, state.fields);
+    result_.states.emplace_hint(result_.states.end(), name, std::move(state));
+    return false;
+  }
+
+ private:
+  const std::string& folder_;
+  ItemKind kind_;
+  int dirFd_;
+  ScanResult& result_;
+
+  // A file that cannot be taken as an item keeps the state it had, so that
+  // it is neither deleted nor added again once it is fixed.
+  bool skip(const std::string& name, const ItemState* known, const std::string& why) {
+    VTC_LOG_WARNING("Skipping %@: %@", paths::join(folder_, name), why);
+    result_.invalid.push_back(name);
+    return known != nullptr;
+  }
+};
+
 }  // namespace
 
 VdirCollection::VdirCollection(std::string folder, ItemKind kind)
@@ -43,74 +114,25 @@ bool VdirCollection::exists() const {
   return ::stat(folder_.c_str(), &st) == 0 && S_ISDIR(st.st_mode);
 }
 
-ScanResult VdirCollection::scan(const std::map<std::string, ItemState>& known) const {
+ScanResult VdirCollection::scan(std::map<std::string, ItemState> known) const {
   std::unique_ptr<DIR, DirectoryCloser> dir(::opendir(folder_.c_str()));
   if (!dir) throw unreadableFolder(folder_, errno);
-  int dirFd = ::dirfd(dir.get());
-
   ScanResult result;
-  // A file that cannot be taken as an item keeps the state it had, so that
-  // it is neither deleted nor added again once it is fixed.
-  auto skip = [&](const std::string& name) {
-    result.invalid.push_back(name);
-    if (auto it = known.find(name); it != known.end()) result.states.insert(*it);
-  };
-  for (;;) {
-    errno = 0;
-    const dirent* entry = ::readdir(dir.get());
-    if (!entry) {
-      // A listing cut short would make every file after the error look deleted.
-      if (errno != 0) throw unreadableFolder(folder_, errno);
-      break;
-    }
-    std::string name = entry->d_name;
-    if (!isItemFileName(name, kind_)) continue;
-    struct stat st {};
-    if (::fstatat(dirFd, name.c_str(), &st, 0) != 0) {
-      if (errno == ENOENT) continue;  // removed since the listing: gone
-      VTC_LOG_WARNING("Skipping %@: %s", paths::join(folder_, name), strerror(errno));
-      skip(name);
-      continue;
-    }
-    if (!S_ISREG(st.st_mode)) continue;
-    ItemState state = fileState(st);
-    auto before = known.find(name);
-    if (before != known.end() && before->second.sameFileAs(state)) {
-      result.states.insert(*before);
-      continue;
-    }
-
-    FileDescriptor file(::openat(dirFd, name.c_str(), O_RDONLY | O_CLOEXEC));
-    std::optional<std::string> bytes;
-    // The state of what is read: a change after fstat shows at the next scan.
-    if (file.valid() && ::fstat(file.get(), &st) == 0) bytes = readWhole(file.get());
-    if (!bytes) {
-      if (errno == ENOENT) continue;
-      VTC_LOG_WARNING("Skipping %@: %s", paths::join(folder_, name), strerror(errno));
-      skip(name);
-      continue;
-    }
-    ++result.filesRead;
-    std::string problem;
-    std::optional<ItemLayout> layout = readItemLayout(kind_, *bytes, &problem);
-    if (!layout) {
-      VTC_LOG_WARNING("Skipping %@, which is not a valid %s: %@", paths::join(folder_, name),
-                      formatName(kind_), problem);
-      skip(name);
-      continue;
-    }
-    state = fileState(st);
-    state.fields = std::move(layout->fields);
-    if (before == known.end())
-      result.added.emplace(name, state.fields);
-    else if (!(before->second.fields == state.fields))
-      result.changed.emplace(name, state.fields);
-    result.states.emplace(std::move(name), std::move(state));
+  FileScan files(folder_, kind_, ::dirfd(dir.get()), result);
+  // Names and known states both in order: one walk matches them. A state
+  // that still holds moves over whole, without a copy of its fields.
+  auto before = known.begin();
+  for (const std::string& name : itemFileNames(dir.get(), folder_, kind_)) {
+    while (before != known.end() && before->first < name) ++before;
+    bool isKnown = before != known.end() && before->first == name;
+    if (files.keepsKnownState(name, isKnown ? &before->second : nullptr))
+      result.states.insert(result.states.end(), known.extract(before++));
   }
-
-  for (const auto& [name, state] : known)
-    if (!result.states.contains(name)) result.deleted.push_back(name);
-  std::sort(result.invalid.begin(), result.invalid.end());
+  auto now = result.states.begin();
+  for (const auto& [name, state] : known) {
+    while (now != result.states.end() && now->first < name) ++now;
+    if (now == result.states.end() || now->first != name) result.deleted.push_back(name);
+  }
   return result;
 }
 

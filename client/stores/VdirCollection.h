@@ -4,10 +4,15 @@
 //
 // A scan stats every item file and reads only those whose size, change time
 // or inode differ from what was known; it reports the items added, changed
-// (their fields differ from the known ones) and deleted. Writes are atomic
-// (a temporary file in the folder, fsync, rename) and never overwrite a file
-// that changed since it was last read or written: such a write is skipped
-// and left for the next sync.
+// (their fields differ from the known ones) and deleted. A file rewritten
+// in place at the same size within one tick of the file system's clock
+// after it was read goes unseen until it changes again; programs that save
+// by renaming a new file into place always give it a new inode.
+//
+// Writes are atomic (a temporary file in the folder, fsync, rename, fsync
+// of the folder) and never overwrite a file that changed since it was last
+// read or written: such a write is skipped and left for the next sync.
+// A collection object is immutable: concurrent calls on it are safe.
 #pragma once
 
 #include <cstdint>
@@ -64,8 +69,10 @@ class VdirCollection {
 
   // Compares the folder with the known states. Invalid files are reported,
   // never counted as deleted or changed. An unreadable folder raises
-  // std::runtime_error (never "everything deleted").
-  ScanResult scan(const std::map<std::string, ItemState>& known) const;
+  // std::runtime_error (never "everything deleted"). Known states handed
+  // over with std::move are not copied: those that still hold move into
+  // the result.
+  ScanResult scan(std::map<std::string, ItemState> known) const;
 
   // Writes an item's bytes atomically, if the file is still as `expected`
   // says (none: the file must not exist). On Written, *state is the new

@@ -56,7 +56,8 @@ bool startsComponent(std::string_view lines) {
 }
 
 // Where new lines go, by the field's kind. Several insertions before one
-// unit are ordered by rank: properties, time zones, components.
+// unit are ordered by rank: properties first, then time zones or nested
+// components (alarms), then events.
 struct Anchor {
   size_t unit;
   int rank;
@@ -139,7 +140,7 @@ class ItemEditor {
       if (existing != components_.end() && !container.empty()) {
         Component& c = existing->second;
         ++c.fields;
-        inserts_[{block ? c.end : c.firstBlock.value_or(c.end), 0}] += lines;
+        inserts_[{block ? c.end : c.firstBlock.value_or(c.end), block ? 1 : 0}] += lines;
         return;
       }
       auto it = std::find_if(newComponents_.begin(), newComponents_.end(),

@@ -11,7 +11,6 @@
 #include <unistd.h>
 
 #include <cerrno>
-#include <cstdio>
 #include <cstring>
 #include <stdexcept>
 
@@ -48,17 +47,6 @@ OnDisk compareWithDisk(int dirFd, const std::string& name, const std::optional<I
   }
   if (mode) *mode = st.st_mode & 07777;
   return expected && fileState(st).sameFileAs(*expected) ? OnDisk::AsExpected : OnDisk::Changed;
-}
-
-// Puts a new item's file in place unless the name is taken. Where the file
-// system cannot rename without replacing, a hard link does the same.
-bool placeNewFile(int dirFd, const std::string& temporary, const std::string& name) {
-  if (::renameat2(dirFd, temporary.c_str(), dirFd, name.c_str(), RENAME_NOREPLACE) == 0)
-    return true;
-  if (errno != EINVAL && errno != ENOSYS) return false;
-  if (::linkat(dirFd, temporary.c_str(), dirFd, name.c_str(), 0) != 0) return false;
-  ::unlinkat(dirFd, temporary.c_str(), 0);  // a leftover is hidden and never read
-  return true;
 }
 
 }  // namespace

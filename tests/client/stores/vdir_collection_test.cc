@@ -11,6 +11,7 @@
 #include <fstream>
 #include <stdexcept>
 
+#include "client/stores/ItemFiles.h"
 #include "client/stores/VdirCollection.h"
 #include "common/Logging.h"
 #include "platform/prefs/PreferenceStore.h"
@@ -135,9 +136,8 @@ TEST_F(VdirFolder, InvalidFilesAreSkippedWithAWarningNeverDeletedAndComeBackWhen
 }
 
 TEST_F(VdirFolder, AMissingFolderRaisesInsteadOfLookingEmpty) {
-  ScanResult known = store.scan({});
   put("a.vcf", card("Ada"));
-  known = store.scan({});
+  ScanResult known = store.scan({});
   fs::remove_all(folder);
   EXPECT_FALSE(store.exists());
   try {
@@ -148,7 +148,6 @@ TEST_F(VdirFolder, AMissingFolderRaisesInsteadOfLookingEmpty) {
   }
   put("../contacts", "a file now");
   EXPECT_THROW(store.scan(known.states), std::runtime_error);
-  EXPECT_FALSE(store.exists());
 }
 
 TEST_F(VdirFolder, WritesAreAtomicAndTheirStateIsWhatTheNextScanSees) {
@@ -197,21 +196,27 @@ TEST_F(VdirFolder, FilesChangedSinceTheyWereReadAreNeverOverwrittenOrRemoved) {
             WriteOutcome::SkippedChangedOnDisk);
   EXPECT_EQ(contents("b.vcf"), card("Grace, made here"));
 
+  // Should the name appear in the instant between that check and the
+  // rename, the rename still does not replace it.
+  put(".temporary", card("Grace, from the sync"));
+  vtc::client::FileDescriptor dir(::open(folder.c_str(), O_RDONLY | O_DIRECTORY));
+  EXPECT_FALSE(vtc::client::placeNewFile(dir.get(), ".temporary", "b.vcf"));
+  EXPECT_EQ(errno, EEXIST);
+  EXPECT_EQ(contents("b.vcf"), card("Grace, made here"));
+  EXPECT_TRUE(vtc::client::placeNewFile(dir.get(), ".temporary", "c.vcf"));
+  EXPECT_EQ(contents("c.vcf"), card("Grace, from the sync"));
+
   // A removal of the file as it was read; a file already gone counts as removed.
   state = store.scan({}).states.at("a.vcf");
   EXPECT_EQ(store.remove("a.vcf", state), WriteOutcome::Removed);
   EXPECT_EQ(store.remove("a.vcf", state), WriteOutcome::Removed);
-  EXPECT_EQ(folderEntries(), (std::vector<std::string>{"b.vcf"}));
+  EXPECT_EQ(folderEntries(), (std::vector<std::string>{"b.vcf", "c.vcf"}));
 }
 
 TEST_F(VdirFolder, StatesSurviveAsValuesAndBadValuesAreRefused) {
   ItemState state = written("a.vcf", card("Ada"));
   state.inode = 0xFFFFFFFF00000001ULL;  // above what a signed integer holds
-  auto back = ItemState::fromValue(state.toValue());
-  ASSERT_TRUE(back);
-  EXPECT_TRUE(back->sameFileAs(state));
-  EXPECT_EQ(back->fields, state.fields);
-
+  EXPECT_EQ(ItemState::fromValue(state.toValue()), state);
   vtc::Dictionary value = state.toValue().dictionary();
   value.set("size", "12");
   EXPECT_FALSE(ItemState::fromValue(vtc::Value(value)));
