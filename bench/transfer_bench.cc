@@ -16,7 +16,7 @@
 #include "VantorSyncManager/NubiloRemoteSession.h"
 #include "platform/dav/DavPaths.h"
 #include "platform/dav/TesselSession.h"
-#include "support/ApacheShare.h"
+#include "localshare/ApacheShare.h"
 
 namespace {
 
@@ -25,7 +25,7 @@ constexpr int kChangeLogs = 200;
 
 struct Fixture {
   std::string home;
-  std::unique_ptr<vtc::test::ApacheShare> share;
+  std::unique_ptr<vtc::local::ApacheShare> share;
   std::unique_ptr<NubiloRemoteSession> session;
   std::string curlConfig;  // one url= line per changelog
 
@@ -33,7 +33,7 @@ struct Fixture {
     char dir[] = "/tmp/vsm-transfer-bench-XXXXXX";
     home = ::mkdtemp(dir);
     ::setenv("HOME", home.c_str(), 1);
-    share = std::make_unique<vtc::test::ApacheShare>();
+    share = std::make_unique<vtc::local::ApacheShare>();
     session = open();
     session->getDataclassInfo(kDataclass);
     for (int index = 1; index <= kChangeLogs; ++index) {
@@ -59,8 +59,8 @@ struct Fixture {
   }
   std::unique_ptr<NubiloRemoteSession> open() const {
     vtc::Dictionary config = share->configuration();
-    return NubiloRemoteSession::sessionWithUsername(vtc::test::ApacheShare::kUser,
-                                                    vtc::test::ApacheShare::kPassword, config);
+    return NubiloRemoteSession::sessionWithUsername(vtc::local::ApacheShare::kUser,
+                                                    vtc::local::ApacheShare::kPassword, config);
   }
 };
 
@@ -90,8 +90,8 @@ void SessionFetch(benchmark::State& state) {
 
 void CurlGets(benchmark::State& state) {
   Fixture& f = fixture();
-  const std::string command = "curl -sf --basic -u " + std::string(vtc::test::ApacheShare::kUser) +
-                              ":" + vtc::test::ApacheShare::kPassword + " -K " + f.curlConfig;
+  const std::string command = "curl -sf --basic -u " + std::string(vtc::local::ApacheShare::kUser) +
+                              ":" + vtc::local::ApacheShare::kPassword + " -K " + f.curlConfig;
   for (auto _ : state)
     if (std::system(command.c_str()) != 0) state.SkipWithError("curl failed");
 }

@@ -5,12 +5,12 @@
 
 #include <filesystem>
 
-#include "support/ApacheShare.h"
-#include "support/Computer.h"
+#include "localshare/ApacheShare.h"
+#include "localshare/Computer.h"
 #include "support/TestHome.h"
 
 using testing::HasSubstr;
-using vtc::test::Computer;
+using vtc::local::Computer;
 
 namespace {
 
@@ -23,14 +23,14 @@ std::string card(const std::string& uid, const std::string& fn, const std::strin
 class Account : public ::testing::Test {
  protected:
   vtc::test::TestHome home;
-  vtc::test::ApacheShare share;
+  vtc::local::ApacheShare share;
   std::string url = "http://127.0.0.1:" + std::to_string(share.port()) + "/sync";
   Computer a{"Mac A"};
   Computer b{"Mac B"};
 
   void SetUp() override {
-    a.join(url, vtc::test::ApacheShare::kUser, vtc::test::ApacheShare::kPassword);
-    b.join(url, vtc::test::ApacheShare::kUser, vtc::test::ApacheShare::kPassword);
+    a.join(url, vtc::local::ApacheShare::kUser, vtc::local::ApacheShare::kPassword);
+    b.join(url, vtc::local::ApacheShare::kUser, vtc::local::ApacheShare::kPassword);
   }
   // Syncs and expects success; the output for further checks.
   Computer::Result sync(const Computer& c, std::vector<std::string> more = {}) {
@@ -148,7 +148,7 @@ TEST_F(Account, ANewComputerJoiningAnAccountWithHistoryGetsItAllAndKeepsItsOwn) 
   sync(a);
 
   Computer c{"Mac C"};
-  c.join(url, vtc::test::ApacheShare::kUser, vtc::test::ApacheShare::kPassword);
+  c.join(url, vtc::local::ApacheShare::kUser, vtc::local::ApacheShare::kPassword);
   Computer::write(c.contacts() + "/dan.vcf", card("dan", "Dan", "dan@example.org", "4"));
   EXPECT_THAT(sync(c).out, HasSubstr("(slow sync)"));
   sync(a);
@@ -162,7 +162,7 @@ TEST_F(Account, ANewComputerJoiningAnAccountWithHistoryGetsItAllAndKeepsItsOwn) 
 // truth in once and lose nothing.
 TEST_F(Account, CompactionKeepsAnUnsentEditAndAComputerAwayThroughoutConverges) {
   Computer c{"Mac C"};
-  c.join(url, vtc::test::ApacheShare::kUser, vtc::test::ApacheShare::kPassword);
+  c.join(url, vtc::local::ApacheShare::kUser, vtc::local::ApacheShare::kPassword);
   Computer::write(a.contacts() + "/ann.vcf", card("ann", "Ann", "ann@example.org", "1"));
   Computer::write(a.contacts() + "/bob.vcf", card("bob", "Bob", "bob@example.org", "2"));
   sync(a);

@@ -11,7 +11,7 @@
 #include "VantorSyncManager/NubiloRemoteSession.h"
 #include "VantorSyncManager/PublicNames.h"
 #include "VantorSyncManager/VTCPrefsCenter.h"
-#include "support/ApacheShare.h"
+#include "localshare/ApacheShare.h"
 #include "support/Failures.h"
 #include "support/FakeTime.h"
 #include "support/LogCapture.h"
@@ -36,7 +36,7 @@ class Legacy : public ::testing::Test {
   vtc::test::TestHome home;
   vtc::test::LogCapture logged;
   vtc::test::FakeTime time;
-  vtc::test::ApacheShare share;
+  vtc::local::ApacheShare share;
 
   void SetUp() override { vtc::test::storeShareInPreferences(share); }
   void TearDown() override { vtc::setAssertionPolicy(vtc::AssertionPolicy::Throw); }
@@ -122,7 +122,7 @@ TEST_F(Legacy, SessionFailuresReachTheCallerAndAClientWithoutGuidIsNotRegistered
   EXPECT_THAT([&] { session->registerClient(nameless); },
               ThrowsMessage<vtc::AssertionFailure>("registerClient: client guid is missing!"));
   EXPECT_FALSE(std::filesystem::exists(
-      share.diskPath(std::string(vtc::test::ApacheShare::kSyncPath) + "/Clients/.client")));
+      share.diskPath(std::string(vtc::local::ApacheShare::kSyncPath) + "/Clients/.client")));
 }
 
 TEST_F(Legacy, InertMembersSendNothingAndRetiredOnesReportTheirUse) {

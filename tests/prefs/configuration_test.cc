@@ -14,7 +14,7 @@
 #include "platform/plist/PlistCodec.h"
 #include "platform/prefs/PreferenceStore.h"
 #include "prefs/ClientConfiguration.h"
-#include "support/ApacheShare.h"
+#include "localshare/ApacheShare.h"
 #include "support/FakeTime.h"
 #include "support/KeyPair.h"
 #include "support/LogCapture.h"
@@ -30,7 +30,7 @@ class Configuration : public ::testing::Test {
   vtc::test::TestHome home;
   vtc::test::LogCapture logged;
   vtc::test::FakeTime time;
-  vtc::test::ApacheShare share;
+  vtc::local::ApacheShare share;
   vtc::test::KeyPair keys{512};
   VTCPrefsCenter& prefs = VTCPrefsCenter::defaultCenter();
   std::string configPath = "/configurations/internetservices/syncworks/clientConfiguration-1.2.3";

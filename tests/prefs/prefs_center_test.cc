@@ -17,7 +17,7 @@
 #include "platform/engine/SyncEngine.h"
 #include "platform/prefs/PreferenceStore.h"
 #include "platform/secrets/CredentialStore.h"
-#include "support/ApacheShare.h"
+#include "localshare/ApacheShare.h"
 #include "support/FakeTime.h"
 #include "support/LogCapture.h"
 #include "support/SessionBus.h"
@@ -173,13 +173,13 @@ TEST_F(PrefsCenter, ASessionOpensFromThePreferencesAndTheKeyringOrTheLogSaysHowT
   {
     vtc::test::SessionBus bus;
     bus.startKeyring();
-    vtc::test::ApacheShare share;
+    vtc::local::ApacheShare share;
     ASSERT_TRUE(vtc::secrets::storeGenericPassword("Kitbag", "alice", "Nubilo", "wonderland"));
     EXPECT_EQ(prefs.username(), "alice");
     EXPECT_EQ(prefs.objectForKey("Password"), vtc::Value("wonderland"));
     NubiloRemoteSession::sessionFromPreferencesWithConfiguration(share.configuration());
     EXPECT_TRUE(std::filesystem::is_directory(
-        share.diskPath(std::string(vtc::test::ApacheShare::kSyncPath) + "/Clients")));
+        share.diskPath(std::string(vtc::local::ApacheShare::kSyncPath) + "/Clients")));
   }
   // Without a Secret Service on the bus the login fails before any request.
   vtc::test::SessionBus bus;

@@ -21,7 +21,7 @@
 #include "platform/plist/PlistCodec.h"
 #include "session/SyncReport.h"
 #include "support/FaultProxy.h"
-#include "support/Processes.h"
+#include "localshare/Processes.h"
 #include "support/ShareTest.h"
 
 using testing::HasSubstr;
@@ -321,7 +321,7 @@ TEST_F(Commit, AProcessKilledAtEachStepLeavesNothingOrARepairableRecordOrTheWhol
       char c;
       ASSERT_EQ(::read(done[0], &c, 1), 1);
     } else {
-      ASSERT_TRUE(vtc::test::waitUntil([&] {
+      ASSERT_TRUE(vtc::local::waitUntil([&] {
         for (const auto& seen : proxy.requests())
           if (seen.method == stopAt && seen.action == "timed out") return true;
         return false;

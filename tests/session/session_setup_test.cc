@@ -18,7 +18,7 @@
 
 using testing::HasSubstr;
 using testing::ThrowsMessage;
-using vtc::test::ApacheShare;
+using vtc::local::ApacheShare;
 using vtc::test::ThrowsFailure;
 
 namespace {
@@ -73,7 +73,7 @@ TEST_F(SessionSetup, AWrongPasswordFailsAtOnceAndAServerDownAfterRetriesThroughT
       logged.messages("Error"),
       std::vector<std::string>{"Failed to validate credentials for alice, Raising exception"});
 
-  vtc::Dictionary down{{"host_port", vtc::test::freeLoopbackPort()}};
+  vtc::Dictionary down{{"host_port", vtc::local::freeLoopbackPort()}};
   EXPECT_THAT([&] { openSession(down); },
               ThrowsMessage<NubiloException>(
                   "NubiloNetworkFailureException: Failed to validate credentials for alice"));

@@ -12,10 +12,13 @@
 #include <cstring>
 #include <sstream>
 
+#include "localshare/Processes.h"
 #include "platform/dav/DavPaths.h"
-#include "support/Processes.h"
 
 namespace vtc::test {
+
+using local::connectLoopback;
+using local::listenLoopback;
 
 namespace {
 

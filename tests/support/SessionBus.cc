@@ -8,10 +8,14 @@
 #include <stdexcept>
 #include <utility>
 
+#include "localshare/Processes.h"
 #include "platform/bus/DistributedNotifications.h"
-#include "support/Processes.h"
 
 namespace vtc::test {
+
+using local::startProcess;
+using local::stopProcess;
+using local::waitUntil;
 
 namespace {
 

@@ -2,9 +2,11 @@
 // store's configuration opens sessions on it, the way a user's setup does.
 #pragma once
 
-#include "support/ApacheShare.h"
+#include "localshare/ApacheShare.h"
 
 namespace vtc::test {
+
+using local::ApacheShare;
 
 // Writes the share's server and locking keys (not the client identity) as
 // per-user preferences; port, when given, is that of a proxy in front of it.

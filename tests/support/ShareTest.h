@@ -9,13 +9,15 @@
 #include <string>
 
 #include "VantorSyncManager/NubiloRemoteSession.h"
-#include "support/ApacheShare.h"
+#include "localshare/ApacheShare.h"
 #include "support/FakeTime.h"
 #include "support/LogCapture.h"
 #include "support/TestHome.h"
 #include "support/TraceCapture.h"
 
 namespace vtc::test {
+
+using local::ApacheShare;
 
 class ShareTest : public ::testing::Test {
  protected:

@@ -10,7 +10,7 @@
 #include "platform/dav/TesselSession.h"
 #include "platform/prefs/PreferenceStore.h"
 #include "platform/secrets/CredentialStore.h"
-#include "support/ApacheShare.h"
+#include "localshare/ApacheShare.h"
 #include "support/FakeTime.h"
 #include "support/FaultProxy.h"
 #include "support/LogCapture.h"
@@ -30,7 +30,7 @@ class Maintenance : public ::testing::Test {
   vtc::test::LogCapture logged;
   vtc::test::FakeTime time;
   vtc::test::SessionBus bus;
-  vtc::test::ApacheShare share;
+  vtc::local::ApacheShare share;
   vtc::test::FaultProxy proxy{share.port()};
 
   void SetUp() override {

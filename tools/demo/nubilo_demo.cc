@@ -8,11 +8,11 @@
 #include "VantorSyncManager/VantorSyncManager.h"
 #include "common/Format.h"
 #include "platform/dav/TesselSession.h"
-#include "support/ApacheShare.h"
+#include "localshare/ApacheShare.h"
 
 namespace {
 
-std::unique_ptr<NubiloRemoteSession> openAs(vtc::test::ApacheShare& share, const char* guid,
+std::unique_ptr<NubiloRemoteSession> openAs(vtc::local::ApacheShare& share, const char* guid,
                                             const char* name) {
   vtc::Dictionary config = share.configuration();
   config.set("guid", vtc::Value(guid));
@@ -41,7 +41,7 @@ int main() {
     if (!mkdtemp(home)) return 1;
     ::setenv("HOME", home, 1);
 
-    vtc::test::ApacheShare share;
+    vtc::local::ApacheShare share;
     std::printf("WebDAV share http://127.0.0.1:%d/ (Apache pid %d, files in %s)\n\n",
                 share.port(), static_cast<int>(share.pid()), share.documentRoot().c_str());
 

@@ -8,7 +8,7 @@
 #include "VantorSyncManager/MemberAccount.h"
 #include "VantorSyncManager/PublicNames.h"
 #include "platform/dav/TesselSession.h"
-#include "support/ApacheShare.h"
+#include "localshare/ApacheShare.h"
 #include "support/TestHome.h"
 
 namespace {
@@ -18,7 +18,7 @@ const std::string kNs = "http://nubilo.example/ns/sync/";
 class DavLayer : public ::testing::Test {
  protected:
   vtc::test::TestHome home;
-  vtc::test::ApacheShare share;
+  vtc::local::ApacheShare share;
   const std::string base = "/Web/My Folder";  // a path that needs escaping
 
   std::unique_ptr<TesselSession> connect(const std::string& password = "wonderland", int port = 0) {
@@ -50,7 +50,7 @@ TEST_F(DavLayer, OutcomesMapToResultCodes) {
   EXPECT_EQ(refused.httpStatusCode(), 401);
   EXPECT_EQ(refused.transactionState(), 3);
 
-  DavTransaction down = connect("wonderland", vtc::test::freeLoopbackPort())->getDataAtPath("/x");
+  DavTransaction down = connect("wonderland", vtc::local::freeLoopbackPort())->getDataAtPath("/x");
   EXPECT_EQ(down.errorType(), kNBNetworkError);
   EXPECT_NE(down.transactionState(), 3);
   EXPECT_EQ(down.httpStatusCode(), vtc::kNoHTTPStatus);

@@ -1,4 +1,4 @@
-#include "support/ApacheShare.h"
+#include "localshare/ApacheShare.h"
 
 #include <openssl/evp.h>
 #include <pwd.h>
@@ -15,7 +15,7 @@
 #include <thread>
 #include <utility>
 
-namespace vtc::test {
+namespace vtc::local {
 
 namespace {
 
@@ -191,4 +191,4 @@ std::vector<AccessEntry> ApacheShare::accessEntries() const {
   return out;
 }
 
-}  // namespace vtc::test
+}  // namespace vtc::local

@@ -11,9 +11,9 @@
 #include <vector>
 
 #include "VantorSyncManager/Value.h"
-#include "support/Processes.h"
+#include "localshare/Processes.h"
 
-namespace vtc::test {
+namespace vtc::local {
 
 struct AccessEntry {
   int clientPort = 0;
@@ -76,4 +76,4 @@ class ApacheShare {
 // A TCP port on 127.0.0.1 that nothing listens on right now.
 int freeLoopbackPort();
 
-}  // namespace vtc::test
+}  // namespace vtc::local

@@ -1,4 +1,4 @@
-#include "support/Computer.h"
+#include "localshare/Computer.h"
 
 #include <fcntl.h>
 #include <sys/wait.h>
@@ -14,7 +14,7 @@
 
 extern char** environ;
 
-namespace vtc::test {
+namespace vtc::local {
 
 std::string clientProgram() {
   return VSM_CLIENT_PROGRAM;
@@ -152,4 +152,4 @@ std::string Computer::read(const std::string& path) {
   return s.str();
 }
 
-}  // namespace vtc::test
+}  // namespace vtc::local

@@ -8,7 +8,7 @@
 #include <string>
 #include <vector>
 
-namespace vtc::test {
+namespace vtc::local {
 
 // Starts argv[0] (looked up in PATH) with `input` on its standard input and
 // its output discarded; it dies with the test process.
@@ -23,4 +23,4 @@ int connectLoopback(int port);
 // A socket listening on a free port of 127.0.0.1; port receives the number.
 int listenLoopback(int& port);
 
-}  // namespace vtc::test
+}  // namespace vtc::local

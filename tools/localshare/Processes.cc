@@ -1,4 +1,4 @@
-#include "support/Processes.h"
+#include "localshare/Processes.h"
 
 #include <arpa/inet.h>
 #include <fcntl.h>
@@ -13,7 +13,7 @@
 #include <stdexcept>
 #include <thread>
 
-namespace vtc::test {
+namespace vtc::local {
 
 namespace {
 
@@ -86,4 +86,4 @@ int listenLoopback(int& port) {
   return fd;
 }
 
-}  // namespace vtc::test
+}  // namespace vtc::local

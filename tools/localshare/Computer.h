@@ -11,7 +11,7 @@
 
 #include "VantorSyncManager/Value.h"
 
-namespace vtc::test {
+namespace vtc::local {
 
 class Computer {
  public:
@@ -60,4 +60,4 @@ class Computer {
 // The path of the built nubilosyncclient.
 std::string clientProgram();
 
-}  // namespace vtc::test
+}  // namespace vtc::local
