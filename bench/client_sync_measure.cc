@@ -1,0 +1,123 @@
+// The sync client in the shape users meet it: two computers and a local
+// share, an address book of vCards of about 470 bytes, each phase timed as a
+// whole command and its requests counted in the server's access log. The
+// floor in the same run: curl fetching as many such files over one
+// keep-alive connection.
+//
+//   client_sync_measure [CARDS]     (default 1000)
+#include <chrono>
+#include <cstdio>
+#include <cstdlib>
+#include <filesystem>
+#include <fstream>
+#include <set>
+#include <string>
+
+#include "localshare/ApacheShare.h"
+#include "localshare/Computer.h"
+
+using vtc::local::ApacheShare;
+using vtc::local::Computer;
+
+namespace {
+
+// A card of about 470 bytes: FN, N, EMAIL, TEL, ADR, a folded NOTE and UID.
+std::string card(int i, int edit) {
+  const std::string n = std::to_string(i);
+  std::string note =
+      "Met at the conference in spring; prefers e-mail in the morning and calls after six. "
+      "Edit " +
+      std::to_string(edit) + ".";
+  std::string folded = "NOTE:" + note.substr(0, 70) + "\r\n " + note.substr(70);
+  return "BEGIN:VCARD\r\nVERSION:3.0\r\nUID:person-" + n + "@example.org\r\nFN:Person Number " + n +
+         "\r\nN:Number;Person;" + n + ";;\r\nEMAIL;TYPE=INTERNET,WORK:person." + n +
+         "@example.org\r\nTEL;TYPE=CELL:+1 555 01" + n + "\r\nADR;TYPE=HOME:;;" + n +
+         " Long Street;Springfield;ST;12345;Country\r\n" + folded + "\r\nEND:VCARD\r\n";
+}
+
+struct Phase {
+  const char* name;
+  double seconds = 0;
+  size_t requests = 0;
+  size_t writes = 0;
+};
+
+Phase timed(const char* name, ApacheShare& share, const Computer& c) {
+  const size_t before = share.accessEntries().size();
+  auto start = std::chrono::steady_clock::now();
+  Computer::Result r = c.run({"sync"});
+  Phase p{name};
+  p.seconds = std::chrono::duration<double>(std::chrono::steady_clock::now() - start).count();
+  if (r.status != 0) std::fprintf(stderr, "%s failed: %s\n", name, r.err.c_str());
+  const auto entries = share.accessEntries();
+  p.requests = entries.size() - before;
+  for (size_t i = before; i < entries.size(); ++i)
+    if (entries[i].method != "PROPFIND" && entries[i].method != "GET") ++p.writes;
+  return p;
+}
+
+}  // namespace
+
+int main(int argc, char** argv) {
+  const int cards = argc > 1 ? std::atoi(argv[1]) : 1000;
+  char tmpl[] = "/tmp/vsm-client-measure-XXXXXX";
+  const std::string home = ::mkdtemp(tmpl);
+  ::setenv("HOME", home.c_str(), 1);
+  ApacheShare share;
+  const std::string url = "http://127.0.0.1:" + std::to_string(share.port()) + "/sync";
+  Computer a("Mac A"), b("Mac B");
+  a.join(url, ApacheShare::kUser, ApacheShare::kPassword);
+  b.join(url, ApacheShare::kUser, ApacheShare::kPassword);
+  size_t bytes = 0;
+  for (int i = 0; i < cards; ++i) {
+    std::string c = card(i, 0);
+    bytes += c.size();
+    Computer::write(a.contacts() + "/person-" + std::to_string(i) + ".vcf", c);
+  }
+
+  std::vector<Phase> phases;
+  phases.push_back(timed("(a) A's first sync", share, a));
+  phases.push_back(timed("(b) B's first sync", share, b));
+  for (int i = 0; i < cards && i < 100; ++i)
+    Computer::write(a.contacts() + "/person-" + std::to_string(i) + ".vcf", card(i, 1));
+  phases.push_back(timed("(c) A sends 100 edits", share, a));
+  phases.push_back(timed("(d) B receives them", share, b));
+  phases.push_back(timed("(e) nothing changed", share, b));
+  if (Computer::files(a.contacts()) != Computer::files(b.contacts()))
+    std::fprintf(stderr, "the two folders differ!\n");
+
+  // The floor: the same files fetched by curl over one connection.
+  const std::string floorPath = share.diskPath("/floor");
+  std::filesystem::create_directories(floorPath);
+  std::ofstream config(home + "/curl.conf");
+  for (int i = 0; i < cards; ++i) {
+    std::filesystem::copy_file(a.contacts() + "/person-" + std::to_string(i) + ".vcf",
+                               floorPath + "/" + std::to_string(i) + ".vcf");
+    config << "url = \"http://127.0.0.1:" << share.port() << "/floor/" << i
+           << ".vcf\"\noutput = /dev/null\n";
+  }
+  config.close();
+  std::filesystem::permissions(floorPath, std::filesystem::perms::all,
+                               std::filesystem::perm_options::add);
+  for (auto& f : std::filesystem::directory_iterator(floorPath))
+    std::filesystem::permissions(f.path(), std::filesystem::perms::all,
+                                 std::filesystem::perm_options::add);
+  const std::string curl = "curl -sf -u " + std::string(ApacheShare::kUser) + ":" +
+                           ApacheShare::kPassword + " -K " + home + "/curl.conf";
+  double floor = 1e9;
+  for (int run = 0; run < 3; ++run) {
+    auto start = std::chrono::steady_clock::now();
+    if (std::system(curl.c_str()) != 0) std::fprintf(stderr, "curl failed\n");
+    floor = std::min(
+        floor, std::chrono::duration<double>(std::chrono::steady_clock::now() - start).count());
+  }
+
+  std::printf("%d cards, %zu bytes on average\n", cards, bytes / static_cast<size_t>(cards));
+  std::printf("%-24s %10s %9s %7s %9s\n", "phase", "seconds", "requests", "writes", "x floor");
+  for (const Phase& p : phases)
+    std::printf("%-24s %10.3f %9zu %7zu %9.2f\n", p.name, p.seconds, p.requests, p.writes,
+                p.seconds / floor);
+  std::printf("%-24s %10.3f %9d\n", "floor: curl GETs", floor, cards);
+  std::filesystem::remove_all(home);
+  return 0;
+}
