@@ -58,8 +58,8 @@ class Configuration : public ::testing::Test {
     PreferenceStore::shared().setValue(key, std::move(v), kVantorDefaultsKey, Scope::CurrentHost);
   }
   // Serves a configuration signed with the given private key.
-  void serve(const vtc::Dictionary& entries, const vtc::Bytes& privateKey) {
-    std::string xml = vtc::plist::toXml(vtc::Value(entries));
+  void serve(const vtc::Value& entries, const vtc::Bytes& privateKey) {
+    std::string xml = vtc::plist::toXml(entries);
     vtc::Bytes doc(xml.begin(), xml.end());
     auto signature = NubiloSignatureWithKey(doc, privateKey.data(), privateKey.size());
     ASSERT_TRUE(signature);
@@ -151,6 +151,20 @@ TEST_F(Configuration, WithSyncingOffABadSignatureOrAFailedDownloadTheOtherLayers
   EXPECT_NE(log.find("|Error|Failed to validate signature on config file", failed),
             std::string::npos);
   EXPECT_FALSE(prefs.configTTLDate());  // a failed download does not move it
+}
+
+// The signature verifies, so nothing is said about it; the payload adds no
+// keys, and the layers below serve.
+TEST_F(Configuration, AVerifiedPayloadThatIsNoDictionaryIsNoBadSignature) {
+  prefs.setSyncTurnedOn(true);
+  serve(vtc::Value(vtc::Array{vtc::Value("host_name"), vtc::Value("evil.example.org")}),
+        keys.privateKey);
+  vtc::Dictionary c = prefs.defaultConfiguration();
+  EXPECT_EQ(downloads(), 1u);
+  EXPECT_EQ(c.get("host_name").string(), "sync.nubilo.example");
+  EXPECT_EQ(c.get("guid").string(), "GUID-1");
+  EXPECT_FALSE(logHas("Failed to validate signature")) << logText();
+  EXPECT_FALSE(logHas("|Error|")) << logText();
 }
 
 TEST(ConfigurationDefaults, TheListEndsAtTheFirstAbsentValue) {
