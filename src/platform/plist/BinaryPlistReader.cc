@@ -16,6 +16,9 @@ using namespace binary;
 // The clock counts nanoseconds in 64 bits, about 290 years either side of
 // 1970; dates further out (a "distant future") are held at this bound.
 constexpr double kMaxDateSeconds = 8e9;
+// Containers are grown as their values are read, room for this many made at
+// once: a hostile count is charged, but not allocated before it is read.
+constexpr uint64_t kReserveAhead = 4096;
 
 void appendUtf8(std::string& out, uint32_t c) {
   if (c < 0x80) {
@@ -65,8 +68,7 @@ class Reader {
   bool readTop(uint64_t top, Value& out) { return charge(1) && read(top, 0, out); }
 
  private:
-  // Reads object ref at depth into out. Its references were charged, and
-  // checked not to lead back to it or to any object above it, by its parent.
+  // Reads object ref at depth into out; its parent charged the reference.
   bool read(uint64_t ref, unsigned depth, Value& out) {
     size_t at;
     if (!objectAt(ref, at)) return false;
@@ -127,22 +129,21 @@ class Reader {
       case kSet: {
         uint64_t count;
         if (!lengthAt(at, low, count) || count > (tableAt_ - at) / refWidth_ ||
-            !enter(ref, at, count, depth) || !charge(count))
+            !enter(ref, count, depth) || !charge(count))
           return false;
         Array& array = out.mutableArray();
-        array.resize(count);
+        array.reserve(std::min(count, kReserveAhead));
         for (uint64_t i = 0; i < count; ++i)
-          if (!read(refAt(at, i), depth + 1, array[i])) return false;
+          if (!read(refAt(at, i), depth + 1, array.emplace_back())) return false;
         return true;
       }
       case kDictionary: {
         uint64_t count;
-        // Keys are strings, which hold no references: only values can lead back.
         if (!lengthAt(at, low, count) || count > (tableAt_ - at) / refWidth_ / 2 ||
-            !enter(ref, at + count * refWidth_, count, depth) || !charge(2 * count))
+            !enter(ref, count, depth) || !charge(2 * count))
           return false;
         Dictionary& dictionary = out.mutableDictionary();
-        dictionary.reserve(count);
+        dictionary.reserve(std::min(count, kReserveAhead));
         for (uint64_t i = 0; i < count; ++i) {
           std::string_view key;
           if (!keyAt(refAt(at, i), key)) return false;
@@ -168,17 +169,14 @@ class Reader {
     return true;
   }
 
-  // Puts container ref on the path at depth, after checking that none of the
-  // count references at `at` leads back to it or to a container above it: a
-  // cycle is refused before anything of it is built.
-  bool enter(uint64_t ref, size_t at, uint64_t count, unsigned depth) {
-    if (depth >= kMaxDepth && count > 0) return false;  // its children would be too deep
+  // Puts container ref, holding count references, on the path at depth. One
+  // already on the path above has led back to itself: the cycle is refused
+  // where it first closes, before any more is built.
+  bool enter(uint64_t ref, uint64_t count, unsigned depth) {
+    if (depth >= kMaxDepth && count > 0) return false;  // its values would be too deep
+    for (unsigned k = 0; k < depth; ++k)
+      if (path_[k] == ref) return false;
     path_[depth] = ref;
-    for (uint64_t i = 0; i < count; ++i) {
-      const uint64_t child = refAt(at, i);
-      for (unsigned k = 0; k <= depth; ++k)
-        if (path_[k] == child) return false;
-    }
     return true;
   }
 
