@@ -79,7 +79,8 @@ void NubiloChangeLog::parseData(vtc::ByteView data) {
       vtc::clog::BodyStream body(
           data.subspan(bodyStart),
           [this](const uint8_t* b, const uint8_t* e) { inputConsumed(b, e); });
-      changes.reserve(std::min<size_t>(count, data.size()));
+      // Room is made as records are read: the count is the file's claim.
+      changes.reserve(std::min<size_t>(count, 4096));
       for (uint32_t i = 0; i < count; ++i) {
         std::string identifier = body.readCString();
         uint32_t type = body.readUInt32();
