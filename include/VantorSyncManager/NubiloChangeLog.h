@@ -1,8 +1,8 @@
 // A changelog: one numbered file of changes of one dataclass. A binary
 // index, text headers, and a compressed body of change records; every
 // integer unsigned 32-bit big-endian. Reading failures raise
-// NubiloCorruptChangelogException; writing has no failure of its own.
-// Not thread-safe.
+// NubiloCorruptChangelogException; writing refuses, with
+// std::invalid_argument, what every reader would refuse. Not thread-safe.
 #pragma once
 
 #include <cstdint>
@@ -20,7 +20,8 @@ class VSM_EXPORT NubiloChangeLog {
   // A NubiloChangeLog below the threshold, a NubiloMappedChangelog from it on.
   static std::unique_ptr<NubiloChangeLog> createChangeLogWithData(vtc::ByteView data,
                                                                   size_t threshold);
-  // The file read whole and decoded; raises when it cannot be read or decoded.
+  // The file read whole and decoded: raises when it cannot be decoded; one
+  // that cannot be read gives an empty changelog, as no bytes do.
   static std::unique_ptr<NubiloChangeLog> changeLogWithContentsOfFile(const std::string& path);
 
   NubiloChangeLog() = default;
@@ -30,7 +31,9 @@ class VSM_EXPORT NubiloChangeLog {
   explicit NubiloChangeLog(std::vector<SyncEngineChange> changes);
   virtual ~NubiloChangeLog();
 
-  // The reader and the writer.
+  // The reader: on failure the changelog is unchanged. The writer: changes
+  // nested deeper than readers read, or a record identifier or header line
+  // holding a zero byte, raise std::invalid_argument with output untouched.
   void parseData(vtc::ByteView data);
   virtual void writeToData(vtc::Bytes& output);
 

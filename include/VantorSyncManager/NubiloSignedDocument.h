@@ -6,10 +6,30 @@
 
 #include <cstddef>
 #include <cstdint>
+#include <memory>
 #include <optional>
 
 #include "VantorSyncManager/Export.h"
 #include "VantorSyncManager/Value.h"
+
+struct evp_pkey_st;  // the key type of the signature library
+
+namespace vtc {
+
+enum class KeyClass { Public, Private };
+
+struct VSM_EXPORT KeyFree {
+  void operator()(evp_pkey_st* key) const;
+};
+// An RSA key held in memory only.
+using Key = std::unique_ptr<evp_pkey_st, KeyFree>;
+
+}  // namespace vtc
+
+// Imports an RSA key of the given class from its DER bytes (a public key as an
+// X.509 SubjectPublicKeyInfo, a private one as PKCS#1 or PKCS#8) into key.
+// Whether a key was made; key is empty when not.
+VSM_EXPORT bool keyWithBytes(vtc::ByteView bytes, vtc::Key& key, vtc::KeyClass keyClass);
 
 // Appends the marker and the signature to the payload.
 VSM_EXPORT void NubiloAppendSignature(vtc::Bytes& payload, vtc::ByteView signature);

@@ -5,6 +5,8 @@
 #include <cstdint>
 #include <string>
 
+#include "VantorSyncManager/NubiloException.h"
+#include "VantorSyncManager/PublicNames.h"
 #include "VantorSyncManager/Value.h"
 
 namespace vtc::clog {
@@ -13,8 +15,13 @@ inline constexpr uint32_t kFormatNumber = 101;
 inline constexpr uint32_t kIndexEnd = 0xFFFFFFFF;
 inline constexpr const char* kHeaderEnd = "HeaderEnd=$%__END__OF__HEADER%$";
 inline constexpr const char* kClientType = "Vantor Client";
-// The version of the embedded sync engine that writes changes.
-inline constexpr const char* kEngineVersion = "1.0";
+
+// A changelog that cannot be decoded.
+[[noreturn]] inline void corrupt(const std::string& reason) {
+  throw NubiloException(NubiloCorruptChangelogException, reason);
+}
+// The failure of a read of four bytes at offset in data of length bytes.
+[[noreturn]] void beyondBounds(uint64_t length, uint64_t offset);
 
 // 64-bit FNV-1a of the bytes: the same in every process and release, so a
 // crash flag written by one process is found by the next.

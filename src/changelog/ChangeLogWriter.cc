@@ -1,5 +1,8 @@
 // The changelog writer: index, headers, then the compressed body.
 #include <ctime>
+#include <stdexcept>
+#include <string>
+#include <vector>
 
 #include "VantorSyncManager/NubiloChangeLog.h"
 #include "VantorSyncManager/NubiloDataAdditions.h"
@@ -26,38 +29,55 @@ void putUInt32At(vtc::Bytes& out, size_t offset, uint32_t v) {
   out[offset + 3] = static_cast<uint8_t>(v);
 }
 
+// Text written zero-terminated: a zero inside it would end it early for every
+// reader, so it is refused.
+const std::string& textWithoutZero(const std::string& text, const char* what) {
+  if (text.find('\0') != std::string::npos)
+    throw std::invalid_argument(std::string("Cannot write a changelog ") + what +
+                                " holding a zero byte: readers would cut it there");
+  return text;
+}
+
 }  // namespace
 
 void NubiloChangeLog::writeToData(vtc::Bytes& output) {
+  // The body and the header lines are made first: what every reader would
+  // refuse is refused here, before output is touched.
   const size_t n = _changes.size();
-  const size_t indexSize = 12 + 4 * n;
-  output.assign(indexSize, 0);
-  // The index is written in place: format number, header offset, one entry
-  // per record, then the end marker.
-  putUInt32At(output, 0, vtc::clog::kFormatNumber);
-  putUInt32At(output, 4, static_cast<uint32_t>(indexSize));
-
-  // Set directly: a mapped changelog refuses header changes from callers.
-  if (!_headers) _headers = vtc::Dictionary{};
-  _headers->set("CreationTimestamp", vtc::Value(creationTimestamp()));
-  for (const auto& [key, value] : *_headers)
-    NubiloAppendString(output, vtc::format("%@=%@", key, value));
-  NubiloAppendString(output, vtc::clog::kHeaderEnd);
-  const size_t bodyStart = output.size();
-
   vtc::Bytes body;
+  std::vector<size_t> recordAt(n);
   vtc::plist::BinaryPlistWriter archiver;
   for (size_t i = 0; i < n; ++i) {
     const SyncEngineChange& change = _changes[i];
-    putUInt32At(output, 8 + 4 * i, static_cast<uint32_t>(bodyStart + body.size()));
-    NubiloAppendString(body, change.recordIdentifier());
+    recordAt[i] = body.size();
+    NubiloAppendString(body, textWithoutZero(change.recordIdentifier(), "record identifier"));
     NubiloAppendUInt32(body, change.type());
     // The archive goes straight into the body; its length is filled in after.
     const size_t lengthAt = body.size();
     NubiloAppendUInt32(body, 0);
-    archiver.append(change.changes(), body);
+    archiver.append(change.changes(), body);  // refuses nesting readers refuse
     putUInt32At(body, lengthAt, static_cast<uint32_t>(body.size() - lengthAt - 4));
   }
+
+  // Set directly: a mapped changelog refuses header changes from callers.
+  if (!_headers) _headers = vtc::Dictionary{};
+  _headers->set("CreationTimestamp", vtc::Value(creationTimestamp()));
+  std::vector<std::string> lines;
+  lines.reserve(_headers->size());
+  for (const auto& [key, value] : *_headers)
+    lines.push_back(textWithoutZero(vtc::format("%@=%@", key, value), "header"));
+
+  // The index is written in place: format number, header offset, one entry
+  // per record, then the end marker.
+  const size_t indexSize = 12 + 4 * n;
+  output.assign(indexSize, 0);
+  putUInt32At(output, 0, vtc::clog::kFormatNumber);
+  putUInt32At(output, 4, static_cast<uint32_t>(indexSize));
+  for (const std::string& line : lines) NubiloAppendString(output, line);
+  NubiloAppendString(output, vtc::clog::kHeaderEnd);
+  const size_t bodyStart = output.size();
+  for (size_t i = 0; i < n; ++i)
+    putUInt32At(output, 8 + 4 * i, static_cast<uint32_t>(bodyStart + recordAt[i]));
   putUInt32At(output, 8 + 4 * n, vtc::clog::kIndexEnd);
   if (std::optional<vtc::Bytes> zipped = NubiloGzip(body))
     output.insert(output.end(), zipped->begin(), zipped->end());

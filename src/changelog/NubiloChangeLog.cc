@@ -5,11 +5,10 @@
 #include <fstream>
 #include <iterator>
 
-#include "VantorSyncManager/NubiloException.h"
-#include "VantorSyncManager/PublicNames.h"
 #include "VantorSyncManager/VTCPrefsCenter.h"
 #include "changelog/ChangeLogFormat.h"
 #include "common/Format.h"
+#include "platform/engine/SyncEngine.h"
 
 std::unique_ptr<NubiloChangeLog> NubiloChangeLog::createChangeLogWithData(vtc::ByteView data,
                                                                           size_t threshold) {
@@ -19,10 +18,11 @@ std::unique_ptr<NubiloChangeLog> NubiloChangeLog::createChangeLogWithData(vtc::B
 
 std::unique_ptr<NubiloChangeLog> NubiloChangeLog::changeLogWithContentsOfFile(
     const std::string& path) {
+  // A file that cannot be read gives no bytes, and no bytes an empty
+  // changelog (with the reader's Error line), not a failure.
   std::ifstream in(path, std::ios::binary);
-  if (!in)
-    throw NubiloException(NubiloCorruptChangelogException, "Cannot read changelog file " + path);
-  vtc::Bytes bytes((std::istreambuf_iterator<char>(in)), std::istreambuf_iterator<char>());
+  vtc::Bytes bytes;
+  if (in) bytes.assign(std::istreambuf_iterator<char>(in), std::istreambuf_iterator<char>());
   return std::make_unique<NubiloChangeLog>(bytes);
 }
 
@@ -33,7 +33,7 @@ NubiloChangeLog::NubiloChangeLog(vtc::ByteView data) {
 NubiloChangeLog::NubiloChangeLog(std::vector<SyncEngineChange> changes)
     : _changes(std::move(changes)), _headers(vtc::Dictionary{}) {
   _headers->set("OSVersion", vtc::Value(VTCPrefsCenter::defaultCenter().systemVersion()));
-  _headers->set("CreatorEngineVersion", vtc::Value(vtc::clog::kEngineVersion));
+  _headers->set("CreatorEngineVersion", vtc::Value(vtc::engine::SyncEngine::bundleVersion()));
   _headers->set("CreatorClientType", vtc::Value(vtc::clog::kClientType));
 }
 

@@ -5,9 +5,9 @@
 #include <algorithm>
 #include <iterator>
 
-#include "VantorSyncManager/NubiloException.h"
-#include "VantorSyncManager/PublicNames.h"
+#include "changelog/ChangeLogFormat.h"
 #include "common/Format.h"
+#include "common/Utf8.h"
 #include "platform/plist/PlistCodec.h"
 
 namespace {
@@ -31,28 +31,22 @@ bool isControlCharacter(char32_t c) {
 // The code point starting at s[i] and its length in bytes; a malformed
 // sequence is one byte long and never a control character.
 std::pair<char32_t, size_t> decode(std::string_view s, size_t i) {
-  auto b = [&](size_t k) { return static_cast<unsigned char>(s[i + k]); };
-  unsigned char c = b(0);
-  size_t len = c < 0x80 ? 1 : (c >> 5) == 0x6 ? 2 : (c >> 4) == 0xE ? 3 : (c >> 3) == 0x1E ? 4 : 0;
-  if (len == 0 || i + len > s.size()) return {0xFFFD, 1};
-  if (len == 1) return {c, 1};
-  char32_t cp = c & (0x7F >> len);
-  for (size_t k = 1; k < len; ++k) {
-    if ((b(k) & 0xC0) != 0x80) return {0xFFFD, 1};
-    cp = (cp << 6) | (b(k) & 0x3F);
-  }
-  return {cp, len};
+  const auto* p = reinterpret_cast<const uint8_t*>(s.data());
+  char32_t cp;
+  const size_t length = vtc::utf8::decode(p + i, p + s.size(), cp);
+  if (length == 0) return {0xFFFD, 1};
+  return {cp, length};
 }
 
 }  // namespace
 
+void vtc::clog::beyondBounds(uint64_t length, uint64_t offset) {
+  corrupt(format("Attempting to parse value beyond bounds of changelog data length:%d offset:%d",
+                 length, offset));
+}
+
 uint32_t NubiloUInt32AtOffset(vtc::ByteView data, uint32_t offset) {
-  if (data.size() < static_cast<uint64_t>(offset) + 4) {
-    throw NubiloException(
-        NubiloCorruptChangelogException,
-        vtc::format("Attempting to parse value beyond bounds of changelog data length:%d offset:%d",
-                    data.size(), offset));
-  }
+  if (data.size() < static_cast<uint64_t>(offset) + 4) vtc::clog::beyondBounds(data.size(), offset);
   const uint8_t* p = data.data() + offset;
   return (uint32_t{p[0]} << 24) | (uint32_t{p[1]} << 16) | (uint32_t{p[2]} << 8) | p[3];
 }

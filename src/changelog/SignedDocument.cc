@@ -15,15 +15,12 @@ namespace {
 constexpr std::string_view kMarker = "----BEGIN RSA SIGNATURE----\n";
 constexpr size_t kMinimumPayload = 29;
 
-enum class KeyClass { Public, Private };
+using vtc::Key;
+using vtc::KeyClass;
 
-struct KeyFree {
-  void operator()(EVP_PKEY* k) const { EVP_PKEY_free(k); }
-};
 struct ContextFree {
   void operator()(EVP_MD_CTX* c) const { EVP_MD_CTX_free(c); }
 };
-using Key = std::unique_ptr<EVP_PKEY, KeyFree>;
 using Context = std::unique_ptr<EVP_MD_CTX, ContextFree>;
 
 std::string openSslError() {
@@ -35,7 +32,10 @@ std::string openSslError() {
 
 }  // namespace
 
-// Imports an RSA key from DER bytes, held in memory only.
+void vtc::KeyFree::operator()(evp_pkey_st* key) const {
+  EVP_PKEY_free(key);
+}
+
 bool keyWithBytes(vtc::ByteView bytes, Key& key, KeyClass keyClass) {
   const unsigned char* p = bytes.data();
   const long length = static_cast<long>(bytes.size());

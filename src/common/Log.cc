@@ -17,6 +17,7 @@
 
 #include "common/Clock.h"
 #include "common/Logging.h"
+#include "common/Utf8.h"
 #include "platform/fs/LocalPaths.h"
 #include "platform/prefs/PreferenceFiles.h"
 #include "platform/workspace/ApplicationLookup.h"
@@ -73,21 +74,14 @@ void rollIfLarge() {
 // with '?', in place.
 void sanitizeUtf8(char* s, size_t n) {
   auto* p = reinterpret_cast<unsigned char*>(s);
-  size_t i = 0;
-  while (i < n) {
-    unsigned char c = p[i];
-    size_t len = c < 0x80           ? 1
-                 : (c >> 5) == 0x6  ? 2
-                 : (c >> 4) == 0xE  ? 3
-                 : (c >> 3) == 0x1E ? 4
-                                    : 0;
-    bool ok = len > 0 && i + len <= n && !(len == 2 && c < 0xC2);
-    for (size_t k = 1; ok && k < len; ++k) ok = (p[i + k] & 0xC0) == 0x80;
-    if (!ok) {
+  char32_t ignored;
+  for (size_t i = 0; i < n;) {
+    const size_t length = vtc::utf8::decode(p + i, p + n, ignored);
+    if (length == 0) {
       p[i++] = '?';
       continue;
     }
-    i += len;
+    i += length;
   }
 }
 
@@ -187,30 +181,30 @@ void writeLine(const char* file, int line, const char* function, int level,
   }
   std::string stamp = timestamp();
   unsigned thread = static_cast<unsigned>(static_cast<uint64_t>(pthread_self()) & 0xFFFFFFFFu);
-  char head[512];
-  int headLen;
-  if (currentLogLevel == 3) {
-    headLen = std::snprintf(head, sizeof head, "%s|%s:%i %s|%x|%s|", stamp.c_str(),
-                            lastPathComponent(file), line, function ? function : "", thread,
-                            levelWord(level));
-  } else {
-    headLen =
-        std::snprintf(head, sizeof head, "%s|%x|%s|", stamp.c_str(), thread, levelWord(level));
-  }
-  if (headLen < 0) return;
-  size_t h = std::min(static_cast<size_t>(headLen), sizeof head - 1);
-  size_t total = h + message.size() + 1;
-
-  // Short lines are assembled on the stack, longer ones on the heap.
+  // A line of up to 256 bytes is assembled on the stack; a longer one, its
+  // head formatted again if that alone did not fit, on the heap. Nothing is cut.
+  auto formatHead = [&](char* buf, size_t size) {
+    if (currentLogLevel == 3)
+      return std::snprintf(buf, size, "%s|%s:%i %s|%x|%s|", stamp.c_str(), lastPathComponent(file),
+                           line, function ? function : "", thread, levelWord(level));
+    return std::snprintf(buf, size, "%s|%x|%s|", stamp.c_str(), thread, levelWord(level));
+  };
   char small[256];
-  std::vector<char> large;
+  const int headLength = formatHead(small, sizeof small);
+  if (headLength < 0) return;
+  const auto head = static_cast<size_t>(headLength);
+  const size_t total = head + message.size() + 1;
   char* buf = small;
+  std::vector<char> large;
   if (total > sizeof small) {
-    large.resize(total);
+    large.resize(total + 1);  // and snprintf's terminating zero
     buf = large.data();
+    if (head < sizeof small)
+      std::memcpy(buf, small, head);
+    else
+      formatHead(buf, large.size());
   }
-  std::memcpy(buf, head, h);
-  std::memcpy(buf + h, message.data(), message.size());
+  std::memcpy(buf + head, message.data(), message.size());
   buf[total - 1] = '\n';
   sanitizeUtf8(buf, total);
   if (logFile >= 0) {

@@ -27,8 +27,9 @@ Dictionary builtInDefaults(const std::optional<std::string>& clientGuid,
 std::string configurationURL(const std::string& host, const std::optional<std::string>& version,
                              const std::optional<std::string>& build);
 
-// The signed document's payload parsed as a dictionary, when its signature
-// verifies with the built-in key.
+// The signed document's payload parsed as a dictionary when its signature
+// verifies with the built-in key (empty when the payload is no dictionary);
+// nothing when the signature is missing or does not verify.
 std::optional<Dictionary> verifiedConfiguration(const Bytes& signedDocument);
 
 // Verifies with this DER public key instead of the built-in one; nothing

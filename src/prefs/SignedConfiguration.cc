@@ -29,8 +29,11 @@ std::optional<Dictionary> verifiedConfiguration(const Bytes& signedDocument) {
     if (gKeyOverride) key = *gKeyOverride;
   }
   if (!NubiloVerifySignature(payload, *signature, key.data(), key.size())) return std::nullopt;
+  // A verified payload that is no dictionary has no entries to add. Its
+  // signature is good, so it is not reported as a bad one; the layers below
+  // serve, as the configuration's rules have it, without a message.
   std::optional<Value> parsed = NubiloDictionaryWithData(payload);
-  if (!parsed || !parsed->isDictionary()) return std::nullopt;
+  if (!parsed || !parsed->isDictionary()) return Dictionary{};
   return parsed->dictionary();
 }
 

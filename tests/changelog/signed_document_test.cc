@@ -66,4 +66,20 @@ TEST(SignedDocument, SignsAndVerifiesAndRefusesAnyChange) {
   EXPECT_FALSE(NubiloSignatureWithKey(payload, payload.data(), payload.size()));
 }
 
+TEST(SignedDocument, KeysAreImportedByClassFromTheirBytes) {
+  vtc::test::KeyPair keys(512);
+  vtc::Key key;
+  EXPECT_TRUE(keyWithBytes(keys.publicKey, key, vtc::KeyClass::Public));
+  EXPECT_EQ(EVP_PKEY_get_bits(key.get()), 512);
+  vtc::test::KeyPair other(1024);
+  EXPECT_TRUE(keyWithBytes(other.privateKey, key, vtc::KeyClass::Private));
+  EXPECT_EQ(EVP_PKEY_get_bits(key.get()), 1024);
+  // Bytes of the other class, or no key at all, make no key and clear it.
+  EXPECT_FALSE(keyWithBytes(keys.publicKey, key, vtc::KeyClass::Private));
+  EXPECT_EQ(key, nullptr);
+  EXPECT_FALSE(keyWithBytes(keys.privateKey, key, vtc::KeyClass::Public));
+  EXPECT_FALSE(keyWithBytes(text("not a key"), key, vtc::KeyClass::Public));
+  EXPECT_FALSE(keyWithBytes(Bytes{}, key, vtc::KeyClass::Public));
+}
+
 }  // namespace

@@ -6,6 +6,7 @@
 
 #include <filesystem>
 #include <fstream>
+#include <set>
 
 #include "common/Logging.h"
 #include "platform/fs/LocalPaths.h"
@@ -131,6 +132,77 @@ TEST_F(Log, TheCEntryPointTakesCStringsAndLongLinesStayWhole) {
   ASSERT_EQ(l.size(), 2u);
   EXPECT_EQ(tail(l[0], 2), "Info|text and 5: " + big);
   EXPECT_EQ(tail(l[1], 2), "Warning|(null)");
+}
+
+TEST_F(Log, LongHeadsStayWholeAndInvalidUtf8BecomesQuestionMarks) {
+  setPreference("LoggingLevel", vtc::Value("debug"));
+  // A function name that carries the head past 511 bytes, with two-byte
+  // characters all the way, so that any cut would split one.
+  std::string function = "-[Caller ";
+  while (function.size() < 600) function += "\xC3\xA9";
+  function += "]";
+  _VTCLog("/src/a/Caller.m", 7, function.c_str(), 0, "%@", "the message");
+  auto l = lines();
+  ASSERT_EQ(l.size(), 1u);
+  EXPECT_NE(l[0].find("|Caller.m:7 " + function + "|"), std::string::npos) << l[0];
+  EXPECT_EQ(tail(l[0], 3), "Error|the message");
+
+  // Overlong forms, surrogates, lead bytes past U+10FFFF and stray or cut
+  // sequences each become "?", byte by byte; well-formed text is kept.
+  const std::pair<std::string, std::string> cases[] = {
+      {"\xC0\xAF", "??"},
+      {"\xE0\x80\xAF", "???"},
+      {"\xF0\x80\x80\xAF", "????"},
+      {"\xED\xA0\x80", "???"},
+      {"\xED\xBF\xBF", "???"},
+      {"\xF4\x90\x80\x80", "????"},
+      {"\xF5\x80\x80\x80", "????"},
+      {"\xF7\xBF\xBF\xBF", "????"},
+      {"\x80x\xC3", "?x?"},
+      {"\xC3\xA9\xE2\x82\xAC\xED\x9F\xBF\xF0\x9F\x98\x80\xF4\x8F\xBF\xBF",
+       "\xC3\xA9\xE2\x82\xAC\xED\x9F\xBF\xF0\x9F\x98\x80\xF4\x8F\xBF\xBF"},
+  };
+  vtc::log::resetForTesting();
+  std::filesystem::remove(vtc::log::logFilePath());
+  for (const auto& [bytes, shown] : cases) VTC_LOG_ERROR("[%@]", bytes);
+  l = lines();
+  ASSERT_EQ(l.size(), std::size(cases));
+  for (size_t i = 0; i < l.size(); ++i)
+    EXPECT_EQ(tail(l[i], 3), "Error|[" + cases[i].second + "]") << i;
+}
+
+// With no folder to hold the log, lines are dropped for the rest of the
+// process: nothing raised, nothing written anywhere else. The next process
+// finds the folder again.
+TEST_F(Log, AnUncreatableFolderDropsLinesSilently) {
+  const std::string path = vtc::log::logFilePath();
+  const std::string logs = path.substr(0, path.find("/Sync/"));
+  std::filesystem::create_directories(std::filesystem::path(logs).parent_path());
+  std::ofstream(logs) << "a file where the folder should be";
+  auto everything = [&] {
+    std::set<std::string> all;
+    for (const auto& e : std::filesystem::recursive_directory_iterator(home.path()))
+      all.insert(e.path().string());
+    return all;
+  };
+  const auto before = everything();
+  testing::internal::CaptureStderr();
+  testing::internal::CaptureStdout();
+  VTC_LOG_ERROR("dropped");
+  _VTCLog("/src/a/Caller.m", 1, "f", 0, "%@", "dropped too");
+  EXPECT_EQ(testing::internal::GetCapturedStdout(), "");
+  EXPECT_EQ(testing::internal::GetCapturedStderr(), "");
+  EXPECT_EQ(everything(), before);
+
+  std::filesystem::remove(logs);
+  VTC_LOG_ERROR("still dropped: the open is not retried in this process");
+  EXPECT_FALSE(std::filesystem::exists(path));
+
+  vtc::log::resetForTesting();  // as in the next process
+  VTC_LOG_ERROR("written");
+  auto l = lines();
+  ASSERT_EQ(l.size(), 1u);
+  EXPECT_EQ(tail(l[0], 2), "Error|written");
 }
 
 }  // namespace

@@ -57,8 +57,8 @@ class Configuration : public ::testing::Test {
     PreferenceStore::shared().setValue(key, std::move(v), kVantorDefaultsKey, Scope::CurrentHost);
   }
   // Serves a configuration signed with the given private key.
-  void serve(const vtc::Dictionary& entries, const vtc::Bytes& privateKey) {
-    std::string xml = vtc::plist::toXml(vtc::Value(entries));
+  void serve(const vtc::Value& entries, const vtc::Bytes& privateKey) {
+    std::string xml = vtc::plist::toXml(entries);
     vtc::Bytes doc(xml.begin(), xml.end());
     auto signature = NubiloSignatureWithKey(doc, privateKey.data(), privateKey.size());
     ASSERT_TRUE(signature);
@@ -163,6 +163,19 @@ TEST_F(Configuration, AShareWithoutAConfigurationServerIsNeitherAskedNorComplain
   perUser("host_name", vtc::Value("dav.example.org"));
   EXPECT_EQ(prefs.defaultConfiguration().get("host_name").string(), "dav.example.org");
   EXPECT_TRUE(share.accessEntries().empty());
+  EXPECT_TRUE(logged.messages("Error").empty());
+}
+
+// The signature verifies, so nothing is said about it; the payload adds no
+// keys, and the layers below serve.
+TEST_F(Configuration, AVerifiedPayloadThatIsNoDictionaryIsNoBadSignature) {
+  prefs.setSyncTurnedOn(true);
+  serve(vtc::Value(vtc::Array{vtc::Value("host_name"), vtc::Value("evil.example.org")}),
+        keys.privateKey);
+  vtc::Dictionary c = prefs.defaultConfiguration();
+  EXPECT_EQ(downloads(), 1u);
+  EXPECT_EQ(c.get("host_name").string(), "sync.nubilo.example");
+  EXPECT_EQ(c.get("guid").string(), "GUID-1");
   EXPECT_TRUE(logged.messages("Error").empty());
 }
 

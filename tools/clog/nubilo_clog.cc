@@ -1,6 +1,7 @@
 // nubilo-clog: looks inside changelog files.
 //   nubilo-clog dump FILE     the text dump, with its summary line
 //   nubilo-clog verify FILE   exit 0 for a readable changelog, 1 and the reason otherwise
+#include <cerrno>
 #include <cstdio>
 #include <cstring>
 #include <exception>
@@ -11,6 +12,14 @@ int main(int argc, char** argv) {
   if (argc != 3 || (std::strcmp(argv[1], "dump") != 0 && std::strcmp(argv[1], "verify") != 0)) {
     std::fprintf(stderr, "usage: nubilo-clog dump FILE\n       nubilo-clog verify FILE\n");
     return 2;
+  }
+  // The library reads an unreadable file as an empty changelog; here it is
+  // worth saying so.
+  if (std::FILE* f = std::fopen(argv[2], "rb")) {
+    std::fclose(f);
+  } else {
+    std::fprintf(stderr, "%s: %s\n", argv[2], std::strerror(errno));
+    return 1;
   }
   try {
     auto log = NubiloChangeLog::changeLogWithContentsOfFile(argv[2]);

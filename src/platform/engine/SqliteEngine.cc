@@ -55,6 +55,10 @@ Value decode(const Bytes& bytes) {
   return plist::parse(bytes).value_or(Value());
 }
 
+std::string SyncEngine::bundleVersion() {
+  return kEngineVersion;
+}
+
 std::unique_ptr<SyncEngine> SyncEngine::open() {
   std::string folder = VTCPrefsCenter::applicationSupportDirectory().value_or(
       paths::join(paths::applicationSupportDirectory(), "NubiloSyncClient"));
@@ -107,7 +111,7 @@ void SqliteEngine::migrate() {
 }
 
 std::string SqliteEngine::version() {
-  return kEngineVersion;
+  return bundleVersion();
 }
 
 void SqliteEngine::registerClient(const std::string& client, const Dictionary& description) {

@@ -83,6 +83,10 @@ class SyncEngine {
   static std::unique_ptr<SyncEngine> openInMemoryCopy();
   virtual ~SyncEngine() = default;
 
+  // The version of this engine, the one source of the version that writers
+  // of changes name ("CreatorEngineVersion"); known without opening a
+  // database.
+  static std::string bundleVersion();
   virtual std::string version() = 0;
 
   // Client records: registered with a description, with settings by key.

@@ -34,6 +34,19 @@ inline constexpr uint8_t kDoubleMarker = 0x23;
 // A low nibble of 0xF means the length follows as an integer object.
 inline constexpr uint8_t kLengthFollows = 0xF;
 
+// The deepest nesting a document may have, its top object at depth 0. The
+// writer refuses deeper values, so that what one computer writes every
+// other one reads.
+inline constexpr unsigned kMaxDepth = 128;
+
+// What reading a document may build, in proportion to its size: one value per
+// reference (each reference takes at least a byte), and this many bytes of
+// text per byte. A string read from n bytes costs up to 3n (bytes past ASCII
+// become U+FFFD), so the writer shares only strings short enough that each
+// extra reference, itself at least a byte, pays for its copy.
+inline constexpr uint64_t kTextBytesPerByte = 64;
+inline constexpr size_t kMaxSharedStringBytes = kTextBytesPerByte / 3;
+
 // Dates count seconds from 2001-01-01 00:00:00 UTC.
 inline constexpr int64_t kEpochOffsetSeconds = 978307200;
 

@@ -13,12 +13,12 @@ namespace {
 
 using namespace binary;
 
-// Deep enough for any document this system writes; a cycle of references
-// runs into it.
-constexpr unsigned kMaxDepth = 128;
 // The clock counts nanoseconds in 64 bits, about 290 years either side of
 // 1970; dates further out (a "distant future") are held at this bound.
 constexpr double kMaxDateSeconds = 8e9;
+// Containers are grown as their values are read, room for this many made at
+// once: a hostile count is charged, but not allocated before it is read.
+constexpr uint64_t kReserveAhead = 4096;
 
 void appendUtf8(std::string& out, uint32_t c) {
   if (c < 0x80) {
@@ -43,11 +43,11 @@ class Reader {
   explicit Reader(ByteView bytes)
       : p_(bytes.data()),
         size_(bytes.size()),
-        // A tree-shaped document yields at most one value per reference it
-        // holds, and every reference takes at least a byte. Sharing can
-        // legitimately multiply strings, not without limit.
-        nodeBudget_(2 * bytes.size() + 16),
-        byteBudget_(64 * bytes.size() + (1 << 20)) {}
+        // A tree-shaped document yields one value per reference it holds,
+        // and every reference takes at least a byte. Sharing an object
+        // multiplies its values, not without limit.
+        refBudget_(2 * bytes.size() + 16),
+        byteBudget_(kTextBytesPerByte * bytes.size() + (1 << 20)) {}
 
   bool open(uint64_t& top) {
     if (size_ < kMagicSize + kTrailerSize || std::memcmp(p_, kMagic, kMagicSize) != 0) return false;
@@ -63,10 +63,15 @@ class Reader {
            count_ <= (trailerAt - tableAt_) / offsetWidth_ && top < count_;
   }
 
+  // The top object; false when the document is malformed or asks for more
+  // work than its size allows.
+  bool readTop(uint64_t top, Value& out) { return charge(1) && read(top, 0, out); }
+
+ private:
+  // Reads object ref at depth into out; its parent charged the reference.
   bool read(uint64_t ref, unsigned depth, Value& out) {
     size_t at;
-    if (depth > kMaxDepth || nodeBudget_ == 0 || !objectAt(ref, at)) return false;
-    --nodeBudget_;
+    if (!objectAt(ref, at)) return false;
     const uint8_t marker = p_[at++];
     const uint8_t low = marker & 0x0F;
     switch (marker >> 4) {
@@ -123,18 +128,22 @@ class Reader {
       case kArray:
       case kSet: {
         uint64_t count;
-        if (!lengthAt(at, low, count) || count > (tableAt_ - at) / refWidth_) return false;
+        if (!lengthAt(at, low, count) || count > (tableAt_ - at) / refWidth_ ||
+            !enter(ref, count, depth) || !charge(count))
+          return false;
         Array& array = out.mutableArray();
-        array.resize(count);
+        array.reserve(std::min(count, kReserveAhead));
         for (uint64_t i = 0; i < count; ++i)
-          if (!read(refAt(at, i), depth + 1, array[i])) return false;
+          if (!read(refAt(at, i), depth + 1, array.emplace_back())) return false;
         return true;
       }
       case kDictionary: {
         uint64_t count;
-        if (!lengthAt(at, low, count) || count > (tableAt_ - at) / refWidth_ / 2) return false;
+        if (!lengthAt(at, low, count) || count > (tableAt_ - at) / refWidth_ / 2 ||
+            !enter(ref, count, depth) || !charge(2 * count))
+          return false;
         Dictionary& dictionary = out.mutableDictionary();
-        dictionary.reserve(count);
+        dictionary.reserve(std::min(count, kReserveAhead));
         for (uint64_t i = 0; i < count; ++i) {
           std::string_view key;
           if (!keyAt(refAt(at, i), key)) return false;
@@ -151,8 +160,25 @@ class Reader {
     }
   }
 
- private:
   bool fits(size_t at, uint64_t length) const { return length <= tableAt_ - at; }
+
+  // Takes n references from the budget before the values they yield are built.
+  bool charge(uint64_t n) {
+    if (n > refBudget_) return false;
+    refBudget_ -= n;
+    return true;
+  }
+
+  // Puts container ref, holding count references, on the path at depth. One
+  // already on the path above has led back to itself: the cycle is refused
+  // where it first closes, before any more is built.
+  bool enter(uint64_t ref, uint64_t count, unsigned depth) {
+    if (depth >= kMaxDepth && count > 0) return false;  // its values would be too deep
+    for (unsigned k = 0; k < depth; ++k)
+      if (path_[k] == ref) return false;
+    path_[depth] = ref;
+    return true;
+  }
 
   bool spend(uint64_t bytes) {
     if (bytes > byteBudget_) return false;
@@ -189,8 +215,7 @@ class Reader {
 
   bool keyAt(uint64_t ref, std::string_view& key) {
     size_t at;
-    if (nodeBudget_ == 0 || !objectAt(ref, at)) return false;
-    --nodeBudget_;
+    if (!objectAt(ref, at)) return false;
     const uint8_t marker = p_[at++];
     const uint8_t kind = marker >> 4;
     return (kind == kAsciiString || kind == kUtf16String) && textAt(at, marker, key);
@@ -240,8 +265,9 @@ class Reader {
 
   const uint8_t* p_;
   size_t size_;
-  std::string text_;  // decoded text, reused
-  uint64_t nodeBudget_;
+  std::string text_;              // decoded text, reused
+  uint64_t path_[kMaxDepth + 1];  // the containers from the top down to the one being read
+  uint64_t refBudget_;
   uint64_t byteBudget_;
   size_t offsetWidth_ = 0;
   size_t refWidth_ = 0;
@@ -255,7 +281,7 @@ std::optional<Value> parseBinary(ByteView bytes) {
   Reader reader(bytes);
   uint64_t top;
   Value value;
-  if (!reader.open(top) || !reader.read(top, 0, value)) return std::nullopt;
+  if (!reader.open(top) || !reader.readTop(top, value)) return std::nullopt;
   return value;
 }
 

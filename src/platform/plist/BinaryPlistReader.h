@@ -1,7 +1,8 @@
 // Reads binary property lists ("bplist00") into values. Every offset, length
-// and reference is checked against the document, nesting is bounded (which
-// also stops reference cycles), and so is the work a document can ask for
-// by referring to one object from many places.
+// and reference is checked against the document; nesting is bounded, an
+// object that refers back to itself is refused, and the values built are
+// bounded by the document's size (references are counted before anything
+// they lead to is built), so time and memory follow the bytes given.
 #pragma once
 
 #include <optional>

@@ -3,8 +3,11 @@
 #include <bit>
 #include <cstring>
 #include <functional>
+#include <stdexcept>
+#include <string>
 #include <string_view>
 
+#include "common/Utf8.h"
 #include "platform/plist/BinaryPlistFormat.h"
 
 namespace vtc::plist {
@@ -62,28 +65,14 @@ void toUtf16(std::string_view s, std::vector<uint16_t>& units) {
   const auto* p = reinterpret_cast<const uint8_t*>(s.data());
   const auto* end = p + s.size();
   while (p < end) {
-    uint32_t c = *p;
-    size_t extra = c < 0x80           ? 0
-                   : (c >> 5) == 0x6  ? 1
-                   : (c >> 4) == 0xE  ? 2
-                   : (c >> 3) == 0x1E ? 3
-                                      : 4;
-    bool ok = extra < 4 && static_cast<size_t>(end - p) > extra;
-    if (ok && extra > 0) {
-      c &= 0x3F >> extra;
-      for (size_t k = 1; k <= extra && ok; ++k) {
-        ok = (p[k] & 0xC0) == 0x80;
-        c = c << 6 | (p[k] & 0x3F);
-      }
-      static constexpr uint32_t kSmallest[] = {0, 0x80, 0x800, 0x10000};
-      ok = ok && c >= kSmallest[extra] && c <= 0x10FFFF && (c < 0xD800 || c > 0xDFFF);
-    }
-    if (!ok) {
+    char32_t c;
+    const size_t length = utf8::decode(p, end, c);
+    if (length == 0) {
       units.push_back(0xFFFD);
       ++p;
       continue;
     }
-    p += extra + 1;
+    p += length;
     if (c < 0x10000) {
       units.push_back(static_cast<uint16_t>(c));
     } else {
@@ -99,13 +88,13 @@ void toUtf16(std::string_view s, std::vector<uint16_t>& units) {
 void BinaryPlistWriter::append(const Value& value, Bytes& out) {
   if (value.isNone()) return;
   begin();
-  add(value);
+  add(value, 0);
   finish(out);
 }
 
 void BinaryPlistWriter::append(const Array& array, Bytes& out) {
   begin();
-  addArray(array);
+  addArray(array, 0);
   finish(out);
 }
 
@@ -120,14 +109,14 @@ void BinaryPlistWriter::begin() {
   if (strings_.empty()) strings_.resize(64);
 }
 
-uint32_t BinaryPlistWriter::add(const Value& value) {
+uint32_t BinaryPlistWriter::add(const Value& value, unsigned depth) {
   switch (value.kind()) {
     case Value::Kind::String:
       return addString(value.string());
     case Value::Kind::Array:
-      return addArray(value.array());
+      return addArray(value.array(), depth);
     case Value::Kind::Dictionary:
-      return addDictionary(value.dictionary());
+      return addDictionary(value.dictionary(), depth);
     default:
       objects_.push_back({Shape::Scalar, &value, 0, 0});
       return static_cast<uint32_t>(objects_.size() - 1);
@@ -135,6 +124,10 @@ uint32_t BinaryPlistWriter::add(const Value& value) {
 }
 
 uint32_t BinaryPlistWriter::addString(const std::string& s) {
+  if (s.size() > kMaxSharedStringBytes) {  // written where it occurs: see kTextBytesPerByte
+    objects_.push_back({Shape::String, &s, 0, 0});
+    return static_cast<uint32_t>(objects_.size() - 1);
+  }
   const size_t hash = std::hash<std::string_view>{}(s);
   const size_t mask = strings_.size() - 1;
   for (size_t i = hash & mask;; i = (i + 1) & mask) {
@@ -163,26 +156,34 @@ void BinaryPlistWriter::growStringTable() {
   }
 }
 
-uint32_t BinaryPlistWriter::addArray(const Array& array) {
+void BinaryPlistWriter::checkDepth(unsigned depth, size_t children) {
+  if (depth >= kMaxDepth && children > 0)
+    throw std::invalid_argument("Cannot write a property list nested deeper than " +
+                                std::to_string(kMaxDepth) + " levels: readers refuse it");
+}
+
+uint32_t BinaryPlistWriter::addArray(const Array& array, unsigned depth) {
   const auto id = static_cast<uint32_t>(objects_.size());
   uint32_t count = 0;
   for (const Value& item : array) count += item.isNone() ? 0 : 1;
+  checkDepth(depth, count);
   const auto at = static_cast<uint32_t>(refs_.size());
   objects_.push_back({Shape::Array, &array, at, count});
   refs_.resize(at + count);  // filled below; nested containers append after it
   uint32_t k = at;
   for (const Value& item : array)
     if (!item.isNone()) {
-      uint32_t child = add(item);
+      uint32_t child = add(item, depth + 1);
       refs_[k++] = child;
     }
   return id;
 }
 
-uint32_t BinaryPlistWriter::addDictionary(const Dictionary& dictionary) {
+uint32_t BinaryPlistWriter::addDictionary(const Dictionary& dictionary, unsigned depth) {
   const auto id = static_cast<uint32_t>(objects_.size());
   uint32_t count = 0;
   for (const auto& entry : dictionary) count += entry.second.isNone() ? 0 : 1;
+  checkDepth(depth, count);
   const auto at = static_cast<uint32_t>(refs_.size());
   objects_.push_back({Shape::Dictionary, &dictionary, at, count});
   refs_.resize(at + 2 * size_t{count});  // all keys, then all values
@@ -194,7 +195,7 @@ uint32_t BinaryPlistWriter::addDictionary(const Dictionary& dictionary) {
     }
   for (const auto& [key, item] : dictionary)
     if (!item.isNone()) {
-      uint32_t child = add(item);
+      uint32_t child = add(item, depth + 1);
       refs_[k++] = child;
     }
   return id;

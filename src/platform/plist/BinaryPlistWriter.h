@@ -1,4 +1,4 @@
-// Writes values as binary property lists ("bplist00"). Strings, keys
+// Writes values as binary property lists ("bplist00"). Short strings, keys
 // included, are stored once per document and referenced from every place
 // they occur. A writer keeps its working buffers between documents, so one
 // writer serving many small documents (the records of a changelog) allocates
@@ -17,6 +17,8 @@ class BinaryPlistWriter {
  public:
   // Appends the document of value to out. A none value has no property-list
   // form and appends nothing; none values inside containers are left out.
+  // Values nested deeper than readers accept (kMaxDepth) raise
+  // std::invalid_argument, and out is then unchanged.
   void append(const Value& value, Bytes& out);
   // The same for an array, without wrapping (and copying) it into a Value.
   void append(const Array& array, Bytes& out);
@@ -37,10 +39,11 @@ class BinaryPlistWriter {
 
   void begin();
   void finish(Bytes& out);
-  uint32_t add(const Value& value);
+  uint32_t add(const Value& value, unsigned depth);
   uint32_t addString(const std::string& s);
-  uint32_t addArray(const Array& array);
-  uint32_t addDictionary(const Dictionary& dictionary);
+  static void checkDepth(unsigned depth, size_t children);
+  uint32_t addArray(const Array& array, unsigned depth);
+  uint32_t addDictionary(const Dictionary& dictionary, unsigned depth);
   void growStringTable();
   void writeObject(const Object& object, Bytes& out);
 

@@ -1,8 +1,10 @@
 // Binary property lists: the writer's exact bytes for a small document, both
 // directions against libplist, and damaged or hostile documents refused
 // without reading outside them.
+#include <gmock/gmock.h>
 #include <gtest/gtest.h>
 
+#include <chrono>
 #include <cstdlib>
 #include <filesystem>
 #include <fstream>
@@ -179,6 +181,85 @@ TEST(BinaryPlist, DamagedAndHostileDocumentsAreRefused) {
   trailer[31] = static_cast<uint8_t>(tableAt);
   bomb.insert(bomb.end(), trailer.begin(), trailer.end());
   EXPECT_FALSE(vtc::plist::parseBinary(bomb));
+}
+
+// A document of count objects: object i at its offset, one-byte references
+// and offsets; the top object is 0.
+Bytes document(const std::vector<Bytes>& objects) {
+  Bytes doc = {'b', 'p', 'l', 'i', 's', 't', '0', '0'};
+  Bytes table;
+  for (const Bytes& object : objects) {
+    table.push_back(static_cast<uint8_t>(doc.size()));
+    doc.insert(doc.end(), object.begin(), object.end());
+  }
+  const size_t tableAt = doc.size();
+  doc.insert(doc.end(), table.begin(), table.end());
+  Bytes trailer(32, 0);
+  trailer[6] = 1;
+  trailer[7] = 1;
+  trailer[15] = static_cast<uint8_t>(objects.size());
+  trailer[30] = static_cast<uint8_t>(tableAt >> 8);
+  trailer[31] = static_cast<uint8_t>(tableAt);
+  doc.insert(doc.end(), trailer.begin(), trailer.end());
+  return doc;
+}
+
+// An object reachable from itself is refused before anything of it is built;
+// one reached from several places is not a cycle.
+TEST(BinaryPlist, ObjectsThatLeadBackToThemselvesAreRefused) {
+  Bytes self = {'b', 'p', 'l', 'i', 's', 't', '0', '0', 0xAF, 0x12, 0x00, 0x0F, 0x42, 0x40};
+  self.insert(self.end(), 1000000, 0);  // the array holding itself a million times
+  const size_t tableAt = self.size();
+  self.push_back(8);
+  Bytes trailer(32, 0);
+  trailer[6] = 1;
+  trailer[7] = 1;
+  trailer[15] = 1;
+  for (int i = 0; i < 8; ++i) trailer[31 - i] = static_cast<uint8_t>(tableAt >> (8 * i));
+  self.insert(self.end(), trailer.begin(), trailer.end());
+  const auto start = std::chrono::steady_clock::now();
+  EXPECT_FALSE(vtc::plist::parseBinary(self));
+  EXPECT_LT(std::chrono::steady_clock::now() - start, std::chrono::milliseconds(500));
+
+  const Bytes key = {0x51, 'k'};
+  // array 0 -> array 1 -> array 0
+  EXPECT_FALSE(vtc::plist::parseBinary(document({{0xA1, 1}, {0xA2, 2, 0}, {0x09}})));
+  // dictionary 0 -> array 1 -> dictionary 2 -> dictionary 0, through a value
+  EXPECT_FALSE(vtc::plist::parseBinary(
+      document({{0xD1, 3, 1}, {0xA1, 2}, {0xD2, 3, 3, 4, 0}, key, {0x09}})));
+  // array 0 holds array 1 twice and array 1 holds a string: shared, no cycle
+  auto shared = vtc::plist::parseBinary(document({{0xA2, 1, 1}, {0xA1, 2}, key}));
+  ASSERT_TRUE(shared);
+  EXPECT_EQ(*shared, Value(Array{Value(Array{Value("k")}), Value(Array{Value("k")})}));
+}
+
+// Whatever the writer accepts the reader reads: nesting stops at the depth
+// the reader reads, and long strings are not shared beyond what its budget
+// allows.
+TEST(BinaryPlist, TheWriterStaysWithinWhatTheReaderReads) {
+  auto nested = [](unsigned containers) {
+    Value v("innermost");
+    for (unsigned i = 0; i < containers; ++i)
+      v = i % 2 ? Value(Array{v}) : Value(Dictionary{{"k", v}});
+    return v;
+  };
+  const Value deepest = nested(128);  // the top at depth 0, the string at 128
+  EXPECT_EQ(*vtc::plist::parseBinary(encode(deepest)), deepest);
+  Bytes out = {7};
+  EXPECT_THAT([&] { vtc::plist::BinaryPlistWriter().append(nested(129), out); },
+              testing::ThrowsMessage<std::invalid_argument>(
+                  "Cannot write a property list nested deeper than 128 levels: readers refuse it"));
+  EXPECT_EQ(out, Bytes{7});
+  // Empty containers hold nothing deeper, at any depth the reader reaches.
+  Value emptyAtTheBottom(Array{});
+  for (int i = 0; i < 128; ++i) emptyAtTheBottom = Value(Array{emptyAtTheBottom});
+  EXPECT_EQ(*vtc::plist::parseBinary(encode(emptyAtTheBottom)), emptyAtTheBottom);
+
+  const Value longText(std::string(5000, 'x'));
+  const Value repeated(Array(2000, longText));
+  EXPECT_EQ(*vtc::plist::parseBinary(encode(repeated)), repeated);
+  const Value shortText("short");  // short strings are still written once
+  EXPECT_LT(encode(Value(Array(2000, shortText))).size(), 2000u * 2 + 100);
 }
 
 // Found by fuzzing: whatever the reader accepts, writing it and reading it
