@@ -14,9 +14,9 @@
 #include <set>
 
 #include "VantorSyncManager/NubiloRemoteSession.h"
+#include "localshare/ApacheShare.h"
 #include "platform/dav/DavPaths.h"
 #include "platform/dav/TesselSession.h"
-#include "localshare/ApacheShare.h"
 
 namespace {
 

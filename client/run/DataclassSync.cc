@@ -48,11 +48,25 @@ void apply(Dictionary& fields, const Array& changes) {
   }
 }
 
-std::map<std::string, ItemState> statesOf(const std::map<std::string, Value>& stored) {
-  std::map<std::string, ItemState> states;
-  for (const auto& [name, value] : stored)
-    if (auto state = ItemState::fromValue(value)) states.emplace(name, std::move(*state));
-  return states;
+// What the engine keeps of the folder's files: their stamps, with the
+// fields of each left empty until they are needed.
+std::map<std::string, ItemState> knownFiles(engine::SyncEngine& engine, const std::string& client,
+                                            const std::string& dataclass) {
+  std::map<std::string, ItemState> known;
+  for (const auto& [name, stamp] : engine.itemStamps(client, dataclass)) {
+    ItemState state;
+    state.size = stamp.size;
+    state.modifiedNanoseconds = stamp.modified;
+    state.changedNanoseconds = stamp.changed;
+    state.inode = stamp.inode;
+    known.emplace_hint(known.end(), name, std::move(state));
+  }
+  return known;
+}
+
+engine::StoredItem stored(const ItemState& state) {
+  return {{state.size, state.modifiedNanoseconds, state.changedNanoseconds, state.inode},
+          Value(state.fields)};
 }
 
 // The delete guard looks at proportions only from this many deletes on.
@@ -111,20 +125,24 @@ DataclassOutcome DataclassSync::run(const std::optional<DataclassRecord>& listed
                           "remove " +
                           dataclass + "`.");
 
-  // The folder, read before anything is written anywhere.
-  const std::map<std::string, ItemState> known =
-      statesOf(engine_.itemStates(folderClient_, dataclass));
-  const ScanResult scan = folder_.scan(known);
+  // The folder, read before anything is written anywhere. Only files whose
+  // stamps changed are read; their fields are then compared with the fields
+  // last seen, which are loaded for them alone.
+  std::map<std::string, ItemState> known = knownFiles(engine_, folderClient_, dataclass);
+  const size_t knownCount = known.size();
+  const ScanResult scan = folder_.scan(std::move(known));
+  std::vector<std::string> reread;
+  for (const auto& [name, fields] : scan.changed) reread.push_back(name);
+  std::map<std::string, Dictionary> lastFields;
+  for (auto& [name, detail] : engine_.itemDetails(folderClient_, dataclass, reread))
+    lastFields.emplace(name, detail.dictionary());
   outcome_.invalidFiles = scan.invalid.size();
-  checkLocalDeletes(scan, known);
-  const std::vector<SyncEngineChange> local = folderChanges(scan, known);
+  checkLocalDeletes(scan, knownCount);
+  const std::vector<SyncEngineChange> local = folderChanges(scan, lastFields);
   engine::StateUpdate scanned;
-  for (const auto& [name, state] : scan.states) {
-    auto old = known.find(name);
-    if (old == known.end() || !old->second.sameFileAs(state) ||
-        !(old->second.fields == state.fields))
-      scanned.items.emplace_back(name, state.toValue());
-  }
+  for (const auto* read : {&scan.added, &scan.changed})
+    for (const auto& [name, fields] : *read)
+      scanned.items.emplace_back(name, stored(scan.states.at(name)));
   for (const std::string& name : scan.deleted) scanned.items.emplace_back(name, std::nullopt);
 
   const NetworkState network =
@@ -183,13 +201,13 @@ DataclassOutcome DataclassSync::run(const std::optional<DataclassRecord>& listed
 }
 
 std::vector<SyncEngineChange> DataclassSync::folderChanges(
-    const ScanResult& scan, const std::map<std::string, ItemState>& known) {
+    const ScanResult& scan, const std::map<std::string, Dictionary>& lastFields) {
   std::vector<SyncEngineChange> changes;
   for (const auto& [name, fields] : scan.added)
     changes.emplace_back(SyncEngineChange::kAdd, name, setsOf(fields));
   for (const auto& [name, fields] : scan.changed) {
-    auto old = known.find(name);
-    Array diff = differences(old == known.end() ? Dictionary{} : old->second.fields, fields);
+    auto old = lastFields.find(name);
+    Array diff = differences(old == lastFields.end() ? Dictionary{} : old->second, fields);
     if (!diff.empty()) changes.emplace_back(SyncEngineChange::kModify, name, std::move(diff));
   }
   for (const std::string& name : scan.deleted)
@@ -197,25 +215,24 @@ std::vector<SyncEngineChange> DataclassSync::folderChanges(
   return changes;
 }
 
-void DataclassSync::checkLocalDeletes(const ScanResult& scan,
-                                      const std::map<std::string, ItemState>& known) {
+void DataclassSync::checkLocalDeletes(const ScanResult& scan, size_t known) {
   // A few deletes always pass: deleting one of two contacts is no accident.
-  if (known.size() <= kDeletesThatAlwaysPass || options_.maxDeletePercent >= 100) return;
+  if (known <= kDeletesThatAlwaysPass || options_.maxDeletePercent >= 100) return;
   const std::string& dataclass = collection_.dataclass;
   if (scan.states.empty() && scan.invalid.empty())
     throw SyncFailure(FailureKind::DeleteRefused,
                       "The folder " + collection_.folder + " of " + dataclass +
-                          " is empty but held " + std::to_string(known.size()) +
+                          " is empty but held " + std::to_string(known) +
                           " items; if they are meant to go everywhere, run `nubilosyncclient "
                           "sync " +
                           dataclass + " --max-delete 100`.");
   if (scan.deleted.size() > kDeletesThatAlwaysPass &&
-      scan.deleted.size() * 100 > known.size() * static_cast<size_t>(options_.maxDeletePercent))
+      scan.deleted.size() * 100 > known * static_cast<size_t>(options_.maxDeletePercent))
     throw SyncFailure(FailureKind::DeleteRefused,
                       "Syncing " + dataclass + " would delete " +
-                          std::to_string(scan.deleted.size()) + " of its " +
-                          std::to_string(known.size()) + " items on the other computers (" +
-                          percentText(scan.deleted.size(), known.size()) + ", more than " +
+                          std::to_string(scan.deleted.size()) + " of its " + std::to_string(known) +
+                          " items on the other computers (" +
+                          percentText(scan.deleted.size(), known) + ", more than " +
                           std::to_string(options_.maxDeletePercent) +
                           "%); if that is meant, run `nubilosyncclient sync " + dataclass +
                           " --max-delete 100`.");
@@ -504,11 +521,13 @@ void DataclassSync::writeFolder() {
       engine_.acknowledge(folderClient_, dataclass, pulled.anchor);
     return;
   }
-  std::map<std::string, ItemState> known = statesOf(engine_.itemStates(folderClient_, dataclass));
+  std::map<std::string, ItemState> known = knownFiles(engine_, folderClient_, dataclass);
   const std::string extension = itemExtension(collection_.kind);
   engine::StateUpdate states;
   bool skipped = false;
   std::set<std::string> named;
+  // Made durable together at the end, before the engine hears of them.
+  folder_.deferFlushes(true);
   for (const SyncEngineChange& change : pulled.changes) {
     const std::string& name = change.recordIdentifier();
     named.insert(name);
@@ -546,7 +565,7 @@ void DataclassSync::writeFolder() {
       }
       const std::string bytes = applyFieldChanges(collection_.kind, current, change.changes());
       result = folder_.write(name, bytes, expected, &written);
-      if (result == WriteOutcome::Written) states.items.emplace_back(name, written.toValue());
+      if (result == WriteOutcome::Written) states.items.emplace_back(name, stored(written));
     }
     if (result == WriteOutcome::SkippedChangedOnDisk || result == WriteOutcome::Failed) {
       // Left for the next sync, which reads the file's new content first.
@@ -569,6 +588,11 @@ void DataclassSync::writeFolder() {
     }
   }
   if (options_.dryRun) return;
+  if (!folder_.flush()) {
+    // Nothing is recorded: the next sync writes these files again.
+    ++outcome_.filesSkipped;
+    return;
+  }
   // Acknowledged only when every change reached its file: otherwise the
   // next pull brings them again (rewriting a file with the same bytes).
   if (skipped)

@@ -64,8 +64,8 @@ class DataclassSync {
   struct Remote;  // what the server side of one run found and decided
 
   std::vector<SyncEngineChange> folderChanges(const ScanResult& scan,
-                                              const std::map<std::string, ItemState>& known);
-  void checkLocalDeletes(const ScanResult& scan, const std::map<std::string, ItemState>& known);
+                                              const std::map<std::string, Dictionary>& lastFields);
+  void checkLocalDeletes(const ScanResult& scan, size_t known);
   void lock();
   void unlock();
   Remote fetch(bool slow, const DataclassRecord& record);

@@ -86,12 +86,20 @@ class VdirCollection {
   // Removes an item's file, if it is still as `expected` says; a file that
   // is gone already counts as Removed.
   WriteOutcome remove(const std::string& name, const ItemState& expected) const;
+
+  // Many writes in a row: each write and removal skips its own flushes, and
+  // flush() then makes all of them durable at once (one sync of the file
+  // system instead of two per file). Until flush() returns true, a power
+  // loss can undo or empty what was written.
+  void deferFlushes(bool defer) { deferFlushes_ = defer; }
+  bool flush() const;
   // The bytes of an item file; none when it cannot be read.
   std::optional<std::string> read(const std::string& name) const;
 
  private:
   std::string folder_;
   ItemKind kind_;
+  bool deferFlushes_ = false;
 };
 
 }  // namespace vtc::client

@@ -94,7 +94,7 @@ WriteOutcome VdirCollection::write(const std::string& name, const std::string& b
 
   if (::fchmod(file.get(), mode) != 0) return failed("setting the permissions");
   if (!writeWhole(file.get(), bytes)) return failed("writing");
-  if (::fsync(file.get()) != 0) return failed("flushing");
+  if (!deferFlushes_ && ::fsync(file.get()) != 0) return failed("flushing");
 
   // Writing took time: look again, right before the rename.
   OnDisk now = compareWithDisk(dir.get(), name, expected);
@@ -115,7 +115,7 @@ WriteOutcome VdirCollection::write(const std::string& name, const std::string& b
   if (!file.close()) return failed("closing");
   // Until the folder is flushed, a crash can bring back the old file; the
   // caller must then not take the new state as written.
-  if (::fsync(dir.get()) != 0) return failed("flushing the folder");
+  if (!deferFlushes_ && ::fsync(dir.get()) != 0) return failed("flushing the folder");
   if (state) {
     *state = fileState(st);
     state->fields = std::move(layout->fields);
@@ -140,8 +140,17 @@ WriteOutcome VdirCollection::remove(const std::string& name, const ItemState& ex
     return WriteOutcome::SkippedChangedOnDisk;
   }
   if (::unlinkat(dir.get(), name.c_str(), 0) != 0 && errno != ENOENT) return failed("unlinking");
-  if (::fsync(dir.get()) != 0) return failed("flushing the folder");
+  if (!deferFlushes_ && ::fsync(dir.get()) != 0) return failed("flushing the folder");
   return WriteOutcome::Removed;
+}
+
+bool VdirCollection::flush() const {
+  FileDescriptor dir(::open(folder_.c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC));
+  if (!dir.valid() || ::syncfs(dir.get()) != 0) {
+    VTC_LOG_ERROR("Could not flush the writes in %@: %s", folder_, strerror(errno));
+    return false;
+  }
+  return true;
 }
 
 }  // namespace vtc::client

@@ -1,5 +1,7 @@
 #include "localshare/ApacheShare.h"
 
+#include "platform/fs/LocalPaths.h"
+
 #include <openssl/evp.h>
 #include <pwd.h>
 #include <sys/stat.h>
@@ -55,8 +57,8 @@ int freeLoopbackPort() {
 }
 
 ApacheShare::ApacheShare(Options options) : options_(options) {
-  char tmpl[] = "/tmp/vsm-dav-XXXXXX";
-  if (!mkdtemp(tmpl)) throw std::runtime_error("mkdtemp failed");
+  std::string tmpl = paths::join(paths::temporaryDirectory(), "vsm-dav-XXXXXX");
+  if (!mkdtemp(tmpl.data())) throw std::runtime_error("mkdtemp failed");
   root_ = tmpl;
   ::chmod(root_.c_str(), 0755);
   documentRoot_ = root_ + "/dav";

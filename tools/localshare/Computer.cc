@@ -9,6 +9,7 @@
 #include <sstream>
 #include <stdexcept>
 
+#include "platform/fs/LocalPaths.h"
 #include "platform/os/HostIdentity.h"
 #include "platform/plist/PlistCodec.h"
 
@@ -21,8 +22,8 @@ std::string clientProgram() {
 }
 
 Computer::Computer(const std::string& name) : name_(name) {
-  char tmpl[] = "/tmp/vsm-computer-XXXXXX";
-  home_ = ::mkdtemp(tmpl);
+  std::string tmpl = paths::join(paths::temporaryDirectory(), "vsm-computer-XXXXXX");
+  home_ = ::mkdtemp(tmpl.data());
   std::filesystem::create_directories(std::filesystem::path(perHostFile()).parent_path());
   plist::writeFileAtomically(perHostFile(),
                              Value(Dictionary{{"ClientName", name}, {"LoggingLevel", "info"}}));

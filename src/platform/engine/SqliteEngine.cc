@@ -37,7 +37,9 @@ const char* const kMigrations[] = {
        CREATE TABLE client_states (client TEXT NOT NULL, dataclass TEXT NOT NULL,
                                    state BLOB NOT NULL, PRIMARY KEY (client, dataclass));
        CREATE TABLE item_states (client TEXT NOT NULL, dataclass TEXT NOT NULL,
-                                 item TEXT NOT NULL, state BLOB NOT NULL,
+                                 item TEXT NOT NULL, size INTEGER NOT NULL,
+                                 modified INTEGER NOT NULL, changed INTEGER NOT NULL,
+                                 inode INTEGER NOT NULL, detail BLOB NOT NULL,
                                  PRIMARY KEY (client, dataclass, item));)",
 };
 
@@ -259,14 +261,32 @@ Value SqliteEngine::clientState(const std::string& client, const std::string& da
   return s.step() ? decode(s.blob(0)) : Value();
 }
 
-std::map<std::string, Value> SqliteEngine::itemStates(const std::string& client,
-                                                      const std::string& dataclass) {
+std::map<std::string, ItemStamp> SqliteEngine::itemStamps(const std::string& client,
+                                                          const std::string& dataclass) {
   Statement s(db_.handle(),
-              "SELECT item, state FROM item_states WHERE client = ?1 AND dataclass = ?2");
+              "SELECT item, size, modified, changed, inode FROM item_states WHERE client = ?1 AND "
+              "dataclass = ?2");
   s.bind(1, client).bind(2, dataclass);
-  std::map<std::string, Value> states;
-  while (s.step()) states.emplace(s.text(0), decode(s.blob(1)));
-  return states;
+  std::map<std::string, ItemStamp> stamps;
+  while (s.step())
+    stamps.emplace_hint(
+        stamps.end(), s.text(0),
+        ItemStamp{s.integer(1), s.integer(2), s.integer(3), static_cast<uint64_t>(s.integer(4))});
+  return stamps;
+}
+
+std::map<std::string, Value> SqliteEngine::itemDetails(const std::string& client,
+                                                       const std::string& dataclass,
+                                                       const std::vector<std::string>& items) {
+  Statement s(db_.handle(),
+              "SELECT detail FROM item_states WHERE client = ?1 AND dataclass = ?2 AND item = ?3");
+  std::map<std::string, Value> details;
+  for (const std::string& item : items) {
+    s.bind(1, client).bind(2, dataclass).bind(3, item);
+    if (s.step()) details.emplace(item, decode(s.blob(0)));
+    s.reset();
+  }
+  return details;
 }
 
 void SqliteEngine::saveState(const std::string& client, const std::string& dataclass,
@@ -286,13 +306,15 @@ void SqliteEngine::writeState(const std::string& client, const std::string& data
   }
   if (state.items.empty()) return;
   Statement put(db_.handle(),
-                "INSERT INTO item_states (client, dataclass, item, state) VALUES (?1, ?2, ?3, ?4) "
-                "ON CONFLICT(client, dataclass, item) DO UPDATE SET state = excluded.state");
+                "INSERT OR REPLACE INTO item_states (client, dataclass, item, size, modified, "
+                "changed, inode, detail) VALUES (?1, ?2, ?3, ?4, ?5, ?6, ?7, ?8)");
   Statement drop(db_.handle(),
                  "DELETE FROM item_states WHERE client = ?1 AND dataclass = ?2 AND item = ?3");
-  for (const auto& [item, value] : state.items) {
-    if (value) {
-      put.bind(1, client).bind(2, dataclass).bind(3, item).bind(4, encode(*value)).run();
+  for (const auto& [item, stored] : state.items) {
+    if (stored) {
+      put.bind(1, client).bind(2, dataclass).bind(3, item).bind(4, stored->stamp.size);
+      put.bind(5, stored->stamp.modified).bind(6, stored->stamp.changed);
+      put.bind(7, static_cast<int64_t>(stored->stamp.inode)).bind(8, encode(stored->detail)).run();
     } else {
       drop.bind(1, client).bind(2, dataclass).bind(3, item).run();
     }

@@ -35,8 +35,10 @@ class SqliteEngine final : public SyncEngine {
   std::vector<SyncEngineChange> records(const std::string& dataclass) override;
   int64_t recordCount(const std::string& dataclass) override;
   Value clientState(const std::string& client, const std::string& dataclass) override;
-  std::map<std::string, Value> itemStates(const std::string& client,
-                                          const std::string& dataclass) override;
+  std::map<std::string, ItemStamp> itemStamps(const std::string& client,
+                                              const std::string& dataclass) override;
+  std::map<std::string, Value> itemDetails(const std::string& client, const std::string& dataclass,
+                                           const std::vector<std::string>& items) override;
   void saveState(const std::string& client, const std::string& dataclass,
                  const StateUpdate& state) override;
   void resetClient(const std::string& client, const std::string& dataclass) override;

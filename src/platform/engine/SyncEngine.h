@@ -50,12 +50,26 @@ struct Conflict {
   Date date;
 };
 
+// What a client knows of one of its items (a file): a stamp it compares
+// cheaply on every sync, and details read only for the items that changed.
+struct ItemStamp {
+  int64_t size = 0;
+  int64_t modified = 0;  // nanoseconds
+  int64_t changed = 0;   // nanoseconds
+  uint64_t inode = 0;
+  friend bool operator==(const ItemStamp&, const ItemStamp&) = default;
+};
+struct StoredItem {
+  ItemStamp stamp;
+  Value detail;
+};
+
 // What a client remembers beside its changes, saved in the same transaction
 // as a push or an acknowledgement, so that a crash never separates them: a
-// state of its own and a state per item (none removes an item's state).
+// state of its own and one per item (none removes an item).
 struct StateUpdate {
   std::optional<Value> clientState;
-  std::vector<std::pair<std::string, std::optional<Value>>> items;
+  std::vector<std::pair<std::string, std::optional<StoredItem>>> items;
   bool empty() const { return !clientState && items.empty(); }
 };
 
@@ -123,8 +137,12 @@ class SyncEngine {
 
   // A client's remembered states (see StateUpdate).
   virtual Value clientState(const std::string& client, const std::string& dataclass) = 0;
-  virtual std::map<std::string, Value> itemStates(const std::string& client,
-                                                  const std::string& dataclass) = 0;
+  virtual std::map<std::string, ItemStamp> itemStamps(const std::string& client,
+                                                      const std::string& dataclass) = 0;
+  // The details of these items (those without are left out).
+  virtual std::map<std::string, Value> itemDetails(const std::string& client,
+                                                   const std::string& dataclass,
+                                                   const std::vector<std::string>& items) = 0;
   virtual void saveState(const std::string& client, const std::string& dataclass,
                          const StateUpdate& state) = 0;
   // The client's next pull is the whole truth, as adds.

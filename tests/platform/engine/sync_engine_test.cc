@@ -149,15 +149,18 @@ TEST_F(Engine, PullsCarryCurrentValuesAndConflictsAreToldWithTheirComputers) {
 }
 
 TEST_F(Engine, StatesTravelWithPushesAndAcknowledgementsAndADryRunForgetsEverything) {
-  vtc::engine::StateUpdate state{Value(Dictionary{{"index", 4}}), {{"a.vcf", Value("A")}}};
+  vtc::engine::StoredItem item{{400, 1, 2, 3}, Value("A")};
+  vtc::engine::StateUpdate state{Value(Dictionary{{"index", 4}}), {{"a.vcf", item}}};
   engine->push("vdir", "Contacts", {SyncEngineChange(1, "a.vcf", Array{set("FN", Value("A"))})},
                {"", {}, state});
   EXPECT_EQ(engine->clientState("vdir", "Contacts"), Value(Dictionary{{"index", 4}}));
-  EXPECT_EQ(engine->itemStates("vdir", "Contacts").at("a.vcf"), Value("A"));
+  EXPECT_EQ(engine->itemStamps("vdir", "Contacts").at("a.vcf"), item.stamp);
+  EXPECT_EQ(engine->itemDetails("vdir", "Contacts", {"a.vcf", "b.vcf"}),
+            (std::map<std::string, Value>{{"a.vcf", Value("A")}}));
   auto pulled = engine->pull("net", "Contacts");
   engine->acknowledge("net", "Contacts", pulled.anchor,
-                      {std::nullopt, {{"a.vcf", std::nullopt}, {"b.vcf", Value("B")}}});
-  EXPECT_EQ(engine->itemStates("net", "Contacts").size(), 1u);
+                      {std::nullopt, {{"a.vcf", std::nullopt}, {"b.vcf", item}}});
+  EXPECT_EQ(engine->itemStamps("net", "Contacts").size(), 1u);
   EXPECT_TRUE(engine->pull("net", "Contacts").changes.empty());
   EXPECT_TRUE(engine->clientState("net", "Contacts").isNone());
 
