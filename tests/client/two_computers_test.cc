@@ -3,6 +3,7 @@
 // separate process, run as a person runs it.
 #include <gmock/gmock.h>
 
+#include <cstdio>
 #include <filesystem>
 
 #include "localshare/ApacheShare.h"
@@ -194,6 +195,61 @@ TEST_F(Account, CompactionKeepsAnUnsentEditAndAComputerAwayThroughoutConverges) 
     EXPECT_EQ(contactsOf(*each)["ann.vcf"], card("ann", "Ann", "ann@example.org", "103"))
         << each->name();
   }
+}
+
+// What people use every day: khard and khal write and read the folders.
+class WithPrograms : public Account {
+ protected:
+  void SetUp() override {
+    Account::SetUp();
+    for (const Computer* c : {&a, &b}) {
+      Computer::write(c->home() + "/.config/khard/khard.conf",
+                      "[addressbooks]\n[[people]]\npath = " + c->contacts() +
+                          "\n[general]\neditor = /bin/true\nmerge_editor = /bin/true\n");
+      Computer::write(c->home() + "/.config/khal/config",
+                      "[calendars]\n[[home]]\npath = " + c->calendars() +
+                          "\ntype = calendar\n[locale]\ntimeformat = %H:%M\n"
+                          "dateformat = %Y-%m-%d\nlongdateformat = %Y-%m-%d\n"
+                          "datetimeformat = %Y-%m-%d %H:%M\nlongdatetimeformat = %Y-%m-%d %H:%M\n"
+                          "default_timezone = UTC\nlocal_timezone = UTC\n"
+                          "[default]\ndefault_calendar = home\n");
+    }
+  }
+  // A command line run in the computer's home; its output.
+  std::string program(const Computer& c, const std::string& command) {
+    const std::string line = "HOME='" + c.home() + "' XDG_CONFIG_HOME='" + c.home() +
+                             "/.config' XDG_DATA_HOME='" + c.home() +
+                             "/.local/share' LC_ALL=C.UTF-8 " + command + " 2>&1";
+    FILE* pipe = ::popen(line.c_str(), "r");
+    std::string out;
+    char buffer[4096];
+    for (size_t n; pipe && (n = std::fread(buffer, 1, sizeof buffer, pipe)) > 0;)
+      out.append(buffer, n);
+    EXPECT_EQ(pipe ? ::pclose(pipe) : -1, 0) << command << "\n" << out;
+    return out;
+  }
+};
+
+TEST_F(WithPrograms, AContactFromKhardAndAnEventFromKhalReachTheOtherComputer) {
+  Computer::write(a.home() + "/ada.yaml",
+                  "First name : Ada\nLast name : Lovelace\nEmail :\n    home : ada@example.org\n");
+  program(a, "khard new --input-file '" + a.home() + "/ada.yaml' -a people");
+  program(b, "khal new 2025-03-10 09:00 10:00 Stand-up");
+  sync(a);
+  sync(b);
+  sync(a);
+  EXPECT_THAT(program(b, "khard list"), HasSubstr("Ada Lovelace"));
+  EXPECT_THAT(program(a, "khal list -f '{start-time} {title}' 2025-03-10 1d"),
+              HasSubstr("09:00 Stand-up"));
+
+  // Edited with khard on B, the e-mail reaches A.
+  Computer::write(b.home() + "/edit.yaml",
+                  "First name : Ada\nLast name : Lovelace\nEmail :\n    work : ada@work.example\n");
+  program(b, "sh -c \"echo y | khard edit -i '" + b.home() + "/edit.yaml' Ada\"");
+  sync(b);
+  sync(a);
+  EXPECT_THAT(program(a, "khard show Ada"), HasSubstr("ada@work.example"));
+  EXPECT_EQ(Computer::files(a.calendars()), Computer::files(b.calendars()));
 }
 
 }  // namespace
