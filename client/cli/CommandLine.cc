@@ -2,15 +2,44 @@
 // statuses are a contract: scripts, jobs and pushes call them as they are.
 #include <CLI/CLI.hpp>
 
+#include <cstdlib>
 #include <iostream>
+#include <thread>
 
 #include "VantorSyncManager/NubiloException.h"
 #include "client/cli/Commands.h"
 #include "client/run/SyncFailure.h"
+#include "common/Clock.h"
 
 namespace vtc::client {
 
+namespace {
+
+// NUBILO_WAIT_SCALE multiplies every wait of the protocol (lock back-off,
+// the pause before asking again for a missing file): tests that run the
+// client as a program make its waits short with it.
+class ScaledSleeper : public Sleeper {
+ public:
+  explicit ScaledSleeper(double scale) : scale_(scale) {}
+  void sleepFor(Seconds duration) override { std::this_thread::sleep_for(duration * scale_); }
+
+ private:
+  double scale_;
+};
+
+void scaleWaitsFromEnvironment() {
+  const char* text = std::getenv("NUBILO_WAIT_SCALE");
+  if (!text) return;
+  const double scale = std::strtod(text, nullptr);
+  if (scale < 0 || scale >= 1) return;
+  static ScaledSleeper sleeper(scale);
+  installSleeper(&sleeper);
+}
+
+}  // namespace
+
 int runCommandLine(int argc, char** argv) {
+  scaleWaitsFromEnvironment();
   CLI::App app{
       "Keeps this computer's contacts and calendars (vdir folders) in step with the "
       "other computers of an account, through a WebDAV share.",
@@ -56,6 +85,11 @@ int runCommandLine(int argc, char** argv) {
                    "Refuse to delete more than this percentage of a dataclass's items")
       ->check(CLI::Range(0, 100));
 
+  std::string repaired;
+  auto* repair = app.add_subcommand(
+      "repair", "Write this computer's copy of a dataclass to the share as its whole history");
+  repair->add_option("NAME", repaired, "The dataclass")->required();
+
   auto* conflicts = app.add_subcommand("conflicts", "List the kept losing values of conflicts");
   auto* status = app.add_subcommand("status", "Say what this computer syncs and how it went");
 
@@ -78,6 +112,12 @@ int runCommandLine(int argc, char** argv) {
                         output);
     if (*remove) return removeCommand(removed, output);
     if (*sync) return syncCommand(run, output);
+    if (*repair) {
+      RunRequest request;
+      request.dataclasses = {repaired};
+      request.repair = true;
+      return syncCommand(request, output);
+    }
     if (*conflicts) return conflictsCommand(output);
     if (*status) return statusCommand(output);
     if (launchSync) {

@@ -153,7 +153,7 @@ DataclassOutcome DataclassSync::run(const std::optional<DataclassRecord>& listed
   const bool serverLacksData =
       (!listed || !listed->maxversion) && (unsent || engine_.recordCount(dataclass) > 0);
 
-  if (!unsent && !serverMoved && !serverLacksData) {
+  if (!unsent && !serverMoved && !serverLacksData && !options_.repair) {
     if (!scanned.empty()) engine_.saveState(folderClient_, dataclass, scanned);
     writeFolder();
     return outcome_;
@@ -173,7 +173,12 @@ DataclassOutcome DataclassSync::run(const std::optional<DataclassRecord>& listed
       const Value status = session_.getClientInfo().get(dataclass + ".status");
       needsTruth = status.isString() && status.string() == "needstruth";
     }
-    const bool slow = remote.record.maxversion &&
+    if (options_.repair && remote.record.maxversion && network.index != remote.record.maxversion)
+      throw SyncFailure(FailureKind::Other,
+                        "This computer has not taken in every change of " + dataclass +
+                            " yet, so its copy cannot repair the share's; repair on a "
+                            "computer whose last sync of it succeeded.");
+    const bool slow = !options_.repair && remote.record.maxversion &&
                       (!network.index || remote.record.minversion != network.minversion ||
                        *remote.record.maxversion < *network.index || needsTruth);
     remote = fetch(slow, remote.record);
@@ -454,7 +459,8 @@ void DataclassSync::markOthersNeedingTruth() {
 }
 
 void DataclassSync::compactIfLong(Remote& remote) {
-  if (options_.dryRun || !outcome_.committedIndex) return;
+  if (options_.dryRun || (!outcome_.committedIndex && !options_.repair)) return;
+  if (!remote.record.maxversion) return;  // the first commit was the whole truth
   const std::string& dataclass = collection_.dataclass;
   const Dictionary& configuration = session_.configuration();
   const int64_t min = remote.record.minversion.value_or(1);
@@ -464,7 +470,7 @@ void DataclassSync::compactIfLong(Remote& remote) {
   if (maxCount <= 0) maxCount = 64;
   int64_t sizeFactor = configuration.get("compaction_size_factor").integer();
   if (sizeFactor <= 0) sizeFactor = 4;
-  bool compact = count > maxCount;
+  bool compact = options_.repair || count > maxCount;
   if (!compact && count >= 8) {
     // Bytes against the size of the data: the oldest changelog is the last
     // whole truth that was written.

@@ -26,6 +26,10 @@ struct SyncOptions {
   bool dryRun = false;
   int maxDeletePercent = 50;
   std::string computerName;  // this computer, named in conflicts
+  // Write this computer's whole truth as a reset commit (a damaged history
+  // is then never read again); only a computer that took in every
+  // changelog may.
+  bool repair = false;
 };
 
 struct DataclassOutcome {

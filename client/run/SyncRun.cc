@@ -29,6 +29,11 @@ std::string failureSentence(const std::string& dataclass, const NubiloException&
   if (e.name() == NubiloServerIncoherencyException)
     return "Another computer sent changes to " + dataclass +
            " at the same moment; the next sync takes them in first.";
+  if (e.name() == NubiloCorruptChangelogException ||
+      e.name() == NubiloFailedToDownloadChangelogException)
+    return "The share's copy of " + dataclass + " is damaged (" + e.reason().substr(0, 120) +
+           "); run `nubilosyncclient repair " + dataclass +
+           "` on a computer whose last sync of it succeeded.";
   return "Syncing " + dataclass + " failed: " + e.reason();
 }
 
@@ -97,6 +102,7 @@ RunResult runSync(const RunRequest& request) {
   SyncOptions options;
   options.dryRun = request.dryRun;
   options.maxDeletePercent = request.maxDeletePercent;
+  options.repair = request.repair;
   options.computerName = prefs.clientName().value_or("this computer");
   ConflictStore conflicts;
 

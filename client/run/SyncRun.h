@@ -16,6 +16,7 @@ struct RunRequest {
   bool dryRun = false;
   int maxDeletePercent = 50;
   bool periodic = false;  // started by the schedule
+  bool repair = false;    // see SyncOptions::repair
 };
 
 struct DataclassFailure {

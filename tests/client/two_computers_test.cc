@@ -6,11 +6,13 @@
 #include <cstdio>
 #include <filesystem>
 
+#include "VantorSyncManager/NubiloRemoteSession.h"
 #include "localshare/ApacheShare.h"
 #include "localshare/Computer.h"
 #include "support/TestHome.h"
 
 using testing::HasSubstr;
+using vtc::local::ApacheShare;
 using vtc::local::Computer;
 
 namespace {
@@ -195,6 +197,60 @@ TEST_F(Account, CompactionKeepsAnUnsentEditAndAComputerAwayThroughoutConverges) 
     EXPECT_EQ(contactsOf(*each)["ann.vcf"], card("ann", "Ann", "ann@example.org", "103"))
         << each->name();
   }
+}
+
+// A changelog damaged on the share ends in a plain sentence, not a loop of
+// downloads, until a computer whose copy is whole repairs the share.
+TEST_F(Account, ADamagedShareIsReportedOnceAndRepairedFromAWholeCopy) {
+  Computer::write(a.contacts() + "/ann.vcf", card("ann", "Ann", "ann@example.org", "1"));
+  sync(a);
+  Computer::write(a.contacts() + "/bob.vcf", card("bob", "Bob", "bob@example.org", "2"));
+  sync(a);
+  Computer::write(a.contacts() + "/cat.vcf", card("cat", "Cat", "cat@example.org", "3"));
+  sync(a);
+  const std::string second = share.diskPath("/sync/Schemas/com.korvo.Contacts/00002.clog");
+  const std::string saved = Computer::read(second);
+  Computer::write(second, saved.substr(0, saved.size() - 3));
+
+  Computer::Result damaged = b.run({"sync"});
+  EXPECT_EQ(damaged.status, 1);
+  EXPECT_THAT(damaged.err, HasSubstr("The share's copy of com.korvo.Contacts is damaged"));
+  EXPECT_THAT(damaged.err, HasSubstr("nubilosyncclient repair com.korvo.Contacts"));
+  const size_t requests = share.accessEntries().size();
+  Computer::Result again = b.run({"sync"});
+  EXPECT_THAT(again.err, HasSubstr("was found damaged and has not changed since"));
+  for (size_t i = requests; i < share.accessEntries().size(); ++i)
+    EXPECT_NE(share.accessEntries()[i].method, "GET");
+
+  // B's copy is not whole: it may not repair. A's is.
+  EXPECT_THAT(b.run({"repair", "com.korvo.Contacts"}).err,
+              HasSubstr("has not taken in every change"));
+  Computer::Result repaired = a.run({"repair", "com.korvo.Contacts"});
+  EXPECT_EQ(repaired.status, 0) << repaired.err;
+  EXPECT_THAT(repaired.out, HasSubstr("history compacted"));
+  EXPECT_THAT(sync(b).out, HasSubstr("(slow sync)"));
+  EXPECT_EQ(contactsOf(b).size(), 3u);
+  EXPECT_EQ(contactsOf(a), contactsOf(b));
+}
+
+// A commit cut short after it published its record: the record names a
+// changelog that is not there. The next computer repairs the record and
+// reads from minversion.
+TEST_F(Account, ARecordNamingAMissingChangelogIsRepairedAndReadFromMinversion) {
+  Computer::write(a.contacts() + "/ann.vcf", card("ann", "Ann", "ann@example.org", "1"));
+  sync(a);
+  vtc::Dictionary config = share.configuration();
+  config.set("sync_path", vtc::Value("/sync"));
+  auto session =
+      NubiloRemoteSession::sessionWithUsername(ApacheShare::kUser, ApacheShare::kPassword, config);
+  session->setInfoForDataclass(vtc::Dictionary{{"maxversion", "00002"}}, "com.korvo.Contacts");
+  EXPECT_THAT(sync(b).out, HasSubstr("(slow sync)"));
+  EXPECT_EQ(contactsOf(b), contactsOf(a));
+  Computer::write(b.contacts() + "/bob.vcf", card("bob", "Bob", "bob@example.org", "2"));
+  sync(b);
+  sync(a);
+  EXPECT_EQ(contactsOf(a).size(), 2u);
+  EXPECT_EQ(contactsOf(a), contactsOf(b));
 }
 
 // What people use every day: khard and khal write and read the folders.

@@ -52,6 +52,7 @@ std::vector<std::string> Computer::environment() const {
     env.push_back(entry);
   }
   env.push_back("HOME=" + home_);
+  env.push_back("NUBILO_WAIT_SCALE=0.001");  // protocol waits of a thousandth
   return env;
 }
 
