@@ -17,6 +17,7 @@
 #include "localshare/ApacheShare.h"
 #include "platform/dav/DavPaths.h"
 #include "platform/dav/TesselSession.h"
+#include "platform/fs/LocalPaths.h"
 
 namespace {
 
@@ -30,8 +31,9 @@ struct Fixture {
   std::string curlConfig;  // one url= line per changelog
 
   Fixture() {
-    char dir[] = "/tmp/vsm-transfer-bench-XXXXXX";
-    home = ::mkdtemp(dir);
+    std::string dir =
+        vtc::paths::join(vtc::paths::temporaryDirectory(), "vsm-transfer-bench-XXXXXX");
+    home = ::mkdtemp(dir.data());
     ::setenv("HOME", home.c_str(), 1);
     share = std::make_unique<vtc::local::ApacheShare>();
     session = open();

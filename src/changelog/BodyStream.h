@@ -19,7 +19,9 @@ class BodyStream {
  public:
   // Told which compressed bytes each inflate step used up.
   using Consumed = std::function<void(const uint8_t*, const uint8_t*)>;
-  static constexpr size_t kStep = 1 << 20;
+  // Small: bytes already read are dropped, so the window holds one record
+  // at a time, and most changelogs are a few kilobytes.
+  static constexpr size_t kStep = 64 << 10;
 
   // step: how much the window grows at a time.
   BodyStream(ByteView compressed, Consumed consumed, size_t step = kStep);
