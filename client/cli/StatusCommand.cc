@@ -24,6 +24,24 @@ std::string when(const std::optional<Date>& date) {
   return buf;
 }
 
+// A field's lines on one line: folding undone, line ends dropped.
+std::string shown(const Value& value) {
+  if (value.isNone()) return "(cleared)";
+  std::string text = textOf(value), out;
+  for (size_t i = 0; i < text.size(); ++i) {
+    if (text[i] == '\r') continue;
+    if (text[i] == '\n') {
+      if (i + 1 < text.size() && (text[i + 1] == ' ' || text[i + 1] == '\t'))
+        ++i;  // a folded line goes on
+      else if (i + 1 < text.size())
+        out += " | ";
+      continue;
+    }
+    out += text[i];
+  }
+  return out;
+}
+
 }  // namespace
 
 int statusCommand(Output& output) {
@@ -69,10 +87,9 @@ int conflictsCommand(Output& output) {
   }
   for (const KeptConflict& c : conflicts)
     output.out << c.id << "  " << c.dataclass << "  " << c.record << "  " << c.field << "\n"
-               << "    kept: " << (c.kept.isNone() ? "(cleared)" : textOf(c.kept)) << " from "
-               << c.keptComputer
-               << "\n    lost: " << (c.lost.isNone() ? "(cleared)" : textOf(c.lost)) << " from "
-               << c.lostComputer << ", " << when(c.date) << "\n";
+               << "    kept: " << shown(c.kept) << "  (from " << c.keptComputer << ")\n"
+               << "    lost: " << shown(c.lost) << "  (from " << c.lostComputer << ", "
+               << when(c.date) << ")\n";
   return 0;
 }
 
