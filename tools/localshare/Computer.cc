@@ -57,18 +57,19 @@ std::vector<std::string> Computer::environment() const {
 }
 
 pid_t Computer::start(const std::vector<std::string>& args) const {
+  return spawn(args, "/dev/null");
+}
+
+pid_t Computer::spawn(const std::vector<std::string>& args, const std::string& input) const {
   std::vector<std::string> argv{clientProgram()};
   argv.insert(argv.end(), args.begin(), args.end());
   std::vector<std::string> env = environment();
   const std::string out = home_ + "/.last-out", err = home_ + "/.last-err";
   pid_t pid = ::fork();
   if (pid == 0) {
-    int o = ::open(out.c_str(), O_WRONLY | O_CREAT | O_TRUNC, 0644);
-    int e = ::open(err.c_str(), O_WRONLY | O_CREAT | O_TRUNC, 0644);
-    int in = ::open("/dev/null", O_RDONLY);
-    ::dup2(in, 0);
-    ::dup2(o, 1);
-    ::dup2(e, 2);
+    ::dup2(::open(input.c_str(), O_RDONLY), 0);  // a file: never a terminal
+    ::dup2(::open(out.c_str(), O_WRONLY | O_CREAT | O_TRUNC, 0644), 1);
+    ::dup2(::open(err.c_str(), O_WRONLY | O_CREAT | O_TRUNC, 0644), 2);
     std::vector<char*> cargv, cenv;
     for (auto& a : argv) cargv.push_back(a.data());
     cargv.push_back(nullptr);
@@ -93,29 +94,9 @@ Computer::Result Computer::finish(pid_t pid) const {
 Computer::Result Computer::run(const std::vector<std::string>& args,
                                const std::string& input) const {
   if (input.empty()) return finish(start(args));
-  // With input: through a shell pipe, so the program reads a non-terminal.
   const std::string inputFile = home_ + "/.last-in";
   write(inputFile, input);
-  std::vector<std::string> shell{"/bin/sh", "-c", "exec \"$0\" \"$@\" < '" + inputFile + "'",
-                                 clientProgram()};
-  shell.insert(shell.end(), args.begin(), args.end());
-  std::vector<std::string> env = environment();
-  const std::string out = home_ + "/.last-out", err = home_ + "/.last-err";
-  pid_t pid = ::fork();
-  if (pid == 0) {
-    int o = ::open(out.c_str(), O_WRONLY | O_CREAT | O_TRUNC, 0644);
-    int e = ::open(err.c_str(), O_WRONLY | O_CREAT | O_TRUNC, 0644);
-    ::dup2(o, 1);
-    ::dup2(e, 2);
-    std::vector<char*> cargv, cenv;
-    for (auto& a : shell) cargv.push_back(a.data());
-    cargv.push_back(nullptr);
-    for (auto& v : env) cenv.push_back(v.data());
-    cenv.push_back(nullptr);
-    ::execve(cargv[0], cargv.data(), cenv.data());
-    ::_exit(127);
-  }
-  return finish(pid);
+  return finish(spawn(args, inputFile));
 }
 
 void Computer::join(const std::string& url, const std::string& user,

@@ -52,6 +52,8 @@ class Computer {
 
  private:
   std::vector<std::string> environment() const;
+  // Starts the client with standard input read from the file input.
+  pid_t spawn(const std::vector<std::string>& args, const std::string& input) const;
   std::string perHostFile() const;
   std::string name_;
   std::string home_;
