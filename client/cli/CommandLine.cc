@@ -2,6 +2,8 @@
 // statuses are a contract: scripts, jobs and pushes call them as they are.
 #include <CLI/CLI.hpp>
 
+#include <unistd.h>
+
 #include <cstdlib>
 #include <iostream>
 #include <thread>
@@ -45,6 +47,7 @@ int runCommandLine(int argc, char** argv) {
       "other computers of an account, through a WebDAV share.",
       "nubilosyncclient"};
   app.require_subcommand(0, 1);
+  app.fallthrough();  // -q and -v also after the command
 
   bool launchSync = false;
   bool periodic = false;
@@ -91,7 +94,15 @@ int runCommandLine(int argc, char** argv) {
   repair->add_option("NAME", repaired, "The dataclass")->required();
 
   auto* conflicts = app.add_subcommand("conflicts", "List the kept losing values of conflicts");
+  std::string conflictId;
+  auto* restoreConflict =
+      conflicts->add_subcommand("restore", "Make a losing value the current one (sent next sync)");
+  restoreConflict->add_option("ID", conflictId, "As `conflicts` lists it")->required();
+  auto* dropConflict = conflicts->add_subcommand("drop", "Forget a kept losing value");
+  dropConflict->add_option("ID", conflictId, "As `conflicts` lists it")->required();
+  bool statusJson = false;
   auto* status = app.add_subcommand("status", "Say what this computer syncs and how it went");
+  status->add_flag("--json", statusJson, "One JSON document, for scripts");
 
   try {
     app.parse(argc, argv);
@@ -100,7 +111,7 @@ int runCommandLine(int argc, char** argv) {
     return code == 0 ? 0 : static_cast<int>(FailureKind::Usage);
   }
 
-  Output output{std::cout, std::cerr, quiet ? 0 : (verbose ? 2 : 1)};
+  Output output{std::cout, std::cerr, quiet ? 0 : (verbose ? 2 : 1), ::isatty(STDOUT_FILENO) == 1};
   try {
     if (*setupCommandLine) {
       if (!passwordCommand.empty()) setup.passwordCommand = passwordCommand;
@@ -118,8 +129,12 @@ int runCommandLine(int argc, char** argv) {
       request.repair = true;
       return syncCommand(request, output);
     }
-    if (*conflicts) return conflictsCommand(output);
-    if (*status) return statusCommand(output);
+    if (*conflicts)
+      return conflictsCommand(*restoreConflict ? "restore"
+                              : *dropConflict  ? "drop"
+                                               : "",
+                              conflictId, output);
+    if (*status) return statusCommand(statusJson, output);
     if (launchSync) {
       RunRequest launched;
       launched.dataclasses = launchDataclasses;

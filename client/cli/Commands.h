@@ -14,7 +14,8 @@ namespace vtc::client {
 struct Output {
   std::ostream& out;
   std::ostream& err;
-  int verbosity = 1;  // 0 quiet, 1 normal, 2 verbose
+  int verbosity = 1;      // 0 quiet, 1 normal, 2 verbose
+  bool terminal = false;  // standard output is a terminal: progress and a line per dataclass
 };
 
 struct SetupRequest {
@@ -28,9 +29,10 @@ int setupCommand(const SetupRequest& request, Output& output);
 int addCommand(const std::string& kind, const std::string& folder,
                const std::optional<std::string>& dataclass, Output& output);
 int removeCommand(const std::string& dataclass, Output& output);
-int syncCommand(const RunRequest& request, Output& output);
-int conflictsCommand(Output& output);
-int statusCommand(Output& output);
+int syncCommand(RunRequest request, Output& output);
+// action: "" (list), "restore" or "drop", with the conflict id.
+int conflictsCommand(const std::string& action, const std::string& id, Output& output);
+int statusCommand(bool json, Output& output);
 
 // The whole command line; the entry point of nubilosyncclient.
 int runCommandLine(int argc, char** argv);

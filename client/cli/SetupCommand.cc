@@ -4,6 +4,7 @@
 
 #include <ostream>
 
+#include "VantorSyncManager/HostIdentity.h"
 #include "VantorSyncManager/NubiloException.h"
 #include "VantorSyncManager/PublicNames.h"
 #include "VantorSyncManager/VTCPrefsCenter.h"
@@ -11,6 +12,8 @@
 #include "client/cli/Terminal.h"
 #include "client/run/Account.h"
 #include "client/run/SyncFailure.h"
+#include "common/Clock.h"
+#include "common/Format.h"
 #include "common/Uuid.h"
 #include "prefs/ClientConfiguration.h"
 
@@ -25,15 +28,17 @@ std::string hostName() {
 }
 
 // What syncing needs of the share beyond a login: properties that stay
-// (the client record) and locks.
-void qualify(NubiloRemoteSession& session, const std::string& guid, const std::string& name,
-             const std::string& url) {
+// (the client record) and locks. Returns the client record as the share
+// keeps it.
+Dictionary qualify(NubiloRemoteSession& session, const std::string& guid, const std::string& name,
+                   const std::string& url) {
   try {
     session.registerClient(guid, name);
   } catch (const NubiloException& e) {
     if (e.name() != NubiloClientRegistrationException) throw;  // already registered: fine
   }
-  if (session.getClientInfo(guid).get("guid").string() != guid)
+  Dictionary record = session.getClientInfo(guid);
+  if (record.get("guid").string() != guid)
     throw SyncFailure(FailureKind::ServerUnsuitable,
                       "The server at " + url +
                           " does not keep WebDAV properties (PROPPATCH); syncing needs a "
@@ -47,6 +52,7 @@ void qualify(NubiloRemoteSession& session, const std::string& guid, const std::s
         "The server at " + url +
             " does not lock resources (WebDAV class 2); syncing needs locks: " + e.reason());
   }
+  return record;
 }
 
 }  // namespace
@@ -73,7 +79,12 @@ int setupCommand(const SetupRequest& request, Output& output) {
   configuration.set("ClientGuid", Value(guid));
   configuration.set("ClientName", Value(name));
   auto session = openSession(request.member, password, configuration);
-  qualify(*session, guid, name, server.url());
+  const Dictionary registered = qualify(*session, guid, name, server.url());
+  Dictionary record;
+  if (!registered.contains("firstsync"))
+    record.set("firstsync", Value(textOf(Value(currentClock().now()))));
+  if (auto machine = getHostUUIDString()) record.set("machineguid", Value(*machine));
+  session->patchClientInfo(record);
 
   AccountSetup setup{server, request.member, request.passwordCommand};
   storeAccount(setup, password, guid, name);

@@ -1,8 +1,11 @@
-// `sync [NAME...]` and the launch form `--sync`: one line per dataclass,
-// and a plain sentence on standard error for each failure.
+// `sync [NAME...]` and the launch form `--sync`. On a terminal: a progress
+// line while it works, then a line per dataclass; elsewhere one line for the
+// whole run. Every failure is a plain sentence on standard error.
+#include <memory>
 #include <ostream>
 
 #include "client/cli/Commands.h"
+#include "client/cli/ProgressLine.h"
 
 namespace vtc::client {
 
@@ -33,16 +36,48 @@ std::string describe(const DataclassOutcome& o, bool dryRun) {
   return line;
 }
 
+// Off a terminal (a job, a push) one line says it all.
+std::string summary(const RunResult& result, bool dryRun) {
+  size_t sent = 0, received = 0, written = 0, conflicts = 0, skipped = 0, compacted = 0;
+  for (const DataclassOutcome& o : result.outcomes) {
+    compacted += o.compacted;
+    sent += o.sentChanges;
+    received += o.receivedChanges;
+    written += o.filesWritten;
+    conflicts += o.conflicts;
+    skipped += o.filesSkipped;
+  }
+  std::string line = (dryRun ? "Dry run of " : "Synced ") +
+                     counted(result.outcomes.size() - result.failures.size(), "folder", "folders");
+  line += (dryRun ? ": would send " : ": sent ") + counted(sent, "change", "changes") +
+          ", received " + counted(received, "change", "changes") + ", wrote " +
+          counted(written, "file", "files");
+  if (conflicts) line += ", kept " + counted(conflicts, "conflict", "conflicts");
+  if (skipped) line += ", " + counted(skipped, "file", "files") + " left for the next sync";
+  if (compacted) line += ", history compacted";
+  if (!result.failures.empty())
+    line += "; " + counted(result.failures.size(), "failure", "failures");
+  return line + ".";
+}
+
 }  // namespace
 
-int syncCommand(const RunRequest& request, Output& output) {
+int syncCommand(RunRequest request, Output& output) {
+  std::unique_ptr<ProgressLine> progress;
+  if (output.terminal && output.verbosity > 0) {
+    progress = std::make_unique<ProgressLine>(stderr);
+    request.progress = progress.get();
+  }
   RunResult result = runSync(request);
+  progress.reset();
+  const bool perDataclass = output.verbosity > 1 || (output.terminal && output.verbosity > 0);
   for (const DataclassOutcome& outcome : result.outcomes) {
     bool failed = false;
     for (const DataclassFailure& f : result.failures)
       failed = failed || f.dataclass == outcome.dataclass;
-    if (!failed && output.verbosity > 0) output.out << describe(outcome, request.dryRun) << "\n";
+    if (!failed && perDataclass) output.out << describe(outcome, request.dryRun) << "\n";
   }
+  if (!perDataclass && output.verbosity > 0) output.out << summary(result, request.dryRun) << "\n";
   for (const DataclassFailure& failure : result.failures)
     output.err << "nubilosyncclient: " << failure.sentence << "\n";
   return result.exitStatus();

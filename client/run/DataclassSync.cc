@@ -116,6 +116,10 @@ engine::PushOptions DataclassSync::pushOptions(const std::string& origin,
   return options;
 }
 
+void DataclassSync::report(const char* what, size_t done, size_t total, int64_t bytes) {
+  if (options_.progress) options_.progress->step(collection_.dataclass, what, done, total, bytes);
+}
+
 DataclassOutcome DataclassSync::run(const std::optional<DataclassRecord>& listed) {
   const std::string& dataclass = collection_.dataclass;
   if (!folder_.exists())
@@ -130,6 +134,7 @@ DataclassOutcome DataclassSync::run(const std::optional<DataclassRecord>& listed
   // last seen, which are loaded for them alone.
   std::map<std::string, ItemState> known = knownFiles(engine_, folderClient_, dataclass);
   const size_t knownCount = known.size();
+  report("reading the folder", 0, knownCount);
   const ScanResult scan = folder_.scan(std::move(known));
   std::vector<std::string> reread;
   for (const auto& [name, fields] : scan.changed) reread.push_back(name);
@@ -304,7 +309,16 @@ DataclassSync::Remote DataclassSync::fetch(bool slow, const DataclassRecord& rec
 
   vtc::ChangeLogFetchResult fetched;
   try {
-    fetched = session_.fetchChangeLogsForDataclass(dataclass, from, to);
+    // In pieces, so that progress can be told between them.
+    constexpr int64_t kPiece = 64;
+    for (int64_t start = from; start <= to; start += kPiece) {
+      report("receiving", static_cast<size_t>(start - from), static_cast<size_t>(to - from + 1),
+             fetched.StorageConsumed);
+      auto piece =
+          session_.fetchChangeLogsForDataclass(dataclass, start, std::min(to, start + kPiece - 1));
+      fetched.StorageConsumed += piece.StorageConsumed;
+      for (auto& [index, log] : piece.changeLogs) fetched.changeLogs[index] = std::move(log);
+    }
   } catch (const NubiloException& e) {
     const bool damaged = e.name() == NubiloCorruptChangelogException ||
                          e.name() == NubiloFailedToDownloadChangelogException;
@@ -368,7 +382,9 @@ void DataclassSync::applyRemote(Remote& remote, const engine::PullResult& pendin
   if (remote.changelogs.empty()) return;
   const int64_t last = remote.changelogs.rbegin()->first;
   if (!remote.slow) {
+    size_t applied = 0;
     for (const auto& [index, log] : remote.changelogs) {
+      report("taking in changes", applied++, remote.changelogs.size());
       const std::vector<SyncEngineChange>& changes = log->changes();
       std::string origin = log->headerValueForKey("CreatorClientName").string();
       NetworkState after{index, remote.record.minversion};
@@ -431,6 +447,7 @@ void DataclassSync::commit(Remote& remote) {
   }
   outcome_.sentChanges = changes.size();
   if (options_.dryRun) return;
+  report("sending", 0, changes.size());
   const int64_t index = firstCommit ? 1 : *remote.record.maxversion + 1;
   // The lock is renewed first: a lock that expired (this computer slept)
   // fails here, before anything is written.
@@ -534,7 +551,9 @@ void DataclassSync::writeFolder() {
   std::set<std::string> named;
   // Made durable together at the end, before the engine hears of them.
   folder_.deferFlushes(true);
+  size_t handled = 0;
   for (const SyncEngineChange& change : pulled.changes) {
+    if ((handled++ & 63) == 0) report("writing files", handled - 1, pulled.changes.size());
     const std::string& name = change.recordIdentifier();
     named.insert(name);
     // A name from another computer becomes a file name here: only a plain

@@ -16,6 +16,7 @@
 #include "client/run/Collections.h"
 #include "client/run/ConflictStore.h"
 #include "client/run/HeldLocks.h"
+#include "client/run/Progress.h"
 #include "client/run/ServerView.h"
 #include "client/stores/VdirCollection.h"
 #include "platform/engine/SyncEngine.h"
@@ -30,6 +31,7 @@ struct SyncOptions {
   // is then never read again); only a computer that took in every
   // changelog may.
   bool repair = false;
+  Progress* progress = nullptr;  // told how far the sync has come, when set
 };
 
 struct DataclassOutcome {
@@ -80,6 +82,7 @@ class DataclassSync {
   void markOthersNeedingTruth();
   void writeFolder();
   engine::PushOptions pushOptions(const std::string& origin, engine::StateUpdate state = {});
+  void report(const char* what, size_t done, size_t total, int64_t bytes = 0);
 
   NubiloRemoteSession& session_;
   engine::SyncEngine& engine_;

@@ -5,14 +5,18 @@
 #include <chrono>
 
 #include "VantorSyncManager/Diagnostics.h"
+#include "VantorSyncManager/HostIdentity.h"
 #include "VantorSyncManager/NubiloException.h"
 #include "VantorSyncManager/PublicNames.h"
 #include "VantorSyncManager/SyncStatus.h"
 #include "VantorSyncManager/VTCPrefsCenter.h"
 #include "client/run/Account.h"
+#include "client/run/StatusReport.h"
 #include "client/run/SyncOwner.h"
 #include "common/Clock.h"
+#include "common/Format.h"
 #include "common/Logging.h"
+#include "platform/prefs/PreferenceStore.h"
 
 namespace vtc::client {
 
@@ -51,6 +55,13 @@ Dictionary summaryEntry(const DataclassOutcome& o, Date start, Date end, const s
                    {"SyncMode", o.mode}};
   if (error) entry.set("Error", Value(*error));
   return entry;
+}
+
+void rememberLastError(const std::string& dataclass, const std::string* sentence) {
+  auto& store = prefs::PreferenceStore::shared();
+  store.setValue(lastErrorKey(dataclass), sentence ? Value(*sentence) : Value(), kVantorDefaultsKey,
+                 prefs::Scope::CurrentHost);
+  store.synchronize(kVantorDefaultsKey, prefs::Scope::CurrentHost);
 }
 
 }  // namespace
@@ -103,6 +114,7 @@ RunResult runSync(const RunRequest& request) {
   options.dryRun = request.dryRun;
   options.maxDeletePercent = request.maxDeletePercent;
   options.repair = request.repair;
+  options.progress = request.progress;
   options.computerName = prefs.clientName().value_or("this computer");
   ConflictStore conflicts;
 
@@ -134,10 +146,14 @@ RunResult runSync(const RunRequest& request) {
       }
       if (failure) outcome = sync.outcome();
       usedServer = usedServer || outcome.usedServer;
-      if (!request.dryRun) prefs.setSyncSuccessful(!failure, collection.dataclass);
+      if (!request.dryRun) {
+        prefs.setSyncSuccessful(!failure, collection.dataclass);
+        rememberLastError(collection.dataclass, failure ? &failure->sentence : nullptr);
+      }
       summary.set(collection.dataclass,
                   Value(summaryEntry(outcome, start, currentClock().now(),
                                      failure ? &failure->sentence : nullptr)));
+      if (request.progress) request.progress->done(collection.dataclass);
       result.outcomes.push_back(outcome);
       if (failure) {
         result.failures.push_back(*failure);
@@ -163,6 +179,11 @@ RunResult runSync(const RunRequest& request) {
     }
     VTCLogStatistics(statistics);
     session->sendReportingInfo(summary);
+    // For the other computers' status: when this one last synced, and which
+    // report is its own. Not judged: it only informs.
+    Dictionary record{{"lastsync", textOf(Value(currentClock().now()))}};
+    if (auto machine = getHostUUIDString()) record.set("machineguid", Value(*machine));
+    session->patchClientInfo(record);
   }
   if (!request.dryRun && result.failures.empty())
     prefs.setLastSuccessfulSyncDate(currentClock().now());

@@ -17,6 +17,7 @@ struct RunRequest {
   int maxDeletePercent = 50;
   bool periodic = false;  // started by the schedule
   bool repair = false;    // see SyncOptions::repair
+  Progress* progress = nullptr;
 };
 
 struct DataclassFailure {

@@ -143,4 +143,10 @@ std::optional<std::string> VdirCollection::read(const std::string& name) const {
   return readWhole(file.get());
 }
 
+std::optional<ItemState> VdirCollection::stat(const std::string& name) const {
+  struct stat st {};
+  if (::stat(paths::join(folder_, name).c_str(), &st) != 0) return std::nullopt;
+  return fileState(st);
+}
+
 }  // namespace vtc::client

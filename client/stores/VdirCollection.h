@@ -95,6 +95,8 @@ class VdirCollection {
   bool flush() const;
   // The bytes of an item file; none when it cannot be read.
   std::optional<std::string> read(const std::string& name) const;
+  // The state of an item file as it is now (no fields); none when it is gone.
+  std::optional<ItemState> stat(const std::string& name) const;
 
  private:
   std::string folder_;

@@ -150,7 +150,7 @@ TEST_F(Interrupted, AFileEditedWhileTheSyncWritesItIsKeptAndMergedNextTime) {
   Computer::write(b.contacts() + "/p1.vcf", card(1, "200"));
   sync(b);
   proxy.delay({"LOCK", "", 1}, 400);
-  pid_t pid = a.start({"sync"});
+  pid_t pid = a.start({"sync", "-v"});
   ASSERT_TRUE(vtc::local::waitUntil([&] { return !proxy.requests().empty(); }));
   ASSERT_TRUE(vtc::local::waitUntil([&] {
     for (const auto& seen : proxy.requests())

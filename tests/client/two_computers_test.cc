@@ -37,7 +37,7 @@ class Account : public ::testing::Test {
   }
   // Syncs and expects success; the output for further checks.
   Computer::Result sync(const Computer& c, std::vector<std::string> more = {}) {
-    std::vector<std::string> args{"sync"};
+    std::vector<std::string> args{"sync", "-v"};  // a line per dataclass, as on a terminal
     args.insert(args.end(), more.begin(), more.end());
     Computer::Result r = c.run(args);
     EXPECT_EQ(r.status, 0) << c.name() << ": " << r.err << r.out;
@@ -103,7 +103,7 @@ TEST_F(Account, ADryRunSaysWhatWouldHappenAndWritesNothingAnywhere) {
   sync(a);
   Computer::write(b.contacts() + "/cat.vcf", card("cat", "Cat", "cat@example.org", "3"));
   const size_t requests = share.accessEntries().size();
-  Computer::Result dry = b.run({"sync", "--dry-run"});
+  Computer::Result dry = b.run({"sync", "--dry-run", "-v"});
   EXPECT_EQ(dry.status, 0) << dry.err;
   EXPECT_THAT(dry.out, HasSubstr("com.korvo.Contacts (dry run): would send 1 change, receive 1 "
                                  "change and write 1 file"));

@@ -4,13 +4,14 @@
 #include <sys/wait.h>
 #include <unistd.h>
 
+#include <algorithm>
 #include <filesystem>
 #include <fstream>
 #include <sstream>
 #include <stdexcept>
 
+#include "common/Uuid.h"
 #include "platform/fs/LocalPaths.h"
-#include "platform/os/HostIdentity.h"
 #include "platform/plist/PlistCodec.h"
 
 extern char** environ;
@@ -24,13 +25,20 @@ std::string clientProgram() {
 Computer::Computer(const std::string& name) : name_(name) {
   std::string tmpl = paths::join(paths::temporaryDirectory(), "vsm-computer-XXXXXX");
   home_ = ::mkdtemp(tmpl.data());
+  // A machine of its own: per-host files and the host UUID of reports.
+  std::string id = makeUUIDString();
+  id.erase(std::remove(id.begin(), id.end(), '-'), id.end());
+  std::transform(id.begin(), id.end(), id.begin(),
+                 [](unsigned char c) { return static_cast<char>(std::tolower(c)); });
+  machineId_ = id;
+  write(home_ + "/.machine-id", id + "\n");
   std::filesystem::create_directories(std::filesystem::path(perHostFile()).parent_path());
   plist::writeFileAtomically(perHostFile(),
                              Value(Dictionary{{"ClientName", name}, {"LoggingLevel", "info"}}));
 }
 
 std::string Computer::perHostFile() const {
-  return home_ + "/Library/Preferences/ByHost/com.korvo.VantorSync." + os::machineId() + ".plist";
+  return home_ + "/Library/Preferences/ByHost/com.korvo.VantorSync." + machineId_ + ".plist";
 }
 
 void Computer::setPreference(const std::string& key, const Value& value) const {
@@ -48,10 +56,12 @@ std::vector<std::string> Computer::environment() const {
   std::vector<std::string> env;
   for (char** e = environ; *e; ++e) {
     std::string entry = *e;
-    if (entry.starts_with("HOME=") || entry.starts_with("XDG_")) continue;
+    if (entry.starts_with("HOME=") || entry.starts_with("XDG_") || entry.starts_with("NUBILO_"))
+      continue;
     env.push_back(entry);
   }
   env.push_back("HOME=" + home_);
+  env.push_back("NUBILO_MACHINE_ID_FILE=" + home_ + "/.machine-id");
   env.push_back("NUBILO_WAIT_SCALE=0.001");  // protocol waits of a thousandth
   return env;
 }

@@ -57,6 +57,7 @@ class Computer {
   std::string perHostFile() const;
   std::string name_;
   std::string home_;
+  std::string machineId_;
 };
 
 // The path of the built nubilosyncclient.

@@ -7,7 +7,10 @@
 
 namespace vtc::os {
 
-// /etc/machine-id, 32 lower-case hex digits; empty when unreadable.
+// /etc/machine-id, 32 lower-case hex digits; empty when unreadable. The
+// environment variable NUBILO_MACHINE_ID_FILE names another file, for homes
+// on one machine that stand for computers of their own (demo, tests); the
+// host UUID then comes from it too.
 std::string machineId();
 
 // The host's hardware UUID in upper-case 8-4-4-4-12 text: the firmware's

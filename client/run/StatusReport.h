@@ -1,0 +1,57 @@
+// What `status` says, gathered once and shown as text or as JSON: this
+// computer's folders and how their syncs went, the share's view of each,
+// every computer of the account with its last report, the kept conflicts,
+// and whether a sync runs now.
+#pragma once
+
+#include <cstdint>
+#include <optional>
+#include <string>
+#include <vector>
+
+#include "VantorSyncManager/Value.h"
+#include "client/run/ConflictStore.h"
+#include "client/run/SyncFailure.h"
+
+namespace vtc::client {
+
+struct DataclassStatus {
+  std::string name;
+  std::string kind;
+  std::string folder;
+  int64_t items = 0;  // files this computer's folder held at its last sync
+  std::optional<Date> lastAttempt, lastSuccess;
+  int64_t failedCount = 0;
+  std::optional<std::string> lastError;
+  // The share's view (when it could be asked).
+  std::optional<int64_t> minversion, maxversion;
+  std::optional<std::string> serverStatus;  // this computer's status there, "needstruth" say
+};
+
+struct ComputerStatus {
+  std::string name;
+  std::string guid;
+  bool thisComputer = false;
+  std::optional<std::string> lastSync;  // as the computer wrote it
+  Dictionary report;                    // its last sync report, when it left one
+};
+
+struct StatusReport {
+  bool setUp = false;
+  std::string computerName, computerGuid, member, server;
+  std::optional<int> runningPid;  // a sync runs now, in this process
+  std::vector<DataclassStatus> dataclasses;
+  std::vector<ComputerStatus> computers;
+  std::vector<KeptConflict> conflicts;
+  // Why the share could not be asked, when it could not.
+  std::optional<std::string> serverError;
+  std::optional<FailureKind> serverErrorKind;
+};
+
+// Never raises for the share: a failure there is in serverError.
+StatusReport gatherStatus();
+
+// The per-host key of a dataclass's last failure sentence.
+std::string lastErrorKey(const std::string& dataclass);
+
+}  // namespace vtc::client
