@@ -69,6 +69,8 @@ int runCommandLine(int argc, char** argv) {
   setupCommandLine->add_option("--user", setup.member, "The member name")->required();
   setupCommandLine->add_option("--password-command", passwordCommand,
                                "A command whose first output line is the password");
+  setupCommandLine->add_flag("--password-stdin", setup.passwordFromStdin,
+                             "Read the password from standard input (for scripts)");
 
   std::string kind, folder, dataclass;
   auto* add = app.add_subcommand("add", "Sync a vdir folder of contacts or calendars");

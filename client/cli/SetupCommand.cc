@@ -2,6 +2,7 @@
 // stores the account and turns syncing on.
 #include <unistd.h>
 
+#include <iostream>
 #include <ostream>
 
 #include "VantorSyncManager/HostIdentity.h"
@@ -64,6 +65,11 @@ int setupCommand(const SetupRequest& request, Output& output) {
   std::string password;
   if (request.passwordCommand) {
     password = passwordFromCommand(*request.passwordCommand);
+  } else if (request.passwordFromStdin) {
+    std::string line;
+    if (std::getline(std::cin, line) && !line.empty() && line.back() == '\r') line.pop_back();
+    if (line.empty()) throw SyncFailure(FailureKind::Usage, "No password came on standard input.");
+    password = line;
   } else {
     auto typed = readPassword("Password for " + request.member + " at " + server.url() + ": ");
     if (!typed || typed->empty()) throw SyncFailure(FailureKind::Usage, "No password was given.");

@@ -134,7 +134,9 @@ std::pair<std::string, std::string> storedCredentials() {
   if (!member)
     throw SyncFailure(FailureKind::Login,
                       "No account is set up; run `nubilosyncclient setup URL --user NAME`.");
-  const Value command = perUser(kPasswordCommandKey);
+  // Per-host first: one computer of a shared home can keep its own.
+  const Value command =
+      PreferenceStore::shared().copyAppValue(kPasswordCommandKey, kVantorDefaultsKey);
   if (command.isString() && !command.string().empty())
     return {*member, passwordFromCommand(command.string())};
   std::string why;

@@ -1,0 +1,183 @@
+// The client as people live with it, through its commands and their output:
+// status (and its JSON) before the first sync, after a good and a failed
+// one and with a conflict pending; a conflict restored here taking effect
+// on the other computer; the sentence and exit status of each failure.
+#include <gmock/gmock.h>
+#include <nlohmann/json.hpp>
+
+#include <filesystem>
+
+#include "localshare/ApacheShare.h"
+#include "localshare/Computer.h"
+#include "localshare/Processes.h"
+#include "support/SessionBus.h"
+#include "support/TestHome.h"
+
+using testing::HasSubstr;
+using vtc::local::ApacheShare;
+using vtc::local::Computer;
+
+namespace {
+
+std::string card(const std::string& uid, const std::string& fn, const std::string& tel) {
+  return "BEGIN:VCARD\r\nVERSION:3.0\r\nUID:" + uid + "\r\nFN:" + fn + "\r\nTEL:" + tel +
+         "\r\nEND:VCARD\r\n";
+}
+
+class Living : public ::testing::Test {
+ protected:
+  vtc::test::TestHome home;
+  ApacheShare share;
+  std::string url = "http://127.0.0.1:" + std::to_string(share.port()) + "/sync";
+  Computer a{"Mac A"};
+  Computer b{"Mac B"};
+
+  void SetUp() override {
+    a.join(url, ApacheShare::kUser, ApacheShare::kPassword);
+    b.join(url, ApacheShare::kUser, ApacheShare::kPassword);
+  }
+  nlohmann::json status(const Computer& c) {
+    Computer::Result r = c.run({"status", "--json"});
+    return nlohmann::json::parse(r.out);
+  }
+  const nlohmann::json& contacts(const nlohmann::json& s) { return s["dataclasses"][0]; }
+};
+
+TEST_F(Living, StatusBeforeAfterAGoodAndAFailedSyncAndWithAConflict) {
+  // Before the first sync: the folders, nothing on the share yet.
+  Computer::Result text = a.run({"status"});
+  EXPECT_EQ(text.status, 0) << text.err;
+  EXPECT_THAT(text.out, HasSubstr("This computer: Mac A"));
+  EXPECT_THAT(text.out, HasSubstr("com.korvo.Contacts (contacts): " + a.contacts()));
+  EXPECT_THAT(text.out, HasSubstr("last sync never"));
+  nlohmann::json s = status(a);
+  EXPECT_EQ(contacts(s)["lastSuccess"], nullptr);
+  EXPECT_EQ(contacts(s)["share"]["maxversion"], nullptr);
+  EXPECT_EQ(s["computers"].size(), 2u);
+
+  // After a good sync: counts, dates, the share's versions and the report.
+  Computer::write(a.contacts() + "/ann.vcf", card("ann", "Ann", "1"));
+  Computer::write(a.contacts() + "/bob.vcf", card("bob", "Bob", "2"));
+  ASSERT_EQ(a.run({"sync"}).status, 0);
+  s = status(a);
+  EXPECT_EQ(contacts(s)["items"], 2);
+  EXPECT_NE(contacts(s)["lastSuccess"], nullptr);
+  EXPECT_EQ(contacts(s)["share"]["maxversion"], 1);
+  EXPECT_EQ(contacts(s)["failedCount"], 0);
+  for (const auto& computer : s["computers"]) {
+    if (computer["name"] != "Mac A") continue;
+    EXPECT_TRUE(computer["thisComputer"].get<bool>());
+    EXPECT_NE(computer["lastSync"], nullptr);
+    EXPECT_EQ(computer["lastReport"]["com.korvo.Contacts:code"], "0");
+    EXPECT_EQ(computer["lastReport"]["SyncStatus:syncType"], "manual");
+  }
+  EXPECT_THAT(b.run({"status"}).out, HasSubstr("Mac A: last sync 20"));
+
+  // After a failed sync: the count and the sentence, here and in B's view of A.
+  std::filesystem::remove_all(a.contacts());
+  EXPECT_EQ(a.run({"sync"}).status, 1);
+  s = status(a);
+  EXPECT_EQ(contacts(s)["failedCount"], 1);
+  EXPECT_THAT(contacts(s)["lastError"].get<std::string>(), HasSubstr("is missing"));
+  EXPECT_THAT(a.run({"status"}).out, HasSubstr("1 failed sync since: The folder"));
+  std::filesystem::create_directories(a.contacts());
+  Computer::write(a.contacts() + "/ann.vcf", card("ann", "Ann", "1"));
+  Computer::write(a.contacts() + "/bob.vcf", card("bob", "Bob", "2"));
+
+  // With a conflict pending: listed in both forms.
+  ASSERT_EQ(b.run({"sync"}).status, 0);
+  Computer::write(a.contacts() + "/ann.vcf", card("ann", "Ann", "100"));
+  Computer::write(b.contacts() + "/ann.vcf", card("ann", "Ann", "200"));
+  ASSERT_EQ(a.run({"sync"}).status, 0);
+  ASSERT_EQ(b.run({"sync"}).status, 0);
+  EXPECT_THAT(b.run({"status"}).out, HasSubstr("1 conflict kept"));
+  s = status(b);
+  ASSERT_EQ(s["conflicts"].size(), 1u);
+  EXPECT_EQ(s["conflicts"][0]["field"], "TEL");
+  EXPECT_EQ(s["conflicts"][0]["lost"], "TEL:200\r\n");
+  EXPECT_EQ(s["conflicts"][0]["keptComputer"], "Mac A");
+}
+
+TEST_F(Living, ARestoredConflictTakesEffectOnTheOtherComputerAndADroppedOneIsGone) {
+  Computer::write(a.contacts() + "/ann.vcf", card("ann", "Ann", "1"));
+  ASSERT_EQ(a.run({"sync"}).status, 0);
+  ASSERT_EQ(b.run({"sync"}).status, 0);
+  Computer::write(a.contacts() + "/ann.vcf", card("ann", "Ann A", "100"));
+  Computer::write(b.contacts() + "/ann.vcf", card("ann", "Ann B", "200"));
+  ASSERT_EQ(a.run({"sync"}).status, 0);
+  ASSERT_EQ(b.run({"sync"}).status, 0);
+  auto conflicts = status(b)["conflicts"];
+  ASSERT_EQ(conflicts.size(), 2u);
+  std::string tel, fn;
+  for (const auto& c : conflicts) (c["field"] == "TEL" ? tel : fn) = c["id"].get<std::string>();
+
+  Computer::Result restored = b.run({"conflicts", "restore", tel});
+  EXPECT_EQ(restored.status, 0) << restored.err;
+  EXPECT_THAT(restored.out, HasSubstr("Restored TEL of ann.vcf"));
+  EXPECT_EQ(b.run({"conflicts", "drop", fn}).status, 0);
+  EXPECT_THAT(b.run({"conflicts"}).out, HasSubstr("No conflicts"));
+  EXPECT_EQ(b.run({"conflicts", "drop", fn}).status, 2);
+
+  ASSERT_EQ(b.run({"sync"}).status, 0);
+  ASSERT_EQ(a.run({"sync"}).status, 0);
+  EXPECT_EQ(Computer::read(a.contacts() + "/ann.vcf"), card("ann", "Ann A", "200"));
+  EXPECT_EQ(Computer::files(a.contacts()), Computer::files(b.contacts()));
+}
+
+TEST_F(Living, EachFailureIsOnePlainSentenceWithAnExitStatusOfItsKind) {
+  // A refused login says how to store the right password, once.
+  Computer wrong{"Mac W"};
+  Computer::Result login =
+      wrong.run({"setup", url, "--user", ApacheShare::kUser, "--password-command", "printf nope"});
+  EXPECT_EQ(login.status, 3);
+  EXPECT_THAT(login.err, HasSubstr("refused the password for alice; store the right one with "
+                                   "`nubilosyncclient setup`"));
+  const size_t requests = share.accessEntries().size();
+  a.setPreference("PasswordCommand", vtc::Value("printf nope"));  // a password changed elsewhere
+  EXPECT_EQ(a.run({"sync"}).status, 3);
+  EXPECT_LE(share.accessEntries().size() - requests, 2u);  // no retrying in a loop
+
+  // An unreachable server names its address.
+  Computer away{"Mac U"};
+  const int closed = vtc::local::freeLoopbackPort();
+  Computer::Result unreachable = away.run({"setup", "http://127.0.0.1:" + std::to_string(closed),
+                                           "--user", "alice", "--password-command", "printf x"});
+  EXPECT_EQ(unreachable.status, 4);
+  EXPECT_THAT(unreachable.err,
+              HasSubstr("Cannot reach the server at http://127.0.0.1:" + std::to_string(closed)));
+
+  // Bad input on the command line.
+  EXPECT_EQ(b.run({"add", "addresses", b.home() + "/x"}).status, 2);
+  Computer::Result second = b.run({"add", "contacts", b.home() + "/work"});
+  EXPECT_EQ(second.status, 2);
+  EXPECT_THAT(second.err, HasSubstr("give this folder a name of its own with --dataclass NAME"));
+  EXPECT_EQ(b.run({"add", "contacts", b.home() + "/work", "--dataclass", "work.Contacts"}).status,
+            0);
+  EXPECT_EQ(b.run({"setup", "ftp://host", "--user", "x"}).status, 2);
+  Computer fresh{"Mac F"};
+  Computer::Result notSetUp = fresh.run({"sync"});
+  EXPECT_EQ(notSetUp.status, 2);
+  EXPECT_THAT(notSetUp.err, HasSubstr("run `nubilosyncclient setup URL --user NAME`"));
+}
+
+TEST_F(Living, APasswordFromStandardInputGoesToTheSecretServiceAndNowhereElse) {
+  vtc::test::SessionBus bus;
+  bus.startKeyring();
+  Computer c{"Mac S"};
+  Computer::Result r = c.run({"setup", url, "--user", ApacheShare::kUser, "--password-stdin"},
+                             std::string(ApacheShare::kPassword) + "\n");
+  ASSERT_EQ(r.status, 0) << r.err;
+  ASSERT_EQ(c.run({"add", "contacts", c.contacts()}).status, 0);
+  Computer::write(c.contacts() + "/ann.vcf", card("ann", "Ann", "1"));
+  Computer::Result synced = c.run({"sync"});
+  EXPECT_EQ(synced.status, 0) << synced.err;
+  // Not in any file the client wrote: preferences, log, statistics, engine.
+  for (const auto& entry : std::filesystem::recursive_directory_iterator(c.home())) {
+    if (!entry.is_regular_file() || entry.path().filename() == ".last-in") continue;
+    EXPECT_EQ(Computer::read(entry.path().string()).find(ApacheShare::kPassword), std::string::npos)
+        << entry.path();
+  }
+  EXPECT_THAT(c.run({"status", "--json"}).out, testing::Not(HasSubstr(ApacheShare::kPassword)));
+}
+
+}  // namespace
