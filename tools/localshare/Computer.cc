@@ -1,6 +1,7 @@
 #include "localshare/Computer.h"
 
 #include <fcntl.h>
+#include <pty.h>
 #include <sys/wait.h>
 #include <unistd.h>
 
@@ -107,6 +108,32 @@ Computer::Result Computer::run(const std::vector<std::string>& args,
   const std::string inputFile = home_ + "/.last-in";
   write(inputFile, input);
   return finish(spawn(args, inputFile));
+}
+
+Computer::Result Computer::runOnTerminal(const std::vector<std::string>& args) const {
+  std::vector<std::string> argv{clientProgram()};
+  argv.insert(argv.end(), args.begin(), args.end());
+  std::vector<std::string> env = environment();
+  env.push_back("TERM=xterm");
+  int terminal = -1;
+  pid_t pid = ::forkpty(&terminal, nullptr, nullptr, nullptr);
+  if (pid == 0) {
+    std::vector<char*> cargv, cenv;
+    for (auto& a : argv) cargv.push_back(a.data());
+    cargv.push_back(nullptr);
+    for (auto& v : env) cenv.push_back(v.data());
+    cenv.push_back(nullptr);
+    ::execve(cargv[0], cargv.data(), cenv.data());
+    ::_exit(127);
+  }
+  Result r;
+  char buffer[4096];
+  for (ssize_t n; (n = ::read(terminal, buffer, sizeof buffer)) > 0;) r.out.append(buffer, n);
+  ::close(terminal);
+  int status = 0;
+  ::waitpid(pid, &status, 0);
+  r.status = WIFEXITED(status) ? WEXITSTATUS(status) : 128 + WTERMSIG(status);
+  return r;
 }
 
 void Computer::join(const std::string& url, const std::string& user,

@@ -34,6 +34,9 @@ class Computer {
 
   // Runs nubilosyncclient with these arguments and waits for it.
   Result run(const std::vector<std::string>& args, const std::string& input = {}) const;
+  // Runs it on a pseudo-terminal, as a person at a terminal would; out holds
+  // everything it drew there.
+  Result runOnTerminal(const std::vector<std::string>& args) const;
   // Starts it without waiting; finish() waits and collects.
   pid_t start(const std::vector<std::string>& args) const;
   Result finish(pid_t pid) const;
