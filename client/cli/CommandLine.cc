@@ -71,16 +71,20 @@ int runCommandLine(int argc, char** argv) {
                                "A command whose first output line is the password");
   setupCommandLine->add_flag("--password-stdin", setup.passwordFromStdin,
                              "Read the password from standard input (for scripts)");
+  setupCommandLine->footer(
+      "Example: nubilosyncclient setup https://dav.example.org/sync --user alice");
 
   std::string kind, folder, dataclass;
   auto* add = app.add_subcommand("add", "Sync a vdir folder of contacts or calendars");
   add->add_option("KIND", kind, "contacts or calendars")->required();
   add->add_option("FOLDER", folder, "The vdir folder")->required();
   add->add_option("--dataclass", dataclass, "Its name on the account");
+  add->footer("Example: nubilosyncclient add contacts ~/.local/share/contacts/people");
 
   std::string removed;
   auto* remove = app.add_subcommand("remove", "Stop syncing a folder (its files stay)");
   remove->add_option("NAME", removed, "The dataclass")->required();
+  remove->footer("Example: nubilosyncclient remove com.korvo.Calendars");
 
   RunRequest run;
   auto* sync = app.add_subcommand("sync", "Sync now");
@@ -89,11 +93,13 @@ int runCommandLine(int argc, char** argv) {
   sync->add_option("--max-delete", run.maxDeletePercent,
                    "Refuse to delete more than this percentage of a dataclass's items")
       ->check(CLI::Range(0, 100));
+  sync->footer("Example: nubilosyncclient sync com.korvo.Contacts --dry-run");
 
   std::string repaired;
   auto* repair = app.add_subcommand(
       "repair", "Write this computer's copy of a dataclass to the share as its whole history");
   repair->add_option("NAME", repaired, "The dataclass")->required();
+  repair->footer("Example: nubilosyncclient repair com.korvo.Contacts");
 
   auto* conflicts = app.add_subcommand("conflicts", "List the kept losing values of conflicts");
   std::string conflictId;
@@ -102,9 +108,17 @@ int runCommandLine(int argc, char** argv) {
   restoreConflict->add_option("ID", conflictId, "As `conflicts` lists it")->required();
   auto* dropConflict = conflicts->add_subcommand("drop", "Forget a kept losing value");
   dropConflict->add_option("ID", conflictId, "As `conflicts` lists it")->required();
+  conflicts->footer("Example: nubilosyncclient conflicts restore 2cb0ddcd");
+  restoreConflict->footer("Example: nubilosyncclient conflicts restore 2cb0ddcd");
+  dropConflict->footer("Example: nubilosyncclient conflicts drop 2cb0ddcd");
   bool statusJson = false;
   auto* status = app.add_subcommand("status", "Say what this computer syncs and how it went");
   status->add_flag("--json", statusJson, "One JSON document, for scripts");
+  status->footer("Example: nubilosyncclient status --json");
+  app.footer(
+      "Examples:\n  nubilosyncclient setup https://dav.example.org/sync --user alice\n"
+      "  nubilosyncclient add contacts ~/.local/share/contacts/people\n"
+      "  nubilosyncclient sync\n  nubilosyncclient status\n\nSee nubilosyncclient(1).");
 
   try {
     app.parse(argc, argv);
