@@ -6,6 +6,7 @@
 #include "VantorSyncManager/NubiloException.h"
 #include "VantorSyncManager/PublicNames.h"
 #include "VantorSyncManager/VTCPrefsCenter.h"
+#include "client/run/FailureText.h"
 #include "client/run/SyncFailure.h"
 #include "common/Clock.h"
 #include "common/Logging.h"
@@ -320,9 +321,9 @@ DataclassSync::Remote DataclassSync::fetch(bool slow, const DataclassRecord& rec
       for (auto& [index, log] : piece.changeLogs) fetched.changeLogs[index] = std::move(log);
     }
   } catch (const NubiloException& e) {
-    const bool damaged = e.name() == NubiloCorruptChangelogException ||
-                         e.name() == NubiloFailedToDownloadChangelogException;
-    if (!damaged || options_.dryRun) throw;
+    // A server error of the moment is tried again next time; only damage is
+    // looked into and remembered.
+    if (!showsDamage(e) || options_.dryRun) throw;
     if (!session_.validPropertiesForDataclass(dataclass)) {
       // A record that names changelogs that are not there (a commit cut
       // short): repaired from the files present, then read from minversion.
@@ -452,7 +453,18 @@ void DataclassSync::commit(Remote& remote) {
   // The lock is renewed first: a lock that expired (this computer slept)
   // fails here, before anything is written.
   session_.relockDataclass(dataclass);
-  session_.commitChanges(changes, dataclass, index, firstCommit);
+  try {
+    session_.commitChanges(changes, dataclass, index, firstCommit);
+  } catch (const NubiloException& e) {
+    // A changelog at this index with a record that does not name it: an
+    // earlier commit whose record update was lost. The record is set right
+    // from the files, so that the next sync takes that changelog in.
+    if (e.name() == NubiloServerIncoherencyException) repairLaggingRecord(index);
+    throw;
+  }
+  // The commit does not judge its record update: a lost one would hide this
+  // changelog from every other computer, so it is looked at once.
+  repairLaggingRecord(index);
   remote.record.maxversion = index;
   if (firstCommit) remote.record.minversion = index;
   remote.state = NetworkState{index, remote.record.minversion};
@@ -460,6 +472,22 @@ void DataclassSync::commit(Remote& remote) {
   engine_.acknowledge(kNetworkClient, dataclass, pending.anchor, state);
   outcome_.committedIndex = index;
   if (firstCommit) markOthersNeedingTruth();
+}
+
+void DataclassSync::repairLaggingRecord(int64_t index) {
+  const std::string& dataclass = collection_.dataclass;
+  DataclassRecord now;
+  try {
+    now = DataclassRecord::fromRecord(session_.getDataclassInfo(dataclass));
+  } catch (const NubiloException& e) {
+    // Unreadable now: a later commit runs into the changelog and repairs then.
+    VTC_LOG_WARNING("Could not read the record of %@ after a commit: %@", dataclass, e);
+    return;
+  }
+  if (now.maxversion && *now.maxversion >= index) return;
+  VTC_LOG_WARNING("The record of %@ names changelog %@ while %d is on the share; repairing it",
+                  dataclass, now.maxversion.value_or(0), index);
+  session_.setInfoForDataclass(session_.calculatePropertiesForDataclass(dataclass), dataclass);
 }
 
 void DataclassSync::markOthersNeedingTruth() {

@@ -78,6 +78,8 @@ class DataclassSync {
   void applyRemote(Remote& remote, const engine::PullResult& pending);
   void commit(Remote& remote);
   void compactIfLong(Remote& remote);
+  // Sets the record right when it names a changelog below index.
+  void repairLaggingRecord(int64_t index);
   // After a reset commit: every other computer takes the truth in once.
   void markOthersNeedingTruth();
   void writeFolder();

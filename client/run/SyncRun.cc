@@ -11,6 +11,7 @@
 #include "VantorSyncManager/SyncStatus.h"
 #include "VantorSyncManager/VTCPrefsCenter.h"
 #include "client/run/Account.h"
+#include "client/run/FailureText.h"
 #include "client/run/StatusReport.h"
 #include "client/run/SyncOwner.h"
 #include "common/Clock.h"
@@ -21,31 +22,6 @@
 namespace vtc::client {
 
 namespace {
-
-std::string failureSentence(const std::string& dataclass, const NubiloException& e) {
-  if (e.name() == NubiloNetworkFailureException)
-    return "The server stopped answering while syncing " + dataclass +
-           "; the next sync carries on from where this one stopped.";
-  if (e.name() == NubiloLockFailureException)
-    return dataclass + " is locked by another computer that is syncing it; try again shortly.";
-  if (e.name() == NubiloTesselFullException)
-    return "The share is full; " + dataclass + " could not be sent. Free some space on it.";
-  if (e.name() == NubiloServerIncoherencyException)
-    return "Another computer sent changes to " + dataclass +
-           " at the same moment; the next sync takes them in first.";
-  if (e.name() == NubiloCorruptChangelogException ||
-      e.name() == NubiloFailedToDownloadChangelogException)
-    return "The share's copy of " + dataclass + " is damaged (" + e.reason().substr(0, 120) +
-           "); run `nubilosyncclient repair " + dataclass +
-           "` on a computer whose last sync of it succeeded.";
-  return "Syncing " + dataclass + " failed: " + e.reason();
-}
-
-FailureKind failureKind(const NubiloException& e) {
-  if (e.name() == NubiloNetworkFailureException) return FailureKind::Unreachable;
-  if (e.name() == NubiloLoginFailureException) return FailureKind::Login;
-  return FailureKind::Other;
-}
 
 Dictionary summaryEntry(const DataclassOutcome& o, Date start, Date end, const std::string* error) {
   Dictionary entry{{"SyncDuration", std::chrono::duration<double>(end - start).count()},

@@ -1,0 +1,54 @@
+#include "client/run/FailureText.h"
+
+#include <regex>
+
+#include "VantorSyncManager/PublicNames.h"
+
+namespace vtc::client {
+
+std::optional<int> httpStatusIn(const NubiloException& e) {
+  static const std::regex status("HTTP ([1-5][0-9][0-9])");
+  std::smatch m;
+  const std::string& reason = e.reason();
+  if (!std::regex_search(reason, m, status)) return std::nullopt;
+  return std::stoi(m[1]);
+}
+
+bool showsDamage(const NubiloException& e) {
+  if (e.name() == NubiloCorruptChangelogException) return true;
+  if (e.name() != NubiloFailedToDownloadChangelogException) return false;
+  const auto status = httpStatusIn(e);
+  return status && (*status == 404 || *status == 200);
+}
+
+std::string failureSentence(const std::string& dataclass, const NubiloException& e) {
+  const auto status = httpStatusIn(e);
+  const std::string answered = status ? " (HTTP " + std::to_string(*status) + ")" : "";
+  if (e.name() == NubiloNetworkFailureException)
+    return "The server stopped answering while syncing " + dataclass +
+           "; the next sync carries on from where this one stopped.";
+  if (e.name() == NubiloLockFailureException)
+    return dataclass + " is locked by another computer that is syncing it; try again shortly.";
+  if (e.name() == NubiloTesselFullException)
+    return "The share is full, so " + dataclass +
+           " could not be sent; free some space on it and sync again.";
+  if (e.name() == NubiloServerIncoherencyException)
+    return "Another computer sent changes to " + dataclass +
+           " at the same moment; the next sync takes them in first.";
+  if (e.name() == NubiloAccountExpiredException)
+    return "The account has expired; renew it to sync " + dataclass + ".";
+  if (showsDamage(e))
+    return "The share's copy of " + dataclass + " is damaged" + answered +
+           "; run `nubilosyncclient repair " + dataclass +
+           "` on a computer whose last sync of it succeeded.";
+  return "The server answered with an error while syncing " + dataclass + answered +
+         "; the next sync tries again.";
+}
+
+FailureKind failureKind(const NubiloException& e) {
+  if (e.name() == NubiloNetworkFailureException) return FailureKind::Unreachable;
+  if (e.name() == NubiloLoginFailureException) return FailureKind::Login;
+  return FailureKind::Other;
+}
+
+}  // namespace vtc::client
