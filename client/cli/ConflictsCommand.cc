@@ -52,6 +52,12 @@ void restore(const KeptConflict& c) {
   if (!state || !current)
     throw SyncFailure(FailureKind::Other, c.record + " is no longer in " + collection->folder +
                                               "; the losing value has nothing to go back into.");
+  if (c.field == "(record)") {  // the delete lost: restoring it deletes the item again
+    if (folder.remove(c.record, *state) != WriteOutcome::Removed)
+      throw SyncFailure(FailureKind::Other,
+                        c.record + " changed while it was being restored; try again.");
+    return;
+  }
   Dictionary change{{"action", c.lost.isNone() ? "clear" : "set"}, {"name", c.field}};
   if (!c.lost.isNone()) change.set("value", c.lost);
   const std::string bytes = applyFieldChanges(collection->kind, current, Array{Value(change)});

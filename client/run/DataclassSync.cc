@@ -1,6 +1,7 @@
 #include "client/run/DataclassSync.h"
 
 #include <chrono>
+#include <functional>
 #include <set>
 
 #include "VantorSyncManager/NubiloException.h"
@@ -249,10 +250,36 @@ void DataclassSync::checkLocalDeletes(const ScanResult& scan, size_t known) {
                           " --max-delete 100`.");
 }
 
+// Runs a lock operation; when the share refuses it because of a lock that
+// names this computer, that lock is a leftover (a run of this computer that
+// ended without giving it back, or a lock the server brought back): no other
+// run of this computer can hold it while this one owns the sync, so it is
+// given back and the lock asked for once more.
+void DataclassSync::lockReleasingOwnLeftovers(const std::function<void()>& lockOperation) {
+  try {
+    lockOperation();
+    return;
+  } catch (const NubiloException& e) {
+    if (e.name() != NubiloLockFailureException) throw;
+    const std::string own = session_.configuration().get("guid").string();
+    bool released = false;
+    const std::string path = e.userInfo().get(kNBURI).string();
+    for (const Value& held : e.userInfo().get("DAV:lockdiscovery").array()) {
+      const Dictionary& lock = held.dictionary();
+      if (own.empty() || lock.get("clientid").string() != own) continue;
+      VTC_LOG_WARNING("Giving back a lock of this computer left on %@", path);
+      session_.tesselSession().unlockResourceWithToken(path, lock.get("token").string());
+      released = true;
+    }
+    if (!released) throw;
+  }
+  lockOperation();
+}
+
 void DataclassSync::lock() {
   const std::string& dataclass = collection_.dataclass;
   try {
-    session_.lockClient();
+    lockReleasingOwnLeftovers([&] { session_.lockClient(); });
   } catch (const NubiloException& e) {
     if (e.name() != NubiloClientRegistrationException) throw;
     // The share does not know this computer (a new share, or one reset).
@@ -263,7 +290,7 @@ void DataclassSync::lock() {
   locked_ = true;
   locks_.record();
   try {
-    session_.lockDataclass(dataclass);
+    lockReleasingOwnLeftovers([&] { session_.lockDataclass(dataclass); });
   } catch (const NubiloException& e) {
     if (e.name() != NubiloResourceNotFoundException) throw;
     session_.getDataclassInfo(dataclass);  // registers it
@@ -491,7 +518,7 @@ void DataclassSync::repairLaggingRecord(int64_t index) {
 }
 
 void DataclassSync::markOthersNeedingTruth() {
-  session_.lockClients();
+  lockReleasingOwnLeftovers([&] { session_.lockClients(); });
   locks_.record();
   try {
     session_.setOtherClientStatus("needstruth", collection_.dataclass);

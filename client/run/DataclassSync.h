@@ -9,6 +9,7 @@
 #pragma once
 
 #include <cstdint>
+#include <functional>
 #include <optional>
 #include <string>
 
@@ -73,6 +74,7 @@ class DataclassSync {
                                               const std::map<std::string, Dictionary>& lastFields);
   void checkLocalDeletes(const ScanResult& scan, size_t known);
   void lock();
+  void lockReleasingOwnLeftovers(const std::function<void()>& lockOperation);
   void unlock();
   Remote fetch(bool slow, const DataclassRecord& record);
   void applyRemote(Remote& remote, const engine::PullResult& pending);

@@ -17,6 +17,10 @@ double nowSeconds() {
   return std::chrono::duration<double>(currentClock().now().time_since_epoch()).count();
 }
 
+// Deleted records are kept this long, so that an edit made elsewhere before
+// the delete was seen brings the whole record back, not the edited fields.
+constexpr double kTombstoneSeconds = 90 * 86400.0;
+
 struct Competing {
   Value value;  // none for a clear
   std::string client;
@@ -48,6 +52,15 @@ void SqliteEngine::push(const std::string& client, const std::string& dataclass,
                   "INSERT INTO records (dataclass, id, properties) VALUES (?1, ?2, ?3) "
                   "ON CONFLICT(dataclass, id) DO UPDATE SET properties = excluded.properties");
   Statement remove(db_.handle(), "DELETE FROM records WHERE dataclass = ?1 AND id = ?2");
+  Statement bury(db_.handle(),
+                 "INSERT OR REPLACE INTO tombstones (dataclass, id, properties, deleted) "
+                 "VALUES (?1, ?2, ?3, ?4)");
+  Statement exhume(db_.handle(),
+                   "SELECT properties FROM tombstones WHERE dataclass = ?1 AND id = ?2");
+  Statement forget(db_.handle(), "DELETE FROM tombstones WHERE dataclass = ?1 AND id = ?2");
+  Statement unseenDelete(db_.handle(),
+                         "SELECT client, origin FROM journal WHERE dataclass = ?1 AND record = ?2 "
+                         "AND seq > ?3 AND client != ?4 AND type = 3 ORDER BY seq DESC LIMIT 1");
   Statement unseen(db_.handle(),
                    "SELECT client, changes, pushed, origin FROM journal WHERE dataclass = ?1 AND "
                    "record = ?2 AND seq > ?3 AND client != ?4 ORDER BY seq");
@@ -64,21 +77,9 @@ void SqliteEngine::push(const std::string& client, const std::string& dataclass,
     read.reset();
 
     uint32_t type = change.type();
-    if (type == SyncEngineChange::kDelete) {
-      if (!exists) {
-        VTC_LOG_DEBUG("Ignoring the delete of unknown record %@ in %@", id, dataclass);
-        continue;
-      }
-      remove.bind(1, dataclass).bind(2, id).run();
-      journal.bind(1, dataclass).bind(2, id).bind(3, client).bind(4, int64_t{type});
-      journal.bind(5, encode(Value(Array{}))).bind(6, now).bind(7, options.origin).run();
-      continue;
-    }
-    if (!exists) type = SyncEngineChange::kAdd;  // a modify of an unknown record adds it
-
     // What other clients did to this record that this client has not seen.
     std::map<std::string, Competing> competing;
-    if (exists) {
+    auto readCompeting = [&] {
       unseen.bind(1, dataclass).bind(2, id).bind(3, anchor).bind(4, client);
       while (unseen.step()) {
         const Value list = decode(unseen.blob(1));
@@ -89,7 +90,52 @@ void SqliteEngine::push(const std::string& client, const std::string& dataclass,
         }
       }
       unseen.reset();
+    };
+    auto tell = [&](Conflict c) {
+      if (options.onConflict) options.onConflict(c);
+    };
+
+    if (type == SyncEngineChange::kDelete) {
+      if (!exists) {
+        VTC_LOG_DEBUG("Ignoring the delete of unknown record %@ in %@", id, dataclass);
+        continue;
+      }
+      // Edits of others not seen here lose to the delete, and are kept.
+      readCompeting();
+      for (const auto& [name, other] : competing) {
+        VTC_LOG_INFO("Conflict on %@ of record %@ in %@: deleted by %@, dropped %@ from %@", name,
+                     id, dataclass, client, other.value, other.client);
+        tell({dataclass, id, name, Value(), other.value, client, other.client, options.origin,
+              other.origin, currentClock().now()});
+      }
+      remove.bind(1, dataclass).bind(2, id).run();
+      bury.bind(1, dataclass).bind(2, id).bind(3, encode(Value(properties))).bind(4, now).run();
+      journal.bind(1, dataclass).bind(2, id).bind(3, client).bind(4, int64_t{type});
+      journal.bind(5, encode(Value(Array{}))).bind(6, now).bind(7, options.origin).run();
+      continue;
     }
+    if (!exists) {
+      // A change of a record that is not here adds it. A modify of a deleted
+      // one brings it back whole, as it was, with the change on top (an add
+      // carries the whole record itself).
+      if (type == SyncEngineChange::kModify) {
+        exhume.bind(1, dataclass).bind(2, id);
+        if (exhume.step()) properties = decode(exhume.blob(0)).dictionary();
+        exhume.reset();
+      }
+      type = SyncEngineChange::kAdd;
+      forget.bind(1, dataclass).bind(2, id).run();
+      unseenDelete.bind(1, dataclass).bind(2, id).bind(3, anchor).bind(4, client);
+      if (unseenDelete.step()) {
+        VTC_LOG_INFO("Conflict on record %@ in %@: restored by %@, deleted by %@", id, dataclass,
+                     client, unseenDelete.text(0));
+        tell({dataclass, id, "(record)", Value("restored"), Value("deleted"), client,
+              unseenDelete.text(0), options.origin, unseenDelete.text(1), currentClock().now()});
+      }
+      unseenDelete.reset();
+    }
+
+    if (exists) readCompeting();
 
     Array applied;
     for (const Value& pc : change.changes()) {
@@ -125,6 +171,8 @@ void SqliteEngine::push(const std::string& client, const std::string& dataclass,
     journal.bind(1, dataclass).bind(2, id).bind(3, client).bind(4, int64_t{type});
     journal.bind(5, encode(Value(applied))).bind(6, now).bind(7, options.origin).run();
   }
+  Statement purge(db_.handle(), "DELETE FROM tombstones WHERE deleted < ?1");
+  purge.bind(1, now - kTombstoneSeconds).run();
   writeState(client, dataclass, options.state);
   t.commit();
 }

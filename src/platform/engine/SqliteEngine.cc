@@ -14,7 +14,7 @@ namespace vtc::engine {
 
 namespace {
 
-constexpr int kSchemaVersion = 2;
+constexpr int kSchemaVersion = 3;
 constexpr const char* kEngineVersion = "1.0";
 
 // Each step moves the database from version (index) to (index + 1).
@@ -41,6 +41,9 @@ const char* const kMigrations[] = {
                                  modified INTEGER NOT NULL, changed INTEGER NOT NULL,
                                  inode INTEGER NOT NULL, detail BLOB NOT NULL,
                                  PRIMARY KEY (client, dataclass, item));)",
+    R"(CREATE TABLE tombstones (dataclass TEXT NOT NULL, id TEXT NOT NULL,
+                              properties BLOB NOT NULL, deleted REAL NOT NULL,
+                              PRIMARY KEY (dataclass, id));)",
 };
 
 double seconds(Date d) {

@@ -148,6 +148,38 @@ TEST_F(Engine, PullsCarryCurrentValuesAndConflictsAreToldWithTheirComputers) {
   EXPECT_EQ(sync("vdir"), Changes{SyncEngineChange(1, "r1", Array{set("FN", Value("New"))})});
 }
 
+// An edit made elsewhere before a delete was seen: whichever reaches the
+// engine later wins, and the other side is kept as a conflict.
+TEST_F(Engine, ADeleteAndAnEditOfOneRecordSettleWholeAndKeepTheLoser) {
+  push("vdir", {SyncEngineChange(1, "r1", Array{set("FN", Value("Ann")), set("TEL", Value("1"))})});
+  sync("vdir");
+  sync("net");
+  std::vector<vtc::engine::Conflict> conflicts;
+  vtc::engine::PushOptions told{"Mac B", [&](const auto& c) { conflicts.push_back(c); }, {}};
+  // Deleted here, then another computer's edit of the phone arrives: the
+  // record comes back whole, and the delete is the loser.
+  engine->push("vdir", "Contacts", {SyncEngineChange(3, "r1", Array{})}, told);
+  time.advance(vtc::Seconds(1));
+  engine->push("net", "Contacts", {SyncEngineChange(2, "r1", Array{set("TEL", Value("2"))})}, told);
+  ASSERT_EQ(conflicts.size(), 1u);
+  EXPECT_EQ(conflicts[0].property, "(record)");
+  EXPECT_EQ(conflicts[0].lost, Value("deleted"));
+  EXPECT_EQ(sync("vdir"), Changes{SyncEngineChange(
+                              1, "r1", Array{set("FN", Value("Ann")), set("TEL", Value("2"))})});
+  EXPECT_TRUE(sync("net").empty());  // the delete is not sent: it lost
+
+  // Edited here, then another computer's delete arrives: the delete wins and
+  // the edit is kept.
+  push("vdir", {SyncEngineChange(2, "r1", Array{set("FN", Value("Anna"))})});
+  time.advance(vtc::Seconds(1));
+  engine->push("net", "Contacts", {SyncEngineChange(3, "r1", Array{})}, told);
+  ASSERT_EQ(conflicts.size(), 2u);
+  EXPECT_EQ(conflicts[1].property, "FN");
+  EXPECT_EQ(conflicts[1].lost, Value("Anna"));
+  EXPECT_EQ(sync("vdir"), Changes{SyncEngineChange(3, "r1", Array{})});
+  EXPECT_EQ(engine->recordCount("Contacts"), 0);
+}
+
 TEST_F(Engine, StatesTravelWithPushesAndAcknowledgementsAndADryRunForgetsEverything) {
   vtc::engine::StoredItem item{{400, 1, 2, 3}, Value("A")};
   vtc::engine::StateUpdate state{Value(Dictionary{{"index", 4}}), {{"a.vcf", item}}};

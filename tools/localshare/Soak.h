@@ -1,0 +1,34 @@
+// A soak of the sync: several computers on one share, each syncing in a
+// loop while random edits (adds, field edits, deletes) land in its address
+// book, with the locks really contended. At the end every computer syncs
+// until quiet, and the outcome is held against a model of every edit: each
+// one is present, overridden by a later edit of the same field, undone by a
+// delete, or kept as a conflict; no item is lost and none is there twice.
+#pragma once
+
+#include <cstdint>
+#include <string>
+#include <vector>
+
+namespace vtc::local {
+
+struct SoakOptions {
+  int computers = 3;
+  double seconds = 30;
+  int startingCards = 100;  // made on the first computer before the loops
+  unsigned seed = 1;
+};
+
+struct SoakReport {
+  int64_t syncs = 0;        // runs of the client
+  int64_t failedSyncs = 0;  // runs that ended with a failure (and were run again)
+  int64_t adds = 0, edits = 0, deletes = 0;
+  int64_t lockWaits = 0;  // lock attempts refused because another computer held it
+  int64_t conflicts = 0;  // losing values kept, over all computers
+  int64_t cardsAtEnd = 0;
+  std::vector<std::string> problems;  // anything lost, duplicated, or different
+};
+
+SoakReport runSoak(const SoakOptions& options);
+
+}  // namespace vtc::local
