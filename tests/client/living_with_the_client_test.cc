@@ -178,11 +178,11 @@ TEST_F(Living, APasswordFromStandardInputGoesToTheSecretServiceAndNowhereElse) {
         << entry.path();
   }
   // Nor on the share: records, changelogs, reports.
-  for (const auto& entry : std::filesystem::recursive_directory_iterator(share.documentRoot()))
-    if (entry.is_regular_file())
-      EXPECT_EQ(Computer::read(entry.path().string()).find(ApacheShare::kPassword),
-                std::string::npos)
-          << entry.path();
+  for (const auto& entry : std::filesystem::recursive_directory_iterator(share.documentRoot())) {
+    if (!entry.is_regular_file()) continue;
+    EXPECT_EQ(Computer::read(entry.path().string()).find(ApacheShare::kPassword), std::string::npos)
+        << entry.path();
+  }
   EXPECT_THAT(c.run({"status", "--json"}).out, testing::Not(HasSubstr(ApacheShare::kPassword)));
 }
 
