@@ -91,7 +91,10 @@ DavTransaction TesselSession::putData(const vtc::Bytes& data, const std::string&
     ne_request* req = ne_request_create(connection_->session(), "PUT", escaped.c_str());
     ne_lock_using_resource(req, escaped.c_str(), 0);
     ne_lock_using_parent(req, escaped.c_str());
-    ne_set_request_body_buffer(req, reinterpret_cast<const char*>(data.data()), data.size());
+    // neon wants a buffer even for an empty body.
+    static const char kEmpty = 0;
+    ne_set_request_body_buffer(
+        req, data.empty() ? &kEmpty : reinterpret_cast<const char*>(data.data()), data.size());
     int ret = vtc::dispatchExpectingSuccess(req);
     ne_request_destroy(req);
     return ret;
