@@ -8,6 +8,7 @@
 
 #include "VantorSyncManager/NubiloException.h"
 #include "client/cli/Commands.h"
+#include "client/run/Automation.h"
 #include "client/run/SyncFailure.h"
 #include "common/Clock.h"
 
@@ -66,6 +67,9 @@ int runCommandLine(int argc, char** argv) {
   setupCommandLine->add_option("--user", setup.member, "The member name")->required();
   setupCommandLine->add_option("--password-command", passwordCommand,
                                "A command whose first output line is the password");
+  std::string pushServer;
+  setupCommandLine->add_option("--push", pushServer,
+                               "mqtt[s]://host[:port] of the push server (same account)");
 
   std::string kind, folder, dataclass;
   auto* add = app.add_subcommand("add", "Sync a vdir folder of contacts or calendars");
@@ -93,6 +97,21 @@ int runCommandLine(int argc, char** argv) {
   auto* conflicts = app.add_subcommand("conflicts", "List the kept losing values of conflicts");
   auto* status = app.add_subcommand("status", "Say what this computer syncs and how it went");
 
+  std::string scheduleSwitch, every;
+  auto* schedule = app.add_subcommand("schedule", "Sync by itself on a schedule, or stop");
+  schedule->add_option("on|off", scheduleSwitch, "on or off")
+      ->required()
+      ->check(CLI::IsMember({"on", "off"}));
+  schedule->add_option("--every", every, "How often: 30m, 1h, 1d (default: hourly)");
+
+  std::string pushSwitch;
+  auto* pushing = app.add_subcommand("push", "Sync as soon as another computer syncs, or stop");
+  pushing->add_option("on|off", pushSwitch, "on or off")
+      ->required()
+      ->check(CLI::IsMember({"on", "off"}));
+  auto* listen =
+      app.add_subcommand("listen", "Receive pushes and sync on them (what the login service runs)");
+
   try {
     app.parse(argc, argv);
   } catch (const CLI::ParseError& e) {
@@ -104,7 +123,10 @@ int runCommandLine(int argc, char** argv) {
   try {
     if (*setupCommandLine) {
       if (!passwordCommand.empty()) setup.passwordCommand = passwordCommand;
-      return setupCommand(setup, output);
+      if (!pushServer.empty()) pushServer = checkedPushServer(pushServer);
+      const int status = setupCommand(setup, output);
+      if (status == 0 && !pushServer.empty()) storePushServer(pushServer);
+      return status;
     }
     if (*add)
       return addCommand(kind, folder,
@@ -120,6 +142,12 @@ int runCommandLine(int argc, char** argv) {
     }
     if (*conflicts) return conflictsCommand(output);
     if (*status) return statusCommand(output);
+    if (*schedule)
+      return scheduleCommand(scheduleSwitch == "on",
+                             every.empty() ? std::nullopt : std::optional<std::string>(every),
+                             output);
+    if (*pushing) return pushCommand(pushSwitch == "on", output);
+    if (*listen) return listenCommand(output);
     if (launchSync) {
       RunRequest launched;
       launched.dataclasses = launchDataclasses;

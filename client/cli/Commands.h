@@ -31,6 +31,10 @@ int removeCommand(const std::string& dataclass, Output& output);
 int syncCommand(const RunRequest& request, Output& output);
 int conflictsCommand(Output& output);
 int statusCommand(Output& output);
+int scheduleCommand(bool on, const std::optional<std::string>& every, Output& output);
+int pushCommand(bool on, Output& output);
+// Runs until SIGTERM or SIGINT.
+int listenCommand(Output& output);
 
 // The whole command line; the entry point of nubilosyncclient.
 int runCommandLine(int argc, char** argv);

@@ -6,6 +6,7 @@
 #include "VantorSyncManager/VTCPrefsCenter.h"
 #include "client/cli/Commands.h"
 #include "client/run/Account.h"
+#include "client/run/Automation.h"
 #include "client/run/ConflictStore.h"
 #include "client/run/SyncFailure.h"
 #include "common/Format.h"
@@ -76,6 +77,13 @@ int statusCommand(Output& output) {
     if (const Value* last = d.find("lastsync")) out << ", last sync " << textOf(*last);
     out << "\n";
   }
+  const AutomationState automation = automationState();
+  out << "Schedule: "
+      << (automation.scheduleOn
+              ? automation.cadence + ", next " + when(automation.nextScheduledSync)
+              : std::string("off"))
+      << "\nPush: " << (automation.pushOn ? "on" : "off")
+      << (automation.pushServer.empty() ? "" : " (" + automation.pushServer + ")") << "\n";
   return 0;
 }
 

@@ -10,6 +10,7 @@
 #include "VantorSyncManager/SyncStatus.h"
 #include "VantorSyncManager/VTCPrefsCenter.h"
 #include "client/run/Account.h"
+#include "client/run/Automation.h"
 #include "client/run/SyncOwner.h"
 #include "common/Clock.h"
 #include "common/Logging.h"
@@ -166,6 +167,13 @@ RunResult runSync(const RunRequest& request) {
   }
   if (!request.dryRun && result.failures.empty())
     prefs.setLastSuccessfulSyncDate(currentClock().now());
+  if (!request.dryRun) {
+    // The other computers learn of each new changelog at once.
+    std::vector<std::string> committed;
+    for (const DataclassOutcome& o : result.outcomes)
+      if (o.committedIndex) committed.push_back(o.dataclass);
+    announceCommits(member, password, committed);
+  }
   return result;
 }
 

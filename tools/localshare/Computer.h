@@ -38,8 +38,14 @@ class Computer {
   pid_t start(const std::vector<std::string>& args) const;
   Result finish(pid_t pid) const;
 
-  // setup against the share with a password command, then the two folders.
-  void join(const std::string& url, const std::string& user, const std::string& password) const;
+  // setup against the share with a password command that reads a file of
+  // the home (the password is on no command line), then the two folders.
+  // More arguments go to setup.
+  void join(const std::string& url, const std::string& user, const std::string& password,
+            const std::vector<std::string>& moreSetup = {}) const;
+
+  // Sets an environment variable of the client's processes (PATH, for one).
+  void setEnvironment(const std::string& name, const std::string& value);
 
   // Sets a per-host preference (the configuration's last layer); call it
   // while no client runs on this computer.
@@ -57,6 +63,7 @@ class Computer {
   std::string perHostFile() const;
   std::string name_;
   std::string home_;
+  std::map<std::string, std::string> environment_;
 };
 
 // The path of the built nubilosyncclient.
