@@ -69,21 +69,25 @@ void PushListener::handle(const std::string& topic, ByteView payload) {
   VTC_LOG_INFO("Push on %@ from %@", topic,
                from.empty() ? std::string("an unknown computer") : from);
   const auto now = std::chrono::steady_clock::now();
+  collect();  // a run that has just ended leaves the way free
   if (now - lastPush_ >= options_.quiet && running_ < 0 && pending_.empty()) startNow_ = true;
   lastPush_ = now;
   queue(topic);
 }
 
-void PushListener::startOrCollect() {
-  if (running_ > 0) {
-    std::optional<int> status = process::collect(running_, false);
-    if (!status) return;
-    VTC_LOG_INFO("The sync for the push on %@ ended with status %d", runningTopic_, *status);
-    // Another sync of this computer held the owner lock: this one is still due.
-    if (*status == static_cast<int>(FailureKind::Busy)) queue(runningTopic_);
-    running_ = -1;
-  }
-  if (pending_.empty() ||
+void PushListener::collect() {
+  if (running_ <= 0) return;
+  std::optional<int> status = process::collect(running_, false);
+  if (!status) return;
+  VTC_LOG_INFO("The sync for the push on %@ ended with status %d", runningTopic_, *status);
+  // Another sync of this computer held the owner lock: this one is still due.
+  if (*status == static_cast<int>(FailureKind::Busy)) queue(runningTopic_);
+  running_ = -1;
+}
+
+void PushListener::startDue() {
+  collect();
+  if (running_ > 0 || pending_.empty() ||
       (!startNow_ && std::chrono::steady_clock::now() - lastPush_ < options_.quiet))
     return;
   startNow_ = false;
@@ -128,7 +132,7 @@ void PushListener::run(const std::atomic<bool>& stop) {
                         pauseLength.count());
         pause(pauseLength, stop);
         pauseLength = std::min(pauseLength * 2, Seconds(kLongestPause));
-        startOrCollect();
+        startDue();
         continue;
       }
       pauseLength = Seconds(kFirstPause);
@@ -167,7 +171,7 @@ void PushListener::run(const std::atomic<bool>& stop) {
                      (subscribed_.size() == 1 ? "" : "es") + ".");
     }
     mqtt.poll(options_.tick);
-    startOrCollect();
+    startDue();
   }
   if (running_ > 0) process::collect(running_, true);
 }

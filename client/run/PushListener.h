@@ -45,7 +45,8 @@ class PushListener {
  private:
   void handle(const std::string& topic, ByteView payload);
   void refreshRegistrations();
-  void startOrCollect();
+  void collect();   // notes the end of the running command
+  void startDue();  // starts the next command when it is due
   void queue(const std::string& topic);
 
   Options options_;

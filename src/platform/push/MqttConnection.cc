@@ -1,6 +1,10 @@
 #include "platform/push/MqttConnection.h"
 
 #include <mosquitto.h>
+#include <netdb.h>
+#include <poll.h>
+#include <sys/socket.h>
+#include <unistd.h>
 
 #include <algorithm>
 #include <cerrno>
@@ -15,6 +19,41 @@ namespace {
 void initialiseOnce() {
   static std::once_flag once;
   std::call_once(once, [] { mosquitto_lib_init(); });
+}
+
+// Whether a TCP connection to the server opens within the timeout. The
+// library's own connect waits as long as the system does (minutes, for a
+// server whose packets vanish); a sync that announces its commit must not.
+bool answersWithin(const BrokerAddress& broker, std::chrono::milliseconds timeout,
+                   std::string& error) {
+  addrinfo hints{};
+  hints.ai_socktype = SOCK_STREAM;
+  addrinfo* found = nullptr;
+  const int rc =
+      ::getaddrinfo(broker.host.c_str(), std::to_string(broker.port).c_str(), &hints, &found);
+  if (rc != 0) {
+    error = "cannot find " + broker.host + ": " + ::gai_strerror(rc);
+    return false;
+  }
+  std::unique_ptr<addrinfo, decltype(&::freeaddrinfo)> addresses(found, &::freeaddrinfo);
+  error = "no address of " + broker.host;
+  for (const addrinfo* a = found; a; a = a->ai_next) {
+    const int fd = ::socket(a->ai_family, a->ai_socktype | SOCK_NONBLOCK | SOCK_CLOEXEC, 0);
+    if (fd < 0) continue;
+    bool open = ::connect(fd, a->ai_addr, a->ai_addrlen) == 0;
+    if (!open && errno == EINPROGRESS) {
+      pollfd p{fd, POLLOUT, 0};
+      int soError = 0;
+      socklen_t length = sizeof soError;
+      open = ::poll(&p, 1, static_cast<int>(timeout.count())) == 1 &&
+             ::getsockopt(fd, SOL_SOCKET, SO_ERROR, &soError, &length) == 0 && soError == 0;
+      if (!open) errno = soError ? soError : ETIMEDOUT;
+    }
+    if (!open) error = std::strerror(errno);
+    ::close(fd);
+    if (open) return true;
+  }
+  return false;
 }
 
 std::string reasonOf(int rc) {
@@ -125,6 +164,11 @@ bool MqttConnection::connect(std::string& error) {
   if (options_.broker.tls) mosquitto_int_option(mosq_, MOSQ_OPT_TLS_USE_OS_CERTS, 1);
   connectResult_ = -1;
   connected_ = false;
+  std::string unreachable;
+  if (!answersWithin(options_.broker, options_.timeout, unreachable)) {
+    error = "cannot reach the push server at " + options_.broker.url() + ": " + unreachable;
+    return false;
+  }
   const int keepAlive = 30;
   int rc = mosquitto_connect(mosq_, options_.broker.host.c_str(), options_.broker.port, keepAlive);
   if (rc != MOSQ_ERR_SUCCESS) {
