@@ -80,8 +80,12 @@ void PushListener::collect() {
   std::optional<int> status = process::collect(running_, false);
   if (!status) return;
   VTC_LOG_INFO("The sync for the push on %@ ended with status %d", runningTopic_, *status);
-  // Another sync of this computer held the owner lock: this one is still due.
-  if (*status == static_cast<int>(FailureKind::Busy)) queue(runningTopic_);
+  // Another sync of this computer held the owner lock: this one is still
+  // due, after a quiet interval.
+  if (*status == static_cast<int>(FailureKind::Busy)) {
+    queue(runningTopic_);
+    lastPush_ = std::chrono::steady_clock::now();
+  }
   running_ = -1;
 }
 

@@ -8,13 +8,15 @@
 // at least a quiet interval old) and finds nothing running starts its
 // command at once; pushes that come in quick succession, or while a command
 // runs, are folded into one run that starts once they have been quiet for
-// that interval. A computer's own announcements are ignored. When the server goes away the listener
-// reconnects with growing pauses (through the protocol sleeper), and after a reconnection runs
-// every registered command once for what it may have missed. The
-// registrations file is re-read when it changes.
+// that interval. A computer's own announcements are ignored. When the
+// server goes away the listener reconnects with growing pauses (through the
+// protocol sleeper), and after a reconnection runs every registered command
+// once for what it may have missed. The registrations file is re-read when
+// it changes. Not thread-safe: one thread runs a listener.
 #pragma once
 
 #include <sys/types.h>
+
 #include <atomic>
 #include <chrono>
 #include <deque>
