@@ -10,6 +10,7 @@
 
 #include "VantorSyncManager/NubiloException.h"
 #include "client/cli/Commands.h"
+#include "client/run/Automation.h"
 #include "client/run/SyncFailure.h"
 #include "common/Clock.h"
 
@@ -73,6 +74,9 @@ int runCommandLine(int argc, char** argv) {
                              "Read the password from standard input (for scripts)");
   setupCommandLine->footer(
       "Example: nubilosyncclient setup https://dav.example.org/sync --user alice");
+  std::string pushServer;
+  setupCommandLine->add_option("--push", pushServer,
+                               "mqtt[s]://host[:port] of the push server (same account)");
 
   std::string kind, folder, dataclass;
   auto* add = app.add_subcommand("add", "Sync a vdir folder of contacts or calendars");
@@ -120,6 +124,24 @@ int runCommandLine(int argc, char** argv) {
       "  nubilosyncclient add contacts ~/.local/share/contacts/people\n"
       "  nubilosyncclient sync\n  nubilosyncclient status\n\nSee nubilosyncclient(1).");
 
+  std::string scheduleSwitch, every;
+  auto* schedule = app.add_subcommand("schedule", "Sync by itself on a schedule, or stop");
+  schedule->add_option("on|off", scheduleSwitch, "on or off")
+      ->required()
+      ->check(CLI::IsMember({"on", "off"}));
+  schedule->add_option("--every", every, "How often: 30m, 1h, 1d (default: hourly)");
+  schedule->footer("Example: nubilosyncclient schedule on --every 1h");
+
+  std::string pushSwitch;
+  auto* pushing = app.add_subcommand("push", "Sync as soon as another computer syncs, or stop");
+  pushing->add_option("on|off", pushSwitch, "on or off")
+      ->required()
+      ->check(CLI::IsMember({"on", "off"}));
+  pushing->footer("Example: nubilosyncclient push on");
+  auto* listen =
+      app.add_subcommand("listen", "Receive pushes and sync on them (what the login service runs)");
+  listen->footer("Example: nubilosyncclient listen");
+
   try {
     app.parse(argc, argv);
   } catch (const CLI::ParseError& e) {
@@ -131,7 +153,10 @@ int runCommandLine(int argc, char** argv) {
   try {
     if (*setupCommandLine) {
       if (!passwordCommand.empty()) setup.passwordCommand = passwordCommand;
-      return setupCommand(setup, output);
+      if (!pushServer.empty()) pushServer = checkedPushServer(pushServer);
+      const int status = setupCommand(setup, output);
+      if (status == 0 && !pushServer.empty()) storePushServer(pushServer);
+      return status;
     }
     if (*add)
       return addCommand(kind, folder,
@@ -151,6 +176,12 @@ int runCommandLine(int argc, char** argv) {
                                                : "",
                               conflictId, output);
     if (*status) return statusCommand(statusJson, output);
+    if (*schedule)
+      return scheduleCommand(scheduleSwitch == "on",
+                             every.empty() ? std::nullopt : std::optional<std::string>(every),
+                             output);
+    if (*pushing) return pushCommand(pushSwitch == "on", output);
+    if (*listen) return listenCommand(output);
     if (launchSync) {
       RunRequest launched;
       launched.dataclasses = launchDataclasses;

@@ -33,6 +33,10 @@ int syncCommand(RunRequest request, Output& output);
 // action: "" (list), "restore" or "drop", with the conflict id.
 int conflictsCommand(const std::string& action, const std::string& id, Output& output);
 int statusCommand(bool json, Output& output);
+int scheduleCommand(bool on, const std::optional<std::string>& every, Output& output);
+int pushCommand(bool on, Output& output);
+// Runs until SIGTERM or SIGINT.
+int listenCommand(Output& output);
 
 // The whole command line; the entry point of nubilosyncclient.
 int runCommandLine(int argc, char** argv);

@@ -3,6 +3,7 @@
 #include <ostream>
 
 #include "client/cli/Commands.h"
+#include "client/run/Automation.h"
 #include "client/run/Collections.h"
 #include "client/run/SyncFailure.h"
 
@@ -30,6 +31,7 @@ int addCommand(const std::string& kindWordGiven, const std::string& folder,
                                                      : kDefaultCalendarsDataclass),
       *kind, path.string()};
   addCollection(collection);
+  followAddedFolder(collection.dataclass);
   if (output.verbosity > 0)
     output.out << (made ? "Made and added " : "Added ") << collection.folder << " as "
                << collection.dataclass << ".\n";
@@ -40,6 +42,7 @@ int removeCommand(const std::string& dataclass, Output& output) {
   auto collection = configuredCollection(dataclass);
   if (!collection || !removeCollection(dataclass))
     throw SyncFailure(FailureKind::Usage, dataclass + " is not synced on this computer.");
+  followRemovedFolder(dataclass);
   if (output.verbosity > 0)
     output.out << "Stopped syncing " << dataclass << "; the files in " << collection->folder
                << " stay.\n";

@@ -6,6 +6,7 @@
 #include "client/cli/Commands.h"
 #include "client/cli/StatusText.h"
 #include "client/run/Account.h"
+#include "client/run/Automation.h"
 #include "client/run/ConflictStore.h"
 #include "client/run/StatusReport.h"
 #include "client/run/SyncFailure.h"

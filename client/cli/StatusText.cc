@@ -71,44 +71,49 @@ std::string localTime(const std::optional<Date>& date) {
 
 void printStatus(const StatusReport& s, std::ostream& out) {
   if (!s.setUp) {
-    out << "Syncing is not set up; run `nubilosyncclient setup URL --user NAME`.\\n";
+    out << "Syncing is not set up; run `nubilosyncclient setup URL --user NAME`.\n";
     return;
   }
-  out << "This computer: " << s.computerName << " (" << s.computerGuid << ")\\n"
-      << "Account: " << s.member << " at " << s.server << "\\n";
-  out << (s.runningPid ? "A sync is running now (process " + std::to_string(*s.runningPid) + ").\\n"
-                       : std::string("No sync is running now.\\n"));
+  out << "This computer: " << s.computerName << " (" << s.computerGuid << ")\n"
+      << "Account: " << s.member << " at " << s.server << "\n";
+  out << (s.runningPid ? "A sync is running now (process " + std::to_string(*s.runningPid) + ").\n"
+                       : std::string("No sync is running now.\n"));
+  out << "Schedule: "
+      << (s.scheduleOn ? s.cadence + ", next " + localTime(s.nextScheduledSync)
+                       : std::string("off"))
+      << "\nPush: " << (s.pushOn ? "on" : "off")
+      << (s.pushServer.empty() ? "" : " (" + s.pushServer + ")") << "\n";
   if (s.dataclasses.empty())
-    out << "No folder is synced; add one with `nubilosyncclient add contacts|calendars FOLDER`.\\n";
+    out << "No folder is synced; add one with `nubilosyncclient add contacts|calendars FOLDER`.\n";
   for (const DataclassStatus& d : s.dataclasses) {
-    out << "\\n"
-        << d.name << " (" << d.kind << "): " << d.folder << "\\n"
+    out << "\n"
+        << d.name << " (" << d.kind << "): " << d.folder << "\n"
         << "  " << plural(d.items, "item", "items") << "; last sync " << localTime(d.lastSuccess)
-        << "; last attempt " << localTime(d.lastAttempt) << "\\n";
+        << "; last attempt " << localTime(d.lastAttempt) << "\n";
     if (d.failedCount > 0)
       out << "  " << plural(d.failedCount, "failed sync", "failed syncs")
-          << " since: " << d.lastError.value_or("(no reason kept)") << "\\n";
+          << " since: " << d.lastError.value_or("(no reason kept)") << "\n";
     if (d.maxversion)
       out << "  on the share: changelogs " << d.minversion.value_or(1) << " to " << *d.maxversion
-          << "\\n";
+          << "\n";
     else if (!s.serverError)
-      out << "  on the share: nothing yet\\n";
+      out << "  on the share: nothing yet\n";
     if (d.serverStatus == std::optional<std::string>("needstruth"))
-      out << "  this computer takes in the whole truth at its next sync (needstruth)\\n";
+      out << "  this computer takes in the whole truth at its next sync (needstruth)\n";
   }
   if (!s.computers.empty()) {
-    out << "\\nComputers of the account:\\n";
+    out << "\nComputers of the account:\n";
     for (const ComputerStatus& c : s.computers) {
       out << "  " << c.name << (c.thisComputer ? " (this computer)" : "") << ": last sync "
           << c.lastSync.value_or("never");
       if (!c.report.empty()) out << "; " << reportLine(c.report);
-      out << "\\n";
+      out << "\n";
     }
   }
   if (!s.conflicts.empty())
-    out << "\\n"
+    out << "\n"
         << plural(static_cast<int64_t>(s.conflicts.size()), "conflict", "conflicts")
-        << " kept; see `nubilosyncclient conflicts`.\\n";
+        << " kept; see `nubilosyncclient conflicts`.\n";
 }
 
 std::string statusAsJson(const StatusReport& s) {
@@ -117,6 +122,9 @@ std::string statusAsJson(const StatusReport& s) {
   doc["computer"] = {{"name", s.computerName}, {"guid", s.computerGuid}};
   doc["account"] = {{"member", s.member}, {"server", s.server}};
   doc["running"] = s.runningPid ? nlohmann::json{{"pid", *s.runningPid}} : nlohmann::json(nullptr);
+  doc["schedule"] = {
+      {"on", s.scheduleOn}, {"cadence", s.cadence}, {"next", optionalDate(s.nextScheduledSync)}};
+  doc["push"] = {{"on", s.pushOn}, {"server", s.pushServer}};
   doc["dataclasses"] = nlohmann::json::array();
   for (const DataclassStatus& d : s.dataclasses)
     doc["dataclasses"].push_back({{"name", d.name},

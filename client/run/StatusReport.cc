@@ -7,6 +7,7 @@
 #include "VantorSyncManager/SyncStatus.h"
 #include "VantorSyncManager/VTCPrefsCenter.h"
 #include "client/run/Account.h"
+#include "client/run/Automation.h"
 #include "client/run/Collections.h"
 #include "client/run/DataclassSync.h"
 #include "client/run/ServerView.h"
@@ -91,6 +92,12 @@ StatusReport gatherStatus() {
   status.member = prefs.username().value_or("");
   status.server = storedServerURL();
   status.runningPid = ownerPid();
+  const AutomationState automation = automationState();
+  status.scheduleOn = automation.scheduleOn;
+  status.cadence = automation.cadence;
+  status.nextScheduledSync = automation.nextScheduledSync;
+  status.pushOn = automation.pushOn;
+  status.pushServer = automation.pushServer;
   status.conflicts = ConflictStore().list();
   std::unique_ptr<engine::SyncEngine> engine;
   try {

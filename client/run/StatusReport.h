@@ -40,6 +40,11 @@ struct StatusReport {
   bool setUp = false;
   std::string computerName, computerGuid, member, server;
   std::optional<int> runningPid;  // a sync runs now, in this process
+  bool scheduleOn = false;
+  std::string cadence;  // "hourly at :05"
+  std::optional<Date> nextScheduledSync;
+  bool pushOn = false;
+  std::string pushServer;
   std::vector<DataclassStatus> dataclasses;
   std::vector<ComputerStatus> computers;
   std::vector<KeptConflict> conflicts;

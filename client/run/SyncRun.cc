@@ -11,6 +11,7 @@
 #include "VantorSyncManager/SyncStatus.h"
 #include "VantorSyncManager/VTCPrefsCenter.h"
 #include "client/run/Account.h"
+#include "client/run/Automation.h"
 #include "client/run/FailureText.h"
 #include "client/run/StatusReport.h"
 #include "client/run/SyncOwner.h"
@@ -163,6 +164,13 @@ RunResult runSync(const RunRequest& request) {
   }
   if (!request.dryRun && result.failures.empty())
     prefs.setLastSuccessfulSyncDate(currentClock().now());
+  if (!request.dryRun) {
+    // The other computers learn of each new changelog at once.
+    std::vector<std::string> committed;
+    for (const DataclassOutcome& o : result.outcomes)
+      if (o.committedIndex) committed.push_back(o.dataclass);
+    announceCommits(member, password, committed);
+  }
   return result;
 }
 

@@ -1,7 +1,8 @@
 // What the library remembers on this computer: the sync switch, the client's
 // identity, each dataclass's sync dates, failure counts, change tags and
 // download counters, sync modes, the queue of dataclasses for the next sync,
-// the stored account, and the client configuration. Values live in the
+// the stored account, the client configuration, and automatic syncs (the
+// periodic job and sync on change). Values live in the
 // per-host scope of the "com.korvo.VantorSync" preference domain. No
 // operation raises; absent values read as the stated defaults.
 #pragma once
@@ -66,6 +67,31 @@ class VSM_EXPORT VTCPrefsCenter {
   std::optional<vtc::Date> configTTLDate();
   std::string systemVersion();
 
+  // Automatic sync. Periodic sync is on while its job description file
+  // exists; the job runs the sync client on a calendar made from the stored
+  // interval and unit (0 minutes, 1 hours, 2 days, other values seconds),
+  // coarsely: more than a day runs weekly, more than an hour daily, more
+  // than a minute hourly, else every minute. Job launcher failures are
+  // logged, never raised.
+  bool autoSyncOn();
+  bool autoSyncOn(bool ignored);
+  void setAutoSyncOn(bool on);
+  int32_t autoSyncInterval();
+  void setAutoSyncInterval(int32_t interval);
+  int32_t autoSyncIntervalUnit();
+  void setAutoSyncUnit(int32_t unit);
+  // Sync on change: the sync engine starts this client after other clients
+  // synced, and a job syncs the browser's bookmarks when they change.
+  bool automaticallySyncOn();
+  void setAutomaticallySyncOn(bool on);
+  // Minutes: the larger of the configuration's default interval and its
+  // minimum.
+  int32_t automaticallySyncInterval();
+  bool syncNotificationsGloballyEnabled();
+  // Installs the bookmarks job unless its file exists; false when the
+  // browser's sync client is not found or the job cannot be written.
+  bool checkBookmarksPlistAndCreateIfNecessary();
+
   // The client configuration, built once per process.
   const vtc::Dictionary& configuration();
   // Forgets it, so that the next use builds it again (tests only).
@@ -90,3 +116,8 @@ class VSM_EXPORT VTCPrefsCenter {
   std::optional<vtc::Dictionary> _configuration;
   std::mutex configurationMutex_;
 };
+
+// The last sync date plus the periodic job's "StartInterval" (a job written
+// by setAutoSyncOn has none), when that lies in the future; none when
+// periodic sync is off.
+VSM_EXPORT std::optional<vtc::Date> nextAutoSyncTriggerDate();

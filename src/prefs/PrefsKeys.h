@@ -13,6 +13,10 @@ inline constexpr const char* kClientGuid = "ClientGuid";
 inline constexpr const char* kClientName = "ClientName";
 inline constexpr const char* kConfigTTLDate = "ConfigTTLDate";
 inline constexpr const char* kLoggingLevel = "LoggingLevel";
+inline constexpr const char* kAutoSyncOn = "AutoSyncOn";
+inline constexpr const char* kAutoSyncWithNotifications = "AutoSyncWithNotifications";
+inline constexpr const char* kAutoSyncInterval = "AutoSyncInterval";
+inline constexpr const char* kAutoSyncIntervalUnit = "AutoSyncIntervalUnit";
 
 // Per-dataclass keys are a prefix followed by the dataclass name. The bare
 // "FailedCount." is the key of the whole failed-count collection.

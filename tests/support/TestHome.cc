@@ -17,6 +17,7 @@ TestHome::TestHome() {
   setenv("HOME", path_.c_str(), 1);
   unsetenv("XDG_CACHE_HOME");
   unsetenv("XDG_DATA_HOME");
+  unsetenv("XDG_CONFIG_HOME");
   // Preferences, the configuration built from them and the log belong to a home.
   prefs::PreferenceStore::shared().resetForTesting();
   VTCPrefsCenter::defaultCenter().resetConfigurationForTesting();

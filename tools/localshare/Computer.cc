@@ -2,6 +2,7 @@
 
 #include <fcntl.h>
 #include <pty.h>
+#include <sys/stat.h>
 #include <sys/wait.h>
 #include <unistd.h>
 
@@ -64,6 +65,10 @@ std::vector<std::string> Computer::environment() const {
   env.push_back("HOME=" + home_);
   env.push_back("NUBILO_MACHINE_ID_FILE=" + home_ + "/.machine-id");
   env.push_back("NUBILO_WAIT_SCALE=0.001");  // protocol waits of a thousandth
+  for (const auto& [name, value] : environment_) {
+    std::erase_if(env, [&](const std::string& e) { return e.starts_with(name + "="); });
+    env.push_back(name + "=" + value);
+  }
   return env;
 }
 
@@ -136,12 +141,20 @@ Computer::Result Computer::runOnTerminal(const std::vector<std::string>& args) c
   return r;
 }
 
-void Computer::join(const std::string& url, const std::string& user,
-                    const std::string& password) const {
+void Computer::setEnvironment(const std::string& name, const std::string& value) {
+  environment_[name] = value;
+}
+
+void Computer::join(const std::string& url, const std::string& user, const std::string& password,
+                    const std::vector<std::string>& moreSetup) const {
+  const std::string passwordFile = home_ + "/.password";
+  write(passwordFile, password + "\n");
+  ::chmod(passwordFile.c_str(), 0600);
+  std::vector<std::string> setup{
+      "setup", url, "--user", user, "--password-command", "cat '" + passwordFile + "'"};
+  setup.insert(setup.end(), moreSetup.begin(), moreSetup.end());
   for (const auto& args : std::vector<std::vector<std::string>>{
-           {"setup", url, "--user", user, "--password-command", "printf '%s' '" + password + "'"},
-           {"add", "contacts", contacts()},
-           {"add", "calendars", calendars()}}) {
+           setup, {"add", "contacts", contacts()}, {"add", "calendars", calendars()}}) {
     Result r = run(args);
     if (r.status != 0)
       throw std::runtime_error(name_ + ": nubilosyncclient failed: " + r.err + r.out);

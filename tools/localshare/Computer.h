@@ -41,9 +41,17 @@ class Computer {
   pid_t start(const std::vector<std::string>& args) const;
   Result finish(pid_t pid) const;
 
-  // setup against the share with a password command, then the two folders.
-  void join(const std::string& url, const std::string& user, const std::string& password) const;
+  // setup against the share with a password command that reads a file of
+  // the home (the password is on no command line), then the two folders.
+  // More arguments go to setup.
+  void join(const std::string& url, const std::string& user, const std::string& password,
+            const std::vector<std::string>& moreSetup = {}) const;
 
+  // Sets an environment variable of the client's processes (PATH, for one).
+  void setEnvironment(const std::string& name, const std::string& value);
+
+  // This computer's per-host preference file (it has a machine id of its own).
+  std::string perHostFile() const;
   // Sets a per-host preference (the configuration's last layer); call it
   // while no client runs on this computer.
   void setPreference(const std::string& key, const Value& value) const;
@@ -57,10 +65,10 @@ class Computer {
   std::vector<std::string> environment() const;
   // Starts the client with standard input read from the file input.
   pid_t spawn(const std::vector<std::string>& args, const std::string& input) const;
-  std::string perHostFile() const;
   std::string name_;
   std::string home_;
   std::string machineId_;
+  std::map<std::string, std::string> environment_;
 };
 
 // The path of the built nubilosyncclient.

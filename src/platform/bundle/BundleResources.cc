@@ -1,6 +1,7 @@
 #include "platform/bundle/BundleResources.h"
 
 #include <dlfcn.h>
+#include <unistd.h>
 
 #include <filesystem>
 #include <vector>
@@ -36,6 +37,26 @@ std::optional<std::string> pathForResource(const std::string& name, const std::s
   std::error_code error;
   for (const auto& candidate : candidates)
     if (std::filesystem::is_regular_file(candidate, error)) return candidate.string();
+  return std::nullopt;
+}
+
+std::optional<std::string> pathForTool(const std::string& name) {
+  std::vector<std::filesystem::path> candidates;
+  const std::filesystem::path folder = loadedFolder();
+  if (!folder.empty()) {
+    // <prefix>/bin/program, <prefix>/lib/libX.so, <prefix>/lib/<multiarch>/libX.so
+    candidates.push_back(folder / name);
+    candidates.push_back(folder.parent_path() / "bin" / name);
+    candidates.push_back(folder.parent_path().parent_path() / "bin" / name);
+  }
+#ifdef VSM_BUILD_PROGRAMS
+  candidates.push_back(std::filesystem::path(VSM_BUILD_PROGRAMS) / name / name);
+#endif
+  std::error_code error;
+  for (const auto& candidate : candidates)
+    if (std::filesystem::is_regular_file(candidate, error) &&
+        ::access(candidate.c_str(), X_OK) == 0)
+      return candidate.string();
   return std::nullopt;
 }
 

@@ -51,6 +51,10 @@ std::string applicationSupportDirectory() {
   return envOr("XDG_DATA_HOME", join(homeDirectory(), ".local/share"));
 }
 
+std::string configDirectory() {
+  return envOr("XDG_CONFIG_HOME", join(homeDirectory(), ".config"));
+}
+
 std::string temporaryDirectory() {
   return envOr("TMPDIR", "/tmp");
 }

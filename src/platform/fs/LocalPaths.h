@@ -1,5 +1,6 @@
 // Local folders of the user: the home folder and the XDG folders that stand
-// in for the caches, application-support and temporary folders.
+// in for the caches, application-support, configuration and temporary
+// folders.
 #pragma once
 
 #include <string>
@@ -18,6 +19,7 @@ std::string join(std::string_view a, std::string_view b);
 
 std::string cachesDirectory();              // $XDG_CACHE_HOME or ~/.cache
 std::string applicationSupportDirectory();  // $XDG_DATA_HOME or ~/.local/share
+std::string configDirectory();              // $XDG_CONFIG_HOME or ~/.config
 std::string temporaryDirectory();           // $TMPDIR or /tmp
 
 // Creates path and its missing parents with the given mode; true when the

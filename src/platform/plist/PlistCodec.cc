@@ -10,6 +10,7 @@
 #include <fstream>
 #include <iterator>
 
+#include "platform/fs/AtomicWrite.h"
 #include "platform/plist/BinaryPlistFormat.h"
 #include "platform/plist/BinaryPlistReader.h"
 #include "platform/plist/BinaryPlistWriter.h"
@@ -173,6 +174,9 @@ Bytes toBinary(const Value& value) {
 }
 
 std::optional<Value> readFile(const std::string& path) {
+  // A folder opens as a stream but fails (with an exception) when read.
+  struct stat st {};
+  if (::stat(path.c_str(), &st) != 0 || !S_ISREG(st.st_mode)) return std::nullopt;
   std::ifstream in(path, std::ios::binary);
   if (!in) return std::nullopt;
   Bytes bytes((std::istreambuf_iterator<char>(in)), std::istreambuf_iterator<char>());
@@ -181,24 +185,7 @@ std::optional<Value> readFile(const std::string& path) {
 
 bool writeFileAtomically(const std::string& path, const Value& value, int mode) {
   std::string xml = toXml(value);
-  if (xml.empty()) return false;
-  std::string tmp = path + ".XXXXXX";
-  int fd = mkstemp(tmp.data());
-  if (fd < 0) return false;
-  bool ok = fchmod(fd, static_cast<mode_t>(mode)) == 0;
-  size_t done = 0;
-  while (ok && done < xml.size()) {
-    ssize_t n = ::write(fd, xml.data() + done, xml.size() - done);
-    if (n <= 0)
-      ok = false;
-    else
-      done += static_cast<size_t>(n);
-  }
-  ok = ok && fsync(fd) == 0;
-  ok = (::close(fd) == 0) && ok;
-  if (ok && std::rename(tmp.c_str(), path.c_str()) == 0) return true;
-  ::unlink(tmp.c_str());
-  return false;
+  return !xml.empty() && fs::writeFileAtomically(path, xml, mode);
 }
 
 }  // namespace vtc::plist

@@ -1,0 +1,254 @@
+// NotifyHelper against a real push server (mosquitto on a free port, one
+// account, once with TLS): what reaches a subscriber, what is registered
+// for launch and at login, and what is logged when parts fail. The user
+// manager is a stand-in that records its calls.
+#include <gmock/gmock.h>
+
+#include <stdlib.h>
+
+#include <chrono>
+#include <filesystem>
+#include <map>
+
+#include "VantorSyncManager/NotifyHelper.h"
+#include "VantorSyncManager/PublicNames.h"
+#include "VantorSyncManager/VTCPrefsCenter.h"
+#include "localshare/ApacheShare.h"
+#include "localshare/Computer.h"
+#include "platform/plist/PlistCodec.h"
+#include "platform/prefs/PreferenceStore.h"
+#include "platform/push/MqttConnection.h"
+#include "platform/push/PushRegistry.h"
+#include "platform/push/PushService.h"
+#include "support/LogCapture.h"
+#include "support/MqttBroker.h"
+#include "support/TestHome.h"
+#include "support/UserManagerStandIn.h"
+
+using testing::Contains;
+using testing::ElementsAre;
+using testing::HasSubstr;
+using testing::StartsWith;
+using vtc::Value;
+using vtc::local::ApacheShare;
+using vtc::prefs::PreferenceStore;
+using vtc::prefs::Scope;
+
+namespace {
+
+constexpr const char* kPassword = ApacheShare::kPassword;
+const std::string kAccount = ApacheShare::kUser;
+
+class Notify : public ::testing::Test {
+ protected:
+  vtc::test::TestHome home;
+  vtc::test::LogCapture logged;
+  vtc::test::UserManagerStandIn manager;
+  std::unique_ptr<vtc::test::MqttBroker> broker;
+
+  Notify() { NotifyHelper::resetSharedHelperForTesting(); }
+  ~Notify() override { NotifyHelper::resetSharedHelperForTesting(); }
+
+  void startBroker(bool tls = false) {
+    broker = std::make_unique<vtc::test::MqttBroker>(vtc::test::MqttBroker::Options{tls});
+    PreferenceStore::shared().setValue(vtc::push::kPushServerKey, Value(broker->url()),
+                                       kVantorDefaultsKey, Scope::AnyHost);
+  }
+  // A subscriber to every sync topic, as another computer of the account.
+  std::unique_ptr<vtc::push::MqttConnection> subscriber() {
+    vtc::push::MqttConnection::Options options;
+    options.broker = *vtc::push::BrokerAddress::parse(broker->url());
+    options.clientId = "test-subscriber";
+    options.username = kAccount;
+    options.password = kPassword;
+    auto c = std::make_unique<vtc::push::MqttConnection>(options);
+    std::string error;
+    EXPECT_TRUE(c->connect(error)) << error;
+    EXPECT_TRUE(c->subscribe({"korvo/nubilo/syncdav/#"}, error)) << error;
+    return c;
+  }
+  // The messages that reach the subscriber until one arrives on the marker
+  // dataclass (published last, on the same session, so after the others).
+  static std::multimap<std::string, Value> until(vtc::push::MqttConnection& c,
+                                                 const std::string& marker) {
+    std::multimap<std::string, Value> received;
+    bool done = false;
+    c.setMessageHandler([&](const vtc::push::MqttConnection::Message& m) {
+      const std::string dataclass = m.topic.substr(m.topic.rfind('/') + 1);
+      if (dataclass == marker)
+        done = true;
+      else
+        received.emplace(m.topic, vtc::plist::parse(m.payload).value_or(Value()));
+    });
+    const auto deadline = std::chrono::steady_clock::now() + std::chrono::seconds(5);
+    while (!done && std::chrono::steady_clock::now() < deadline)
+      c.poll(std::chrono::milliseconds(50));
+    EXPECT_TRUE(done);
+    return received;
+  }
+  std::string topic(const std::string& dataclass) const {
+    return "korvo/nubilo/syncdav/" + vtc::push::accountDigest(kAccount) + "/" + dataclass;
+  }
+  std::vector<vtc::push::Launchable> launchables() const {
+    return vtc::push::readRegistrations().value_or(vtc::push::Registrations{}).launchables;
+  }
+};
+
+TEST_F(Notify, TwoPayloadsQueuedForADataclassArePublishedOnceWithTheSecond) {
+  startBroker();
+  auto other = subscriber();
+  NotifyHelper& helper = NotifyHelper::notificationSessionForAccount(kAccount, kPassword);
+  helper.sendNotifications();  // nothing queued: nothing happens
+  EXPECT_FALSE(helper.queuedNotifications());
+  helper.addDataclassToNotify("com.korvo.Contacts", Value("first"));
+  helper.addDataclassToNotify("com.korvo.Calendars", Value("calendars"));
+  helper.addDataclassToNotify("com.korvo.Contacts", Value("second"));
+  helper.sendNotifications();
+  EXPECT_FALSE(helper.queuedNotifications());
+  helper.addDataclassToNotify("marker", Value());
+  helper.sendNotifications();
+
+  std::multimap<std::string, Value> received = until(*other, "marker");
+  EXPECT_THAT(received, ElementsAre(std::pair(topic("com.korvo.Calendars"), Value("calendars")),
+                                    std::pair(topic("com.korvo.Contacts"), Value("second"))));
+  EXPECT_THAT(topic("x"), testing::Not(HasSubstr(kAccount)));  // the account travels as a digest
+  EXPECT_THAT(logged.messages("Info"),
+              Contains("Publishing to topic = " + topic("com.korvo.Contacts")));
+}
+
+TEST_F(Notify, TheSharedHelperOfTheFirstAccountIsKeptForAnyLaterOne) {
+  startBroker();
+  auto other = subscriber();
+  NotifyHelper& first = NotifyHelper::notificationSessionForAccount(kAccount, kPassword);
+  NotifyHelper& second = NotifyHelper::notificationSessionForAccount("bob", "other password");
+  EXPECT_EQ(&first, &second);
+  second.addDataclassToNotify("com.korvo.Contacts", Value("x"));
+  second.addDataclassToNotify("marker", Value());
+  second.sendNotifications();
+  EXPECT_EQ(until(*other, "marker").count(topic("com.korvo.Contacts")),
+            1u);  // still the first account's
+}
+
+TEST_F(Notify, EnablingQueuesTheDataclassEvenWhenTheTopicOrTheRegistrationFails) {
+  startBroker();
+  NotifyHelper& helper = NotifyHelper::notificationSessionForAccount(kAccount, kPassword);
+  VTCPrefsCenter& prefs = VTCPrefsCenter::defaultCenter();
+
+  helper.enableDataclassForNotifications("com.korvo.Contacts");
+  ASSERT_EQ(launchables().size(), 1u);
+  EXPECT_EQ(launchables()[0].topic, topic("com.korvo.Contacts"));
+  EXPECT_THAT(launchables()[0].tool, testing::EndsWith("/nubilosyncclient"));
+  EXPECT_THAT(launchables()[0].arguments,
+              ElementsAre("--sync", "--dataclasses", "com.korvo.Contacts"));
+
+  helper.enableDataclassForNotifications("com.korvo+odd");  // no topic can name it
+  EXPECT_EQ(launchables().size(), 1u);
+  const std::string file = *vtc::push::registrationsFile();
+  std::filesystem::rename(file, file + ".kept");
+  std::filesystem::create_directories(file);  // the registrations cannot be read
+  helper.enableDataclassForNotifications("com.korvo.Calendars");
+  EXPECT_THAT(logged.messages("Warning"),
+              ElementsAre("Cannot enable notification launch for dataclass com.korvo.Calendars - "
+                          "error code 5 returned."));
+  auto queued = prefs.getQueuedDataclasses(true).value_or(std::vector<std::string>{});
+  std::ranges::sort(queued);
+  EXPECT_THAT(queued, ElementsAre("com.korvo+odd", "com.korvo.Calendars", "com.korvo.Contacts"));
+  EXPECT_EQ(logged.count("Info",
+                         "com.korvo.Calendars enabled for notifications, adding to "
+                         "dataclass queue"),
+            1u);
+
+  std::filesystem::remove(file);
+  std::filesystem::rename(file + ".kept", file);
+  helper.disableDataclassForNotifications("com.korvo.Contacts");
+  EXPECT_TRUE(launchables().empty());
+  EXPECT_THAT(logged.messages("Info"),
+              Contains("Removing subscription for topic = " + topic("com.korvo.Contacts")));
+  helper.disableDataclassForNotifications("com.korvo.Contacts");
+  EXPECT_THAT(logged.messages("Warning").back(),
+              "Cannot disable notification launch for dataclass com.korvo.Contacts - error code 2 "
+              "returned.");
+  EXPECT_TRUE(prefs.getQueuedDataclasses(true).value_or(std::vector<std::string>{}).empty());
+}
+
+TEST_F(Notify, TheLoginSessionIsAddedOnlyWhenNoneIsAndNothingMovesWhileItsStateIsUnknown) {
+  const std::string unit =
+      home.path() + "/.config/systemd/user/com.korvo.NubiloPushListener.service";
+  EXPECT_EQ(NotifyHelper::isBeaconEnabledForAccount(kAccount), 2);
+  NotifyHelper::setBeaconEnabled(true, kAccount);
+  EXPECT_EQ(NotifyHelper::isBeaconEnabledForAccount(kAccount), 1);
+  EXPECT_THAT(vtc::local::Computer::read(unit), HasSubstr("nubilosyncclient listen\n"));
+  EXPECT_THAT(vtc::local::Computer::read(unit), HasSubstr("Restart=always\n"));
+  EXPECT_THAT(manager.calls(), ElementsAre("daemon-reload", "enable --now " + unit));
+  EXPECT_EQ(vtc::push::readRegistrations()->onLoadSessions.at(0).service, "Kitbag");
+
+  manager.forgetCalls();
+  NotifyHelper::setBeaconEnabled(true, kAccount);  // state 1: never a second one
+  EXPECT_TRUE(manager.calls().empty());
+  EXPECT_EQ(vtc::push::readRegistrations()->onLoadSessions.size(), 1u);
+
+  NotifyHelper::setBeaconEnabled(false, kAccount);
+  EXPECT_EQ(NotifyHelper::isBeaconEnabledForAccount(kAccount), 2);
+  EXPECT_FALSE(std::filesystem::exists(unit));
+  EXPECT_THAT(manager.calls(),
+              ElementsAre("disable --now com.korvo.NubiloPushListener.service", "daemon-reload"));
+
+  manager.forgetCalls();
+  vtc::local::Computer::write(*vtc::push::registrationsFile(), "not a property list");
+  EXPECT_EQ(NotifyHelper::isBeaconEnabledForAccount(kAccount), -1);
+  NotifyHelper::setBeaconEnabled(true, kAccount);
+  NotifyHelper::setBeaconEnabled(false, kAccount);
+  EXPECT_TRUE(manager.calls().empty());
+  EXPECT_EQ(vtc::local::Computer::read(*vtc::push::registrationsFile()), "not a property list");
+}
+
+TEST_F(Notify, AMissingOrRefusingServerLeavesNoSessionPublishingIsTriedAndNoPasswordIsLogged) {
+  NotifyHelper& helper = NotifyHelper::notificationSessionForAccount(kAccount, kPassword);
+  EXPECT_THAT(logged.messages("Warning"),
+              ElementsAre("Could not schedule the Beacon Notification session - invalid session "
+                          "returned"));
+  helper.addDataclassToNotify("com.korvo.Contacts", Value("x"));
+  helper.sendNotifications();
+  EXPECT_FALSE(helper.queuedNotifications());
+  EXPECT_THAT(logged.messages("Warning").back(),
+              "Could not publish on " + topic("com.korvo.Contacts") + ": no push session");
+
+  startBroker();
+  NotifyHelper::resetSharedHelperForTesting();
+  NotifyHelper::notificationSessionForAccount(kAccount, "a wrong password");
+  EXPECT_THAT(logged.messages("Warning"),
+              Contains(StartsWith("Could not open a push session: the push server at " +
+                                  broker->url() + " refused the connection")));
+  for (const auto& line : logged.lines()) {
+    EXPECT_THAT(line.message, testing::Not(HasSubstr("wrong password")));
+    EXPECT_THAT(line.message, testing::Not(HasSubstr(kPassword)));
+  }
+}
+
+TEST_F(Notify, OverTlsTheSessionTrustsTheAuthorityItIsPointedAtAndNoOther) {
+  startBroker(true);
+  const char* previous = std::getenv("SSL_CERT_FILE");
+  const std::string kept = previous ? previous : "";
+  setenv("SSL_CERT_FILE", broker->certificateFile().c_str(), 1);
+  auto other = subscriber();
+  NotifyHelper& helper = NotifyHelper::notificationSessionForAccount(kAccount, kPassword);
+  helper.addDataclassToNotify("com.korvo.Contacts", Value("over TLS"));
+  helper.addDataclassToNotify("marker", Value());
+  helper.sendNotifications();
+  EXPECT_EQ(until(*other, "marker").count(topic("com.korvo.Contacts")), 1u);
+
+  NotifyHelper::resetSharedHelperForTesting();
+  const std::string empty = home.path() + "/no-authorities.pem";
+  vtc::local::Computer::write(empty, "");
+  setenv("SSL_CERT_FILE", empty.c_str(), 1);
+  NotifyHelper::notificationSessionForAccount(kAccount, kPassword);
+  EXPECT_THAT(logged.messages("Warning"),
+              Contains("Could not schedule the Beacon Notification session - invalid session "
+                       "returned"));
+  if (previous)
+    setenv("SSL_CERT_FILE", kept.c_str(), 1);
+  else
+    unsetenv("SSL_CERT_FILE");
+}
+
+}  // namespace
