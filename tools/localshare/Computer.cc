@@ -77,24 +77,28 @@ pid_t Computer::start(const std::vector<std::string>& args) const {
 }
 
 pid_t Computer::spawn(const std::vector<std::string>& args, const std::string& input) const {
-  std::vector<std::string> argv{clientProgram()};
-  argv.insert(argv.end(), args.begin(), args.end());
-  std::vector<std::string> env = environment();
   const std::string out = home_ + "/.last-out", err = home_ + "/.last-err";
   pid_t pid = ::fork();
   if (pid == 0) {
     ::dup2(::open(input.c_str(), O_RDONLY), 0);  // a file: never a terminal
     ::dup2(::open(out.c_str(), O_WRONLY | O_CREAT | O_TRUNC, 0644), 1);
     ::dup2(::open(err.c_str(), O_WRONLY | O_CREAT | O_TRUNC, 0644), 2);
-    std::vector<char*> cargv, cenv;
-    for (auto& a : argv) cargv.push_back(a.data());
-    cargv.push_back(nullptr);
-    for (auto& v : env) cenv.push_back(v.data());
-    cenv.push_back(nullptr);
-    ::execve(cargv[0], cargv.data(), cenv.data());
-    ::_exit(127);
+    execClient(args, environment());
   }
   return pid;
+}
+
+void Computer::execClient(const std::vector<std::string>& args,
+                          std::vector<std::string> env) const {
+  std::vector<std::string> argv{clientProgram()};
+  argv.insert(argv.end(), args.begin(), args.end());
+  std::vector<char*> cargv, cenv;
+  for (auto& a : argv) cargv.push_back(a.data());
+  cargv.push_back(nullptr);
+  for (auto& v : env) cenv.push_back(v.data());
+  cenv.push_back(nullptr);
+  ::execve(cargv[0], cargv.data(), cenv.data());
+  ::_exit(127);
 }
 
 Computer::Result Computer::finish(pid_t pid) const {
@@ -116,21 +120,11 @@ Computer::Result Computer::run(const std::vector<std::string>& args,
 }
 
 Computer::Result Computer::runOnTerminal(const std::vector<std::string>& args) const {
-  std::vector<std::string> argv{clientProgram()};
-  argv.insert(argv.end(), args.begin(), args.end());
   std::vector<std::string> env = environment();
   env.push_back("TERM=xterm");
   int terminal = -1;
   pid_t pid = ::forkpty(&terminal, nullptr, nullptr, nullptr);
-  if (pid == 0) {
-    std::vector<char*> cargv, cenv;
-    for (auto& a : argv) cargv.push_back(a.data());
-    cargv.push_back(nullptr);
-    for (auto& v : env) cenv.push_back(v.data());
-    cenv.push_back(nullptr);
-    ::execve(cargv[0], cargv.data(), cenv.data());
-    ::_exit(127);
-  }
+  if (pid == 0) execClient(args, std::move(env));
   Result r;
   char buffer[4096];
   for (ssize_t n; (n = ::read(terminal, buffer, sizeof buffer)) > 0;) r.out.append(buffer, n);

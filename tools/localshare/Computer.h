@@ -63,6 +63,9 @@ class Computer {
 
  private:
   std::vector<std::string> environment() const;
+  // In a child: becomes the client ([[noreturn]]).
+  [[noreturn]] void execClient(const std::vector<std::string>& args,
+                               std::vector<std::string> env) const;
   // Starts the client with standard input read from the file input.
   pid_t spawn(const std::vector<std::string>& args, const std::string& input) const;
   std::string name_;
