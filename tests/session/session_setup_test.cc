@@ -12,6 +12,7 @@
 
 #include "VantorSyncManager/NubiloException.h"
 #include "VantorSyncManager/PublicNames.h"
+#include "localshare/ApacheShare.h"
 #include "platform/dav/TesselSession.h"
 #include "support/Failures.h"
 #include "support/ShareTest.h"
