@@ -37,14 +37,17 @@ struct ScopedEnv {
 };
 
 using SessionSetup = vtc::test::ShareTest;
+using SyncArea = vtc::test::OnEachServer<vtc::test::ShareTest>;
+INSTANTIATE_TEST_SUITE_P(Servers, SyncArea, vtc::test::kEachServer, vtc::test::serverName);
 
-TEST_F(SessionSetup, CreatesTheSyncAreaNotesTheRespondingServerAndRemovesTheArea) {
+TEST_P(SyncArea, CreatesTheSyncAreaNotesTheRespondingServerAndRemovesTheArea) {
   auto session = openSession();
   std::string sync = ApacheShare::kSyncPath;
   EXPECT_EQ(session->clientsPath(), sync + "/Clients");
   EXPECT_EQ(session->schemasPath(), sync + "/Schemas");
-  EXPECT_EQ(session->respondingServer(), "dav-test-1");
-  EXPECT_EQ(logged.count("Info", "Responding server: dav-test-1"), 1u);
+  EXPECT_EQ(session->respondingServer(), share.respondingServer());
+  EXPECT_EQ(logged.count("Info", std::string("Responding server: ") + share.respondingServer()),
+            1u);
   EXPECT_EQ(session->eventUUID().size(), 36u);
   EXPECT_TRUE(time.sleeps().empty());
 
@@ -52,10 +55,7 @@ TEST_F(SessionSetup, CreatesTheSyncAreaNotesTheRespondingServerAndRemovesTheArea
   // and nothing else.
   auto second = openSession();
   EXPECT_TRUE(second->createSyncPaths());
-  std::set<std::string> members;
-  for (const auto& entry : std::filesystem::directory_iterator(share.diskPath(sync)))
-    members.insert(entry.path().filename().string() + (entry.is_directory() ? "/" : ""));
-  EXPECT_EQ(members, (std::set<std::string>{"Clients/", "Schemas/"}));
+  EXPECT_EQ(share.members(sync), (std::set<std::string>{"Clients/", "Schemas/"}));
 
   EXPECT_TRUE(second->removeSyncPaths());
   EXPECT_FALSE(std::filesystem::exists(share.diskPath(sync)));

@@ -7,6 +7,7 @@
 #include <gtest/gtest.h>
 
 #include <memory>
+#include <ostream>
 #include <string>
 
 #include "VantorSyncManager/NubiloRemoteSession.h"
@@ -15,6 +16,13 @@
 #include "support/LogCapture.h"
 #include "support/TestHome.h"
 #include "support/TraceCapture.h"
+
+namespace vtc::local {
+// Names the server in a failing parameterised test's message.
+inline void PrintTo(ShareKind kind, std::ostream* os) {
+  *os << shareKindName(kind);
+}
+}  // namespace vtc::local
 
 namespace vtc::test {
 

@@ -25,6 +25,9 @@ class SabreShare : public Share {
   // The name of the file in each folder that holds its members' properties.
   static constexpr const char* kPropertyFile = ".sabredav";
 
+ protected:
+  bool ownFile(const std::string& name) const override { return name == kPropertyFile; }
+
  private:
   void writeServer(const Options& options);
 };

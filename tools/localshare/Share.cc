@@ -73,6 +73,15 @@ void Share::giveToWorkers(const char* user) const {
   (void)::chown(root_.c_str(), pw->pw_uid, pw->pw_gid);
 }
 
+std::set<std::string> Share::members(const std::string& serverPath) const {
+  std::set<std::string> names;
+  for (const auto& entry : std::filesystem::directory_iterator(diskPath(serverPath))) {
+    const std::string name = entry.path().filename().string();
+    if (!ownFile(name)) names.insert(name + (entry.is_directory() ? "/" : ""));
+  }
+  return names;
+}
+
 std::string Share::url(const std::string& serverPath) const {
   return std::string(tls_ ? "https" : "http") + "://127.0.0.1:" + std::to_string(port_) +
          serverPath;

@@ -9,6 +9,7 @@
 #include <sys/types.h>
 
 #include <memory>
+#include <set>
 #include <string>
 #include <vector>
 
@@ -40,6 +41,9 @@ class Share {
   const std::string& documentRoot() const { return documentRoot_; }
   // The disk path of a server path.
   std::string diskPath(const std::string& serverPath) const { return documentRoot_ + serverPath; }
+  // The names of the members of a served folder, a folder's with a trailing
+  // "/"; files the server keeps there for itself are left out.
+  std::set<std::string> members(const std::string& serverPath) const;
   // The address of a server path ("http://127.0.0.1:PORT/sync").
   std::string url(const std::string& serverPath = "") const;
 
@@ -69,6 +73,8 @@ class Share {
   void start(const std::vector<std::string>& argv, const std::string& errorLog);
   // Hands the folder to the worker user when started as root.
   void giveToWorkers(const char* user) const;
+  // Whether a file of that name in a served folder is the server's own.
+  virtual bool ownFile(const std::string&) const { return false; }
 
   std::string root_;
   std::string documentRoot_;

@@ -18,6 +18,19 @@
 
 namespace vtc {
 
+// What a connection has learnt of its server's ways from the server's
+// answers; each starts as the standard behaviour.
+struct ServerTraits {
+  // Whether a write under a locked collection must present only the locks
+  // of the resource itself, the server refusing (412) a token of the
+  // parent's lock; unknown until a 412 tells.
+  std::optional<bool> refusesParentTokens;
+  // The lock discovery leaves out the owner that the LOCK carried.
+  bool dropsLockOwners = false;
+  // A lock lasts as long as the server likes, not as long as asked.
+  bool ignoresLockTimeouts = false;
+};
+
 struct DavEndpoint {
   std::string scheme;
   std::string host;
@@ -37,6 +50,7 @@ class DavConnection {
   const DavEndpoint& endpoint() const { return endpoint_; }
   ne_session* session() const { return session_; }
   ne_lock_store* lockStore() const { return locks_; }
+  ServerTraits& traits() { return traits_; }
 
   // Read and connect time-out in seconds (neon's resolution). neon applies it
   // when it connects, so a change closes an open connection.
@@ -66,6 +80,7 @@ class DavConnection {
   ne_session* session_ = nullptr;
   ne_lock_store* locks_ = nullptr;
   Capture capture_;
+  ServerTraits traits_;
   int readTimeout_ = 0;
   bool used_ = false;  // a connection may be open
 };
