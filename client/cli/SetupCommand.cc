@@ -10,6 +10,7 @@
 #include "client/cli/Commands.h"
 #include "client/cli/Terminal.h"
 #include "client/run/Account.h"
+#include "client/run/ServerQualification.h"
 #include "client/run/SyncFailure.h"
 #include "common/Uuid.h"
 #include "prefs/ClientConfiguration.h"
@@ -24,10 +25,10 @@ std::string hostName() {
   return name;
 }
 
-// What syncing needs of the share beyond a login: properties that stay
-// (the client record) and locks.
-void qualify(NubiloRemoteSession& session, const std::string& guid, const std::string& name,
-             const std::string& url) {
+// This computer on the account: its client record, which must come back
+// whole.
+void registerComputer(NubiloRemoteSession& session, const std::string& guid,
+                      const std::string& name, const std::string& url) {
   try {
     session.registerClient(guid, name);
   } catch (const NubiloException& e) {
@@ -36,17 +37,8 @@ void qualify(NubiloRemoteSession& session, const std::string& guid, const std::s
   if (session.getClientInfo(guid).get("guid").string() != guid)
     throw SyncFailure(FailureKind::ServerUnsuitable,
                       "The server at " + url +
-                          " does not keep WebDAV properties (PROPPATCH); syncing needs a "
-                          "WebDAV server with dead properties, such as Apache with mod_dav_fs.");
-  try {
-    session.lockClient(guid);
-    session.unlockClient(guid);
-  } catch (const NubiloException& e) {
-    throw SyncFailure(
-        FailureKind::ServerUnsuitable,
-        "The server at " + url +
-            " does not lock resources (WebDAV class 2); syncing needs locks: " + e.reason());
-  }
+                          " did not keep this computer's record on the account; syncing needs "
+                          "a WebDAV server with dead properties (PROPPATCH).");
 }
 
 }  // namespace
@@ -73,7 +65,17 @@ int setupCommand(const SetupRequest& request, Output& output) {
   configuration.set("ClientGuid", Value(guid));
   configuration.set("ClientName", Value(name));
   auto session = openSession(request.member, password, configuration);
-  qualify(*session, guid, name, server.url());
+  // The second client of the checks: another computer as far as the share
+  // can tell.
+  Dictionary otherConfiguration = configuration;
+  const std::string otherGuid = makeUUIDString();
+  otherConfiguration.set("guid", Value(otherGuid));
+  otherConfiguration.set("ClientGuid", Value(otherGuid));
+  otherConfiguration.set("ClientName", Value(name + " (setup check)"));
+  qualifyServer(
+      *session, [&] { return openSession(request.member, password, otherConfiguration); },
+      server.url());
+  registerComputer(*session, guid, name, server.url());
 
   AccountSetup setup{server, request.member, request.passwordCommand};
   storeAccount(setup, password, guid, name);

@@ -223,12 +223,13 @@ class VSM_EXPORT NubiloRemoteSession {
   int64_t lockAcquireSleepInterval() const { return _lockAcquireSleepInterval; }
   const std::set<std::string>& lockedResources() const { return _lockedResources; }
   const std::string& lockOwnerFormatString() const { return _lockOwnerFormatString; }
+  // The owner text of a lock taken now (the template stamped with the date).
+  std::string lockOwnerText() const;
   const std::optional<std::string>& respondingServer() const { return _respondingServer; }
 
  protected:
   DavTransaction retrying(const vtc::RetryTexts& texts, const std::string& subject,
                           const std::function<DavTransaction()>& issue);
-  std::string lockOwnerText() const;
   std::string clientPath(const std::string& guid) const;
   std::string dataclassLockPath(const std::string& dataclass) const;
   std::string dataclassPath(const std::string& dataclass) const;

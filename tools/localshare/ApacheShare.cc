@@ -1,6 +1,5 @@
 #include "localshare/ApacheShare.h"
 
-#include <openssl/evp.h>
 #include <signal.h>
 #include <unistd.h>
 
@@ -17,15 +16,6 @@ namespace {
 constexpr const char* kApache = "/usr/sbin/apache2";
 constexpr const char* kModules = "/usr/lib/apache2/modules";
 
-std::string shaPasswordLine(const std::string& user, const std::string& password) {
-  unsigned char digest[EVP_MAX_MD_SIZE];
-  unsigned int len = 0;
-  EVP_Digest(password.data(), password.size(), digest, &len, EVP_sha1(), nullptr);
-  unsigned char b64[64];
-  EVP_EncodeBlock(b64, digest, static_cast<int>(len));
-  return user + ":{SHA}" + reinterpret_cast<char*>(b64) + "\n";
-}
-
 }  // namespace
 
 ApacheShare::ApacheShare(Options options) : Share("vsm-dav", options.tls) {
@@ -35,7 +25,7 @@ ApacheShare::ApacheShare(Options options) : Share("vsm-dav", options.tls) {
 }
 
 void ApacheShare::writeConfiguration() {
-  writeTextFile(root_ + "/htpasswd", shaPasswordLine(kUser, kPassword));
+  writeTextFile(root_ + "/htpasswd", passwordFileLine(kUser, kPassword));
   std::ostringstream c;
   c << "ServerRoot " << root_ << "\n"
     << "ServerName 127.0.0.1\n"

@@ -30,6 +30,10 @@ class ApacheShare : public Share {
   // has the server take them up (a graceful restart, same port).
   void renewCertificate();
 
+ protected:
+  // mod_dav_fs keeps properties and state in a ".DAV" folder beside them.
+  bool ownFile(const std::string& name) const override { return name == ".DAV"; }
+
  private:
   void writeConfiguration();
   void makeCertificate(bool withAuthority);

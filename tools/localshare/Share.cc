@@ -1,5 +1,6 @@
 #include "localshare/Share.h"
 
+#include <openssl/evp.h>
 #include <pwd.h>
 #include <sys/stat.h>
 #include <sys/wait.h>
@@ -28,6 +29,15 @@ void writeTextFile(const std::string& path, const std::string& text) {
   std::ofstream out(path);
   out << text;
   if (!out) throw std::runtime_error("cannot write " + path);
+}
+
+std::string Share::passwordFileLine(const std::string& user, const std::string& password) {
+  unsigned char digest[EVP_MAX_MD_SIZE];
+  unsigned int len = 0;
+  EVP_Digest(password.data(), password.size(), digest, &len, EVP_sha1(), nullptr);
+  unsigned char b64[64];
+  EVP_EncodeBlock(b64, digest, static_cast<int>(len));
+  return user + ":{SHA}" + reinterpret_cast<char*>(b64) + "\n";
 }
 
 Share::Share(const char* prefix, bool tls) : tls_(tls) {

@@ -73,6 +73,8 @@ class Share {
   void start(const std::vector<std::string>& argv, const std::string& errorLog);
   // Hands the folder to the worker user when started as root.
   void giveToWorkers(const char* user) const;
+  // A Basic-auth password file line for user ("user:{SHA}...").
+  static std::string passwordFileLine(const std::string& user, const std::string& password);
   // Whether a file of that name in a served folder is the server's own.
   virtual bool ownFile(const std::string&) const { return false; }
 
