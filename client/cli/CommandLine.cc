@@ -66,6 +66,8 @@ int runCommandLine(int argc, char** argv) {
   setupCommandLine->add_option("--user", setup.member, "The member name")->required();
   setupCommandLine->add_option("--password-command", passwordCommand,
                                "A command whose first output line is the password");
+  setupCommandLine->add_option("--ca-file", setup.caFile,
+                               "The certificate (PEM) of the authority of an HTTPS server");
 
   std::string kind, folder, dataclass;
   auto* add = app.add_subcommand("add", "Sync a vdir folder of contacts or calendars");

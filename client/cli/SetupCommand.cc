@@ -2,6 +2,7 @@
 // stores the account and turns syncing on.
 #include <unistd.h>
 
+#include <filesystem>
 #include <ostream>
 
 #include "VantorSyncManager/NubiloException.h"
@@ -13,6 +14,7 @@
 #include "client/run/ServerQualification.h"
 #include "client/run/SyncFailure.h"
 #include "common/Uuid.h"
+#include "platform/dav/TesselSession.h"
 #include "prefs/ClientConfiguration.h"
 
 namespace vtc::client {
@@ -62,6 +64,16 @@ int setupCommand(const SetupRequest& request, Output& output) {
   const std::string name = prefs.clientName().value_or(hostName());
   Dictionary configuration = config::builtInDefaults(guid, request.member);
   configuration.merge(server.configurationKeys());
+  std::optional<std::string> caFile;
+  if (request.caFile) {
+    std::error_code error;
+    const std::filesystem::path path = std::filesystem::absolute(*request.caFile, error);
+    if (error || !std::filesystem::is_regular_file(path))
+      throw SyncFailure(FailureKind::Usage,
+                        "There is no certificate file " + *request.caFile + ".");
+    caFile = path.string();
+    configuration.set("tls_ca_file", Value(*caFile));
+  }
   configuration.set("ClientGuid", Value(guid));
   configuration.set("ClientName", Value(name));
   auto session = openSession(request.member, password, configuration);
@@ -77,7 +89,9 @@ int setupCommand(const SetupRequest& request, Output& output) {
       server.url());
   registerComputer(*session, guid, name, server.url());
 
-  AccountSetup setup{server, request.member, request.passwordCommand};
+  // Later sessions trust this certificate alone: one that changes is refused.
+  AccountSetup setup{server, request.member, request.passwordCommand, caFile,
+                     session->tesselSession().serverCertificateDigest()};
   storeAccount(setup, password, guid, name);
   if (output.verbosity > 0)
     output.out << "Set up " << request.member << " at " << server.url() << " for this computer, "

@@ -1,6 +1,6 @@
-// Opening sessions against a real Apache share: the sync area, the login and
-// network failures, HTTPS trust, the lock owner text and the one persistent
-// connection.
+// Opening sessions against a real share: the sync area (on each server),
+// the login and network failures, HTTPS trust and pinning, the lock owner
+// text and the one persistent connection.
 #include <gmock/gmock.h>
 
 #include <algorithm>
@@ -114,18 +114,38 @@ TEST_F(SessionSetup, MissingServerKeysAreNamedNotCrashed) {
   }
 }
 
-TEST_F(SessionSetup, HttpsTrustsWhatTheCaStoreTrustsAndNothingElse) {
+TEST_F(SessionSetup, HttpsTrustsWhatTheAuthoritiesVouchForOrThePinnedCertificateAlone) {
   ApacheShare tls(ApacheShare::Options{.tls = true});
   vtc::Dictionary config = tls.configuration();
-  config.set("max_lock_acquire_attempts", 0);
   auto open = [&] {
     return NubiloRemoteSession::sessionWithUsername("alice", "wonderland", config);
   };
-  // Unknown authority: the connection is refused as a network failure.
-  EXPECT_THAT(
-      open, ThrowsMessage<NubiloException>(testing::StartsWith("NubiloNetworkFailureException: ")));
-  ScopedEnv trust("SSL_CERT_FILE", tls.caFile());  // the system's store, pointed at our authority
+  // Unknown authority: refused at once, and no credentials go to it.
+  const auto refused = ThrowsMessage<NubiloException>(
+      "NubiloLoginFailureException: Failed to validate credentials for alice");
+  EXPECT_THAT(open, refused);
+  EXPECT_TRUE(time.sleeps().empty());
+  EXPECT_EQ(tls.accessEntries().size(), 0u);
+  std::string digest;
+  {
+    ScopedEnv trust("SSL_CERT_FILE", tls.caFile());  // the system's store, pointed at our authority
+    auto session = open();
+    EXPECT_EQ(session->respondingServer(), "dav-test-1");
+    digest = session->tesselSession().serverCertificateDigest();
+  }
+  EXPECT_THAT(digest, testing::MatchesRegex("([0-9a-f]{2}:){31}[0-9a-f]{2}"));
+  config.set("tls_ca_file", tls.caFile());  // an authority of the server's own
+  EXPECT_EQ(open()->tesselSession().serverCertificateDigest(), digest);
+
+  // Pinned, the certificate is trusted with no authority at all, and a new
+  // one is not, whoever signed it.
+  config.erase("tls_ca_file");
+  config.set("tls_pinned_certificate", digest);
   EXPECT_EQ(open()->respondingServer(), "dav-test-1");
+  tls.renewCertificate();
+  config.set("tls_ca_file", tls.caFile());
+  EXPECT_THAT(open, refused);
+  EXPECT_TRUE(time.sleeps().empty());
 }
 
 TEST_F(SessionSetup, LockOwnerTextQuotesNamesButNotTheClientId) {

@@ -1,6 +1,5 @@
 #include "localshare/ApacheShare.h"
 
-#include <signal.h>
 #include <unistd.h>
 
 #include <cstdlib>
@@ -21,6 +20,10 @@ constexpr const char* kModules = "/usr/lib/apache2/modules";
 ApacheShare::ApacheShare(Options options) : Share("vsm-dav", options.tls) {
   writeConfiguration();
   giveToWorkers("www-data");
+  startApache();
+}
+
+void ApacheShare::startApache() {
   start({kApache, "-f", root_ + "/httpd.conf", "-DFOREGROUND"}, root_ + "/logs/error.log");
 }
 
@@ -94,9 +97,10 @@ void ApacheShare::renewCertificate() {
   if (!tls_) throw std::logic_error("renewCertificate: the share does not serve HTTPS");
   makeCertificate(/*withAuthority=*/false);
   giveToWorkers("www-data");
-  // SIGUSR1: a graceful restart that reads the certificate again; the
-  // listening socket stays open throughout.
-  ::kill(pid_, SIGUSR1);
+  // Stopped and started again on the same port: once it listens, it shows
+  // the new certificate.
+  stop();
+  startApache();
 }
 
 void ApacheShare::forgetLocks() {

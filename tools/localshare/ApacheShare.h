@@ -27,7 +27,7 @@ class ApacheShare : public Share {
   // The certificate of the authority that signed a TLS share's certificate.
   std::string caFile() const { return root_ + "/tls/ca.pem"; }
   // Gives a TLS share a new key and certificate from the same authority and
-  // has the server take them up (a graceful restart, same port).
+  // restarts the server on the same port with them.
   void renewCertificate();
 
  protected:
@@ -35,6 +35,7 @@ class ApacheShare : public Share {
   bool ownFile(const std::string& name) const override { return name == ".DAV"; }
 
  private:
+  void startApache();
   void writeConfiguration();
   void makeCertificate(bool withAuthority);
 };

@@ -1,6 +1,6 @@
-// One neon session to one server: credentials, TLS with the system's CA
-// store, time-outs, the lock store, and the capture of each request's status
-// and headers. Every request of a session travels over its one persistent
+// One neon session to one server: credentials, TLS (ServerCertificate.h),
+// time-outs, the lock store, and the capture of each request's status and
+// headers. Every request of a session travels over its one persistent
 // connection. Not thread-safe: callers serialise (TesselSession's monitor).
 #pragma once
 
@@ -15,6 +15,7 @@
 
 #include "VantorSyncManager/DavTransaction.h"
 #include "VantorSyncManager/Value.h"
+#include "platform/dav/ServerCertificate.h"
 
 namespace vtc {
 
@@ -40,9 +41,9 @@ struct DavEndpoint {
 
 class DavConnection {
  public:
-  // readTimeout: seconds, 0 for neon's default.
+  // readTimeout: seconds, 0 for neon's default. trust applies to HTTPS.
   DavConnection(DavEndpoint endpoint, std::string user, std::string password, std::string userAgent,
-                int readTimeout = 0);
+                int readTimeout = 0, CertificateTrust trust = {});
   ~DavConnection();
   DavConnection(const DavConnection&) = delete;
   DavConnection& operator=(const DavConnection&) = delete;
@@ -51,6 +52,11 @@ class DavConnection {
   ne_session* session() const { return session_; }
   ne_lock_store* lockStore() const { return locks_; }
   ServerTraits& traits() { return traits_; }
+  const CertificateTrust& trust() const { return trust_; }
+  // The digest of the certificate the server showed last; empty before one.
+  const std::string& certificateDigest() const { return certificateDigest_; }
+  // Why the server's certificate was refused last; none when it was not.
+  std::optional<CertificateRefusal> certificateRefusal() const { return refusal_; }
 
   // Read and connect time-out in seconds (neon's resolution). neon applies it
   // when it connects, so a change closes an open connection.
@@ -73,6 +79,7 @@ class DavConnection {
   static int onPostSend(ne_request* req, void* userdata, const ne_status* status);
   static int onAuthenticate(void* userdata, const char* realm, int attempt, char* username,
                             char* password);
+  static int onVerify(void* userdata, int failures, const ne_ssl_certificate* cert);
 
   DavEndpoint endpoint_;
   std::string user_;
@@ -81,6 +88,9 @@ class DavConnection {
   ne_lock_store* locks_ = nullptr;
   Capture capture_;
   ServerTraits traits_;
+  CertificateTrust trust_;
+  std::string certificateDigest_;
+  std::optional<CertificateRefusal> refusal_;
   int readTimeout_ = 0;
   bool used_ = false;  // a connection may be open
 };

@@ -18,6 +18,10 @@ TesselSession::TesselSession(std::shared_ptr<MemberAccount> account, std::string
 
 TesselSession::~TesselSession() = default;
 
+std::string TesselSession::serverCertificateDigest() const {
+  return connection_->certificateDigest();
+}
+
 void TesselSession::_setReadTimeOut(int32_t seconds) {
   connection_->setReadTimeout(seconds);
 }

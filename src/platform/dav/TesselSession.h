@@ -120,6 +120,8 @@ class TesselSession {
   DavTransaction _sendReportingInfo(const vtc::Dictionary& report, const std::string& reportsPath);
 
   const std::string& owner() const { return owner_; }
+  // The SHA-256 digest of the HTTPS server's certificate; empty over HTTP.
+  std::string serverCertificateDigest() const;
   bool isSynchronous() const { return synchronous_; }
   // Whether this session holds a lock on path in its lock store.
   bool holdsLockOnPath(const std::string& path) const;
