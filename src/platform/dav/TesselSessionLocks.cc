@@ -6,12 +6,14 @@
 #include <ne_locks.h>
 #include <ne_string.h>
 
+#include <chrono>
 #include <cmath>
 #include <cstdlib>
 #include <ctime>
 
 #include "VantorSyncManager/PublicNames.h"
 #include "VantorSyncManager/StringAdditions.h"
+#include "common/Clock.h"
 #include "platform/dav/DavConnection.h"
 #include "platform/dav/DavPaths.h"
 #include "platform/dav/LockRecord.h"
@@ -35,6 +37,19 @@ void forgetLock(vtc::DavConnection& conn, struct ne_lock* lock) {
 
 long lockSeconds(double duration) {
   return std::max(1L, std::lround(duration));
+}
+
+// The server's time of an answer (its Date header); the clock's when the
+// answer has none.
+std::optional<std::time_t> serverTimeOf(const DavTransaction& answer) {
+  const vtc::Value* date =
+      answer._responseHeaders() ? answer._responseHeaders()->find("Date") : nullptr;
+  return vtc::serverTime(date ? date->string() : "");
+}
+
+std::time_t timeOf(const DavTransaction& answer) {
+  return serverTimeOf(answer).value_or(
+      std::chrono::system_clock::to_time_t(vtc::currentClock().now()));
 }
 
 DavTransaction notHeld(const std::string& method, const std::string& path) {
@@ -187,13 +202,10 @@ void TesselSession::recordLockWhereNeeded(const std::string& path, const std::st
       traits.ignoresLockTimeouts = true;
   }
   if (!traits.dropsLockOwners && !traits.ignoresLockTimeouts) return;
-  const vtc::Value* date =
-      answer._responseHeaders() ? answer._responseHeaders()->find("Date") : nullptr;
-  const std::time_t now = vtc::serverTime(date ? date->string() : "").value_or(std::time(nullptr));
   // The record helps others; a lock without one still excludes them, so a
   // refused write only leaves the owner unknown and the lock to the
   // server's own time-out.
-  if (writeLockRecord(path, vtc::LockRecord{token, now + seconds, owner}).isSuccessful())
+  if (writeLockRecord(path, vtc::LockRecord{token, timeOf(answer) + seconds, owner}).isSuccessful())
     recordedLocks_.insert(path);
 }
 
@@ -204,9 +216,8 @@ DavTransaction TesselSession::writeLockRecord(const std::string& path,
 }
 
 bool TesselSession::giveBackOverdueLock(const std::string& path, const DavTransaction& refusal) {
-  const vtc::Value* date =
-      refusal._responseHeaders() ? refusal._responseHeaders()->find("Date") : nullptr;
-  const std::optional<std::time_t> now = vtc::serverTime(date ? date->string() : "");
+  // Only the server's own time can tell: the record holds the server's.
+  const std::optional<std::time_t> now = serverTimeOf(refusal);
   if (!now) return false;
   DavTransaction t = extendedAttributesAtPath(path);
   const vtc::Value* text =
@@ -238,12 +249,9 @@ DavTransaction TesselSession::_relockResourceAtPath(const std::string& path, dou
   // and only an unlock that succeeds, or a new lock of the path, ends it here.
   if (t.isSuccessful()) lock->timeout = seconds;
   if (t.isSuccessful() && recordedLocks_.count(path) && connection_->traits().ignoresLockTimeouts) {
-    const vtc::Value* date = t._responseHeaders() ? t._responseHeaders()->find("Date") : nullptr;
-    const std::time_t now =
-        vtc::serverTime(date ? date->string() : "").value_or(std::time(nullptr));
     // As at the lock: a record not renewed only lets others give the lock
     // back sooner, as a server that keeps time-outs would end it.
-    writeLockRecord(path, vtc::LockRecord{lock->token, now + seconds, lock->owner});
+    writeLockRecord(path, vtc::LockRecord{lock->token, timeOf(t) + seconds, lock->owner});
   }
   return t;
 }
