@@ -20,7 +20,8 @@ std::optional<LockRecord> LockRecord::parse(std::string_view text) {
   long long expires = 0;
   const char* begin = text.data() + first + 1;
   const char* end = text.data() + second;
-  if (std::from_chars(begin, end, expires).ptr != end) return std::nullopt;
+  const auto [stop, error] = std::from_chars(begin, end, expires);
+  if (error != std::errc() || stop != end) return std::nullopt;
   r.expires = static_cast<std::time_t>(expires);
   r.owner = std::string(text.substr(second + 1));
   return r;
