@@ -55,16 +55,17 @@ class TesselSession {
   // Locks (depth 0, exclusive, write). A lock of a missing resource, or of
   // one whose parent is missing, fails as not found (result 104, HTTP 404)
   // instead of leaving a lock-null resource; a server that creates the
-  // resource anyway (201) has it deleted again. A lock of a path whose
-  // earlier lock the server no longer knows sets that lock's token aside and
-  // asks again. A granted lock is checked in the lock discovery; one that
-  // the server gave to another client at the same moment fails as locked
-  // (HTTP 423). Where the discovery drops the owner or the time-out asked
-  // for, a lock record is kept beside the lock (platform/dav/LockRecord.h);
-  // a lock refused because of another client's lock that its record shows
-  // overdue is given back and asked for again. A lock leaves the lock store
-  // only when an unlock succeeds or a new lock of the same path replaces it:
-  // a refused relock or unlock keeps it.
+  // resource anyway (201) has it deleted again (it made a file: a caller
+  // about to make a collection there should make it before locking it). A
+  // lock of a path whose earlier lock the server no longer knows sets that
+  // lock's token aside and asks again. A granted lock is checked in the lock
+  // discovery; one that the server gave to another client at the same moment
+  // fails as locked (HTTP 423). Where the discovery drops the owner or the
+  // time-out asked for, a lock record is kept beside the lock
+  // (platform/dav/LockRecord.h); a lock refused because of another client's
+  // lock that its record shows overdue is given back and asked for again. A
+  // lock leaves the lock store only when an unlock succeeds or a new lock of
+  // the same path replaces it: a refused relock or unlock keeps it.
   DavTransaction lockResourceAtPath(const std::string& path);
   DavTransaction unlockResourceAtPath(const std::string& path);
   DavTransaction _lockResourceAtPath(const std::string& path, double duration,

@@ -138,7 +138,7 @@ DavTransaction TesselSession::_lockResourceAtPath(const std::string& path, doubl
     ne_lockstore_add(connection_->lockStore(), lock);
     if (t.httpStatusCode() == 201) {
       // The server ignored If-Match and made the missing resource to lock
-      // it. It is this lock's, so no one else has seen it: it goes again.
+      // it. Under this lock no one else can have written it: it goes again.
       deleteResourceAtPath(path);
       connection_->perform("UNLOCK", path, [&] { return ne_unlock(connection_->session(), lock); });
       forgetLock(*connection_, lock);
