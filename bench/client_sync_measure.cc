@@ -4,7 +4,7 @@
 // floor in the same run: curl fetching as many such files over one
 // keep-alive connection.
 //
-//   client_sync_measure [CARDS]     (default 1000)
+//   client_sync_measure [CARDS] [apache|sabre]     (default 1000, apache)
 #include <chrono>
 #include <cstdio>
 #include <cstdlib>
@@ -13,12 +13,12 @@
 #include <set>
 #include <string>
 
-#include "localshare/ApacheShare.h"
 #include "localshare/Computer.h"
+#include "localshare/Share.h"
 #include "platform/fs/LocalPaths.h"
 
-using vtc::local::ApacheShare;
 using vtc::local::Computer;
+using vtc::local::Share;
 
 namespace {
 
@@ -46,7 +46,7 @@ struct Phase {
   size_t writes = 0;
 };
 
-Phase timed(const char* name, ApacheShare& share, const Computer& c) {
+Phase timed(const char* name, Share& share, const Computer& c) {
   const size_t before = share.accessEntries().size();
   auto start = std::chrono::steady_clock::now();
   Computer::Result r = c.run({"sync"});
@@ -68,11 +68,14 @@ int main(int argc, char** argv) {
       vtc::paths::join(vtc::paths::temporaryDirectory(), "vsm-client-measure-XXXXXX");
   const std::string home = ::mkdtemp(tmpl.data());
   ::setenv("HOME", home.c_str(), 1);
-  ApacheShare share;
-  const std::string url = "http://127.0.0.1:" + std::to_string(share.port()) + "/sync";
+  const bool sabre = argc > 2 && std::string(argv[2]) == "sabre";
+  auto server =
+      vtc::local::startShare(sabre ? vtc::local::ShareKind::Sabre : vtc::local::ShareKind::Apache);
+  Share& share = *server;
+  const std::string url = share.url("/sync");
   Computer a("Mac A"), b("Mac B");
-  a.join(url, ApacheShare::kUser, ApacheShare::kPassword);
-  b.join(url, ApacheShare::kUser, ApacheShare::kPassword);
+  a.join(url, Share::kUser, Share::kPassword);
+  b.join(url, Share::kUser, Share::kPassword);
   size_t bytes = 0;
   for (int i = 0; i < cards; ++i) {
     std::string c = card(i, 0);
@@ -113,8 +116,8 @@ int main(int argc, char** argv) {
   for (auto& f : std::filesystem::directory_iterator(floorPath))
     std::filesystem::permissions(f.path(), std::filesystem::perms::all,
                                  std::filesystem::perm_options::add);
-  const std::string curl = "curl -sf -u " + std::string(ApacheShare::kUser) + ":" +
-                           ApacheShare::kPassword + " -K " + home + "/curl.conf";
+  const std::string curl = "curl -sf -u " + std::string(Share::kUser) + ":" + Share::kPassword +
+                           " -K " + home + "/curl.conf";
   double floor = 1e9;
   for (int run = 0; run < 3; ++run) {
     auto start = std::chrono::steady_clock::now();
@@ -123,7 +126,8 @@ int main(int argc, char** argv) {
         floor, std::chrono::duration<double>(std::chrono::steady_clock::now() - start).count());
   }
 
-  std::printf("%d cards, %zu bytes on average\n", cards, bytes / static_cast<size_t>(cards));
+  std::printf("%s: %d cards, %zu bytes on average\n", share.name(), cards,
+              bytes / static_cast<size_t>(cards));
   std::printf("%-24s %10s %9s %7s %9s\n", "phase", "seconds", "requests", "writes", "x floor");
   for (const Phase& p : phases)
     std::printf("%-24s %10.3f %9zu %7zu %9.2f\n", p.name, p.seconds, p.requests, p.writes,

@@ -77,6 +77,8 @@ int runCommandLine(int argc, char** argv) {
   std::string pushServer;
   setupCommandLine->add_option("--push", pushServer,
                                "mqtt[s]://host[:port] of the push server (same account)");
+  setupCommandLine->add_option("--ca-file", setup.caFile,
+                               "The certificate (PEM) of the authority of an HTTPS server");
 
   std::string kind, folder, dataclass;
   auto* add = app.add_subcommand("add", "Sync a vdir folder of contacts or calendars");

@@ -23,6 +23,7 @@ struct SetupRequest {
   std::string member;
   std::optional<std::string> passwordCommand;
   bool passwordFromStdin = false;
+  std::optional<std::string> caFile;  // an authority's certificate to trust (HTTPS)
 };
 
 int setupCommand(const SetupRequest& request, Output& output);

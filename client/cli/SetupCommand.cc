@@ -2,6 +2,7 @@
 // stores the account and turns syncing on.
 #include <unistd.h>
 
+#include <filesystem>
 #include <iostream>
 #include <ostream>
 
@@ -12,10 +13,12 @@
 #include "client/cli/Commands.h"
 #include "client/cli/Terminal.h"
 #include "client/run/Account.h"
+#include "client/run/ServerQualification.h"
 #include "client/run/SyncFailure.h"
 #include "common/Clock.h"
 #include "common/Format.h"
 #include "common/Uuid.h"
+#include "platform/dav/TesselSession.h"
 #include "prefs/ClientConfiguration.h"
 
 namespace vtc::client {
@@ -28,11 +31,10 @@ std::string hostName() {
   return name;
 }
 
-// What syncing needs of the share beyond a login: properties that stay
-// (the client record) and locks. Returns the client record as the share
-// keeps it.
-Dictionary qualify(NubiloRemoteSession& session, const std::string& guid, const std::string& name,
-                   const std::string& url) {
+// This computer on the account: its client record, which must come back
+// whole. Returns it as the share keeps it.
+Dictionary registerComputer(NubiloRemoteSession& session, const std::string& guid,
+                            const std::string& name, const std::string& url) {
   try {
     session.registerClient(guid, name);
   } catch (const NubiloException& e) {
@@ -42,17 +44,8 @@ Dictionary qualify(NubiloRemoteSession& session, const std::string& guid, const 
   if (record.get("guid").string() != guid)
     throw SyncFailure(FailureKind::ServerUnsuitable,
                       "The server at " + url +
-                          " does not keep WebDAV properties (PROPPATCH); syncing needs a "
-                          "WebDAV server with dead properties, such as Apache with mod_dav_fs.");
-  try {
-    session.lockClient(guid);
-    session.unlockClient(guid);
-  } catch (const NubiloException& e) {
-    throw SyncFailure(
-        FailureKind::ServerUnsuitable,
-        "The server at " + url +
-            " does not lock resources (WebDAV class 2); syncing needs locks: " + e.reason());
-  }
+                          " did not keep this computer's record on the account; syncing needs "
+                          "a WebDAV server with dead properties (PROPPATCH).");
   return record;
 }
 
@@ -82,17 +75,41 @@ int setupCommand(const SetupRequest& request, Output& output) {
   const std::string name = prefs.clientName().value_or(hostName());
   Dictionary configuration = config::builtInDefaults(guid, request.member);
   configuration.merge(server.configurationKeys());
+  std::optional<std::string> caFile;
+  if (request.caFile) {
+    std::error_code error;
+    const std::filesystem::path path = std::filesystem::absolute(*request.caFile, error);
+    if (error || !std::filesystem::is_regular_file(path))
+      throw SyncFailure(FailureKind::Usage,
+                        "There is no certificate file " + *request.caFile + ".");
+    caFile = path.string();
+    configuration.set("tls_ca_file", Value(*caFile));
+  }
   configuration.set("ClientGuid", Value(guid));
   configuration.set("ClientName", Value(name));
   auto session = openSession(request.member, password, configuration);
-  const Dictionary registered = qualify(*session, guid, name, server.url());
+  // The second client of the checks: another computer as far as the share
+  // can tell.
+  Dictionary otherConfiguration = configuration;
+  const std::string otherGuid = makeUUIDString();
+  otherConfiguration.set("guid", Value(otherGuid));
+  otherConfiguration.set("ClientGuid", Value(otherGuid));
+  otherConfiguration.set("ClientName", Value(name + " (setup check)"));
+  qualifyServer(
+      *session, [&] { return openSession(request.member, password, otherConfiguration); },
+      server.url());
+  const Dictionary registered = registerComputer(*session, guid, name, server.url());
+  // For the other computers' status: since when this one syncs, and which
+  // report on the share is its own.
   Dictionary record;
   if (!registered.contains("firstsync"))
     record.set("firstsync", Value(textOf(Value(currentClock().now()))));
   if (auto machine = getHostUUIDString()) record.set("machineguid", Value(*machine));
   session->patchClientInfo(record);
 
-  AccountSetup setup{server, request.member, request.passwordCommand};
+  // Later sessions trust this certificate alone: one that changes is refused.
+  AccountSetup setup{server, request.member, request.passwordCommand, caFile,
+                     session->tesselSession().serverCertificateDigest()};
   storeAccount(setup, password, guid, name);
   if (output.verbosity > 0)
     output.out << "Set up " << request.member << " at " << server.url() << " for this computer, "

@@ -7,6 +7,7 @@
 #include "VantorSyncManager/PublicNames.h"
 #include "VantorSyncManager/VTCPrefsCenter.h"
 #include "client/run/SyncFailure.h"
+#include "platform/dav/DavConnection.h"
 #include "platform/prefs/PreferenceStore.h"
 #include "platform/secrets/CredentialStore.h"
 #include "platform/secrets/StoredAccount.h"
@@ -59,6 +60,15 @@ Dictionary ServerAddress::configurationKeys() const {
   return keys;
 }
 
+ServerAddress ServerAddress::fromConfiguration(const Dictionary& configuration) {
+  ServerAddress a;
+  a.scheme = configuration.get("host_scheme").string();
+  a.host = configuration.get("host_name").string();
+  a.port = static_cast<int32_t>(configuration.get("host_port").integer());
+  a.syncPath = configuration.get("sync_path").string();
+  return a;
+}
+
 std::string passwordFromCommand(const std::string& command) {
   FILE* out = ::popen(command.c_str(), "r");
   if (!out) throw SyncFailure(FailureKind::Login, "The password command could not be started.");
@@ -81,15 +91,56 @@ std::string passwordFromCommand(const std::string& command) {
   return line;
 }
 
+namespace {
+
+// The sentence for a certificate that the session's connection refused.
+SyncFailure certificateFailure(CertificateRefusal refusal, const ServerAddress& server,
+                               const std::string& member, const std::string& digest) {
+  const std::string setup = "nubilosyncclient setup " + server.url() + " --user " + member;
+  switch (refusal) {
+    case CertificateRefusal::Changed:
+      return SyncFailure(FailureKind::UntrustedCertificate,
+                         "The server at " + server.url() +
+                             " shows a certificate other than the one this computer accepted at "
+                             "setup (its SHA-256 digest is now " +
+                             digest +
+                             "); if the server's certificate was renewed, check the new one, "
+                             "then run `" +
+                             setup + "` again to trust it.");
+    case CertificateRefusal::Untrusted:
+      return SyncFailure(FailureKind::UntrustedCertificate,
+                         "The server at " + server.url() +
+                             " has a certificate that no authority this computer trusts vouches "
+                             "for; if the server has an authority of its own, give that "
+                             "authority's certificate with `" +
+                             setup + " --ca-file PATH`.");
+    case CertificateRefusal::Invalid:
+      break;
+  }
+  return SyncFailure(FailureKind::UntrustedCertificate,
+                     "The server at " + server.url() +
+                         " has a certificate that is expired, not yet valid, issued to another "
+                         "name or badly chained; the server's certificate needs fixing.");
+}
+
+}  // namespace
+
 std::unique_ptr<NubiloRemoteSession> openSession(const std::string& member,
                                                  const std::string& password,
                                                  Dictionary configuration) {
   const std::string where = configuration.get("host_scheme").string() + "://" +
                             configuration.get("host_name").string() + ":" +
                             std::to_string(configuration.get("host_port").integer());
+  configuration.set("Name", Value(member));
+  auto account =
+      MemberAccount::accountWithName(member, password, configuration.get("user_agent").string());
   try {
-    return NubiloRemoteSession::sessionWithUsername(member, password, configuration);
+    return std::make_unique<NubiloRemoteSession>(account, configuration);
   } catch (const NubiloException& e) {
+    if (auto connection = account->connection(); connection && connection->certificateRefusal())
+      throw certificateFailure(*connection->certificateRefusal(),
+                               ServerAddress::fromConfiguration(configuration), member,
+                               connection->certificateDigest());
     if (e.name() == NubiloLoginFailureException)
       throw SyncFailure(FailureKind::Login,
                         "The server at " + where + " refused the password for " + member +
@@ -114,6 +165,11 @@ void storeAccount(const AccountSetup& setup, const std::string& password,
   store.setValue(config::kConfigurationHostKey, Value(""), kVantorDefaultsKey, Scope::AnyHost);
   store.setValue(kPasswordCommandKey,
                  setup.passwordCommand ? Value(*setup.passwordCommand) : Value(),
+                 kVantorDefaultsKey, Scope::AnyHost);
+  store.setValue("tls_ca_file", setup.caFile ? Value(*setup.caFile) : Value(), kVantorDefaultsKey,
+                 Scope::AnyHost);
+  store.setValue("tls_pinned_certificate",
+                 setup.certificateDigest.empty() ? Value() : Value(setup.certificateDigest),
                  kVantorDefaultsKey, Scope::AnyHost);
   store.synchronize(kVantorDefaultsKey, Scope::AnyHost);
   if (!setup.passwordCommand) {

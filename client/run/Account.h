@@ -27,12 +27,18 @@ struct ServerAddress {
   // The configuration keys it sets (host_scheme, host_name, host_port, and
   // sync_path when a path was given).
   Dictionary configurationKeys() const;
+  // The address that a configuration's server keys name.
+  static ServerAddress fromConfiguration(const Dictionary& configuration);
 };
 
 struct AccountSetup {
   ServerAddress server;
   std::string member;
   std::optional<std::string> passwordCommand;
+  // HTTPS: the extra authority to trust, and the certificate that setup
+  // accepted, which later sessions trust alone.
+  std::optional<std::string> caFile;
+  std::string certificateDigest;
 };
 
 // The first line the command prints (run with /bin/sh -c); raises
@@ -40,15 +46,16 @@ struct AccountSetup {
 std::string passwordFromCommand(const std::string& command);
 
 // Opens a session for member and password with the given configuration,
-// turning the library's failures into the client's plain sentences.
+// turning the library's failures into the client's plain sentences (a
+// refused certificate: SyncFailure UntrustedCertificate).
 std::unique_ptr<NubiloRemoteSession> openSession(const std::string& member,
                                                  const std::string& password,
                                                  Dictionary configuration);
 
-// Stores the account after setup checked it: member name, server keys and
-// the absence of a configuration server (per-user), this computer's client
-// identity (per-host), the password (Secret Service, unless a command is
-// given) and syncing on.
+// Stores the account after setup checked it: member name, server keys,
+// certificate trust and the absence of a configuration server (per-user),
+// this computer's client identity (per-host), the password (Secret Service,
+// unless a command is given) and syncing on.
 void storeAccount(const AccountSetup& setup, const std::string& password,
                   const std::string& clientGuid, const std::string& clientName);
 

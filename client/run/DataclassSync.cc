@@ -167,7 +167,7 @@ DataclassOutcome DataclassSync::run(const std::optional<DataclassRecord>& listed
   }
 
   outcome_.usedServer = true;
-  if (!options_.dryRun) lock();
+  if (!options_.dryRun) lock(listed.has_value());
   try {
     Remote remote;
     remote.state = network;
@@ -276,8 +276,13 @@ void DataclassSync::lockReleasingOwnLeftovers(const std::function<void()>& lockO
   lockOperation();
 }
 
-void DataclassSync::lock() {
+void DataclassSync::lock(bool listed) {
   const std::string& dataclass = collection_.dataclass;
+  // A dataclass new to the share is registered before it is locked: some
+  // servers make a file where a missing resource is locked, and one whose
+  // workers then remember a file at the collection's path keeps failing
+  // writes into the collection for a while.
+  if (!listed) session_.getDataclassInfo(dataclass);
   try {
     lockReleasingOwnLeftovers([&] { session_.lockClient(); });
   } catch (const NubiloException& e) {

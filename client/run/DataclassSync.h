@@ -73,7 +73,9 @@ class DataclassSync {
   std::vector<SyncEngineChange> folderChanges(const ScanResult& scan,
                                               const std::map<std::string, Dictionary>& lastFields);
   void checkLocalDeletes(const ScanResult& scan, size_t known);
-  void lock();
+  // Locks this client and the dataclass (registering them where the share
+  // lacks them); listed: whether the share's listing showed the dataclass.
+  void lock(bool listed);
   void lockReleasingOwnLeftovers(const std::function<void()>& lockOperation);
   void unlock();
   Remote fetch(bool slow, const DataclassRecord& record);

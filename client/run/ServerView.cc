@@ -17,12 +17,19 @@ std::optional<int64_t> version(const Value* v) {
 }  // namespace
 
 DataclassRecord DataclassRecord::fromRecord(const Dictionary& record) {
-  return {version(record.find("minversion")), version(record.find("maxversion")),
-          record.get("status").string(), record.get("DAV:getetag").string()};
+  DataclassRecord r{version(record.find("minversion")), version(record.find("maxversion")),
+                    record.get("status").string(), record.get("DAV:getetag").string()};
+  // A server whose collections carry no entity tag: the record's own values
+  // change with every commit, reset and repair, so they stand in for one.
+  if (r.etag.empty() || r.etag == kNoETag)
+    r.etag = format("record %@ %@ %@ %@", record.get("minversion"), record.get("maxversion"),
+                    record.get("status"), record.get("lastsync"));
+  return r;
 }
 
 ServerView ServerView::read(NubiloRemoteSession& session) {
-  DavTransaction t = session._issuePropFindWithRetryAtPath(session.schemasPath(), kDAVOneDepth, {});
+  DavTransaction t = session._issuePropFindWithRetryAtPath(session.schemasPath(), kDAVOneDepth,
+                                                           session.dataclassRecordProperties());
   if (!t.isSuccessful())
     throw NubiloException(NubiloTransactionFailureException,
                           format("The dataclass records could not be read %@", t));

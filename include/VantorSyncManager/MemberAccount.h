@@ -43,8 +43,15 @@ class VSM_EXPORT MemberAccount {
   void setServer(std::string scheme, std::string host, int32_t port, std::string checkPath,
                  int32_t readTimeout = 0);
 
+  // How HTTPS connections trust the server's certificate: the system's
+  // authorities and caFile's (a PEM certificate) when given; only the
+  // certificate whose SHA-256 digest ("aa:bb:...") is pinned, when one is.
+  // Call before the first request.
+  void setCertificateTrust(std::string caFile, std::string pinnedDigest);
+
   // A transaction whose result is a boolean: true when the server accepted
-  // the credentials. A refusal (401) is a successful transaction with false.
+  // the credentials. A refusal (401), or a server certificate that the
+  // trust refuses, is a successful transaction with false.
   DavTransaction credentialsAreValid();
 
   const std::string& name() const { return name_; }
@@ -71,5 +78,6 @@ class VSM_EXPORT MemberAccount {
   std::string scheme_, host_, checkPath_;
   int32_t port_ = 0;
   int32_t readTimeout_ = 0;
+  std::string caFile_, pinnedDigest_;
   std::shared_ptr<vtc::DavConnection> connection_;
 };

@@ -25,6 +25,9 @@ class TesselSession;
 namespace vtc {
 struct RetryTexts;
 
+// The entity tag of a dataclass record whose collection has none.
+inline constexpr const char* kNoETag = "eTagNotFound";
+
 // What fetchChangeLogsForDataclass brings back: the parsed changelogs by
 // index, and "StorageConsumed", the number of bytes downloaded.
 struct ChangeLogFetchResult {
@@ -134,6 +137,10 @@ class VSM_EXPORT NubiloRemoteSession {
   // NubiloAccountExpiredException (402) or NubiloTransactionFailureException.
   vtc::Dictionary getDataclassInfo(const std::string& dataclass);
   vtc::Array getAllDataclassInfo();
+  // The properties of a dataclass record and "DAV:getetag", asked for by
+  // name wherever records are read: a server need not list dead properties
+  // in an answer for all properties.
+  std::vector<std::string> dataclassRecordProperties() const;
   std::vector<std::string> dataclassNames();
   void dumpDataclasses();
   bool registerDataclass(const std::string& dataclass);
@@ -216,16 +223,25 @@ class VSM_EXPORT NubiloRemoteSession {
   int64_t lockAcquireSleepInterval() const { return _lockAcquireSleepInterval; }
   const std::set<std::string>& lockedResources() const { return _lockedResources; }
   const std::string& lockOwnerFormatString() const { return _lockOwnerFormatString; }
+  // The owner text of a lock taken now (the template stamped with the date).
+  std::string lockOwnerText() const;
   const std::optional<std::string>& respondingServer() const { return _respondingServer; }
 
  protected:
   DavTransaction retrying(const vtc::RetryTexts& texts, const std::string& subject,
                           const std::function<DavTransaction()>& issue);
-  std::string lockOwnerText() const;
   std::string clientPath(const std::string& guid) const;
   std::string dataclassLockPath(const std::string& dataclass) const;
   std::string dataclassPath(const std::string& dataclass) const;
   vtc::Dictionary recordFromProperties(const vtc::Dictionary& properties) const;
+  // Client records at path (depth 0: the record; depth 1: the clients
+  // collection's members). Asked for with all properties; where that answer
+  // lacks a registered client's guid, asked again by name, and when that
+  // finds it, by name from then on (the server leaves dead properties out).
+  DavTransaction findClientRecords(const std::string& path, int32_t depth);
+  // A client record's properties by name: its own, and the status and
+  // version of each dataclass that this session has met.
+  std::vector<std::string> clientRecordProperties() const;
 
   std::shared_ptr<MemberAccount> _vantorAccount;
   std::unique_ptr<TesselSession> _TesselSession;
@@ -244,4 +260,6 @@ class VSM_EXPORT NubiloRemoteSession {
   std::optional<std::string> _respondingServer;
   std::atomic<bool> _isCancelled{false};
   std::string _sessionUUID;
+  std::set<std::string> _dataclassesMet;
+  bool _clientRecordsByName = false;
 };

@@ -87,10 +87,45 @@ bool NubiloRemoteSession::unregisterClient(const std::string& guid) {
   return removal.isSuccessful();
 }
 
+std::vector<std::string> NubiloRemoteSession::clientRecordProperties() const {
+  std::vector<std::string> names;
+  for (const char* local :
+       {"guid", "clientname", "classname", "buildversion", "lastsync", "firstsync"})
+    names.push_back(_syncNamespace + local);
+  for (const std::string& dataclass : _dataclassesMet) {
+    names.push_back(_syncNamespace + dataclass + ".status");
+    names.push_back(_syncNamespace + dataclass + ".version");
+  }
+  return names;
+}
+
+DavTransaction NubiloRemoteSession::findClientRecords(const std::string& path, int32_t depth) {
+  const bool withParent = depth == kDAVZeroDepth;
+  if (_clientRecordsByName)
+    return _issuePropFindWithRetryAtPath(path, depth, clientRecordProperties(), withParent);
+  DavTransaction all = _issuePropFindWithRetryAtPath(path, depth, {}, withParent);
+  if (!all.isSuccessful()) return all;
+  const std::string guid = _syncNamespace + "guid";
+  auto lacksGuid = [&](const DavTransaction& t) {
+    for (const auto& [href, props] : t.result().dictionary())
+      if (href.ends_with("client") && !props.dictionary().contains(guid)) return true;
+    return false;
+  };
+  if (!lacksGuid(all)) return all;
+  // A broken record, or a server that leaves dead properties out of an
+  // answer for all of them: asked by name, the second finds the guid.
+  DavTransaction named =
+      _issuePropFindWithRetryAtPath(path, depth, clientRecordProperties(), withParent);
+  if (!named.isSuccessful()) return all;
+  for (const auto& [href, props] : named.result().dictionary())
+    if (props.dictionary().contains(guid)) _clientRecordsByName = true;
+  return _clientRecordsByName ? named : all;
+}
+
 vtc::Dictionary NubiloRemoteSession::getClientInfo(const std::string& guid) {
   std::string path = stringByAppendingTesselPathComponent(
       stringByAppendingTesselPathComponent(_syncPath, "Clients"), guid + ".client");
-  DavTransaction t = _issuePropFindWithRetryAtPath(path, kDAVZeroDepth, {});
+  DavTransaction t = findClientRecords(path, kDAVZeroDepth);
   if (t.isSuccessful()) {
     // Looked up under the href that was asked for: a server that names the
     // resource otherwise yields an empty record, not a failure.
@@ -124,7 +159,7 @@ vtc::Dictionary NubiloRemoteSession::getClientInfo() {
 }
 
 vtc::Array NubiloRemoteSession::getAllClientInfo() {
-  DavTransaction t = _issuePropFindWithRetryAtPath(_clientsPath, kDAVOneDepth, {}, false);
+  DavTransaction t = findClientRecords(_clientsPath, kDAVOneDepth);
   vtc::Array records;
   if (!t.isSuccessful()) return records;
   for (const auto& [href, props] : t.result().dictionary()) {
@@ -160,11 +195,13 @@ bool NubiloRemoteSession::patchClientInfo(const vtc::Dictionary& properties) {
 
 void NubiloRemoteSession::setStatus(const std::string& status, const std::string& guid,
                                     const std::string& dataclass) {
+  _dataclassesMet.insert(dataclass);
   setInfoForClient(vtc::Dictionary{{dataclass + ".status", status}}, guid);
 }
 
 void NubiloRemoteSession::setOtherClientStatus(const std::string& status,
                                                const std::string& dataclass) {
+  _dataclassesMet.insert(dataclass);
   relockClients();
   DavTransaction listing = _TesselSession->listCollectionAtPath(_clientsPath);
   const std::string own = _configuration.get("guid").string();

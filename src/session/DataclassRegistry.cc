@@ -11,12 +11,6 @@
 #include "platform/dav/DavPaths.h"
 #include "platform/dav/TesselSession.h"
 
-namespace {
-
-constexpr const char* kNoETag = "eTagNotFound";
-
-}  // namespace
-
 std::string NubiloRemoteSession::dataclassPath(const std::string& dataclass) const {
   return stringByAppendingTesselPathComponent(_schemasPath, dataclass);
 }
@@ -29,18 +23,29 @@ vtc::Dictionary NubiloRemoteSession::recordFromProperties(const vtc::Dictionary&
   return record;
 }
 
+std::vector<std::string> NubiloRemoteSession::dataclassRecordProperties() const {
+  std::vector<std::string> names;
+  for (const char* local :
+       {"displayname", "dataclassname", "minversion", "maxversion", "status", "lastsync"})
+    names.push_back(_syncNamespace + local);
+  names.push_back("DAV:getetag");
+  return names;
+}
+
 vtc::Dictionary NubiloRemoteSession::getDataclassInfo(const std::string& dataclass) {
   std::string path = stringByAppendingTesselPathComponent(
                          stringByAppendingTesselPathComponent(_syncPath, "Schemas"), dataclass) +
                      "/";
+  _dataclassesMet.insert(dataclass);
+  const std::vector<std::string> properties = dataclassRecordProperties();
   DavTransaction t;
   {
     // Re-entrant: the registration's locks take the same monitor.
     std::lock_guard<std::recursive_mutex> monitor(_TesselSession->monitor());
-    t = _issuePropFindWithRetryAtPath(path, kDAVZeroDepth, {});
+    t = _issuePropFindWithRetryAtPath(path, kDAVZeroDepth, properties);
     if (!t.isSuccessful() && t.httpStatusCode() == 404) {
       registerDataclass(dataclass);
-      t = _issuePropFindWithRetryAtPath(path, kDAVZeroDepth, {});
+      t = _issuePropFindWithRetryAtPath(path, kDAVZeroDepth, properties);
     }
   }
   vtc::Dictionary result;
@@ -50,7 +55,7 @@ vtc::Dictionary NubiloRemoteSession::getDataclassInfo(const std::string& datacla
     const vtc::Value* etag = props.find("DAV:getetag");
     if (!etag)
       VTC_LOG_WARNING("No etag found for dataclass %@, setting generic no etag string", dataclass);
-    result.set("DAV:getetag", etag ? *etag : vtc::Value(kNoETag));
+    result.set("DAV:getetag", etag ? *etag : vtc::Value(vtc::kNoETag));
   } else if (t.httpStatusCode() == 402) {
     throw NubiloException(
         NubiloAccountExpiredException,
@@ -66,11 +71,14 @@ vtc::Dictionary NubiloRemoteSession::getDataclassInfo(const std::string& datacla
 }
 
 vtc::Array NubiloRemoteSession::getAllDataclassInfo() {
-  DavTransaction t = _issuePropFindWithRetryAtPath(_schemasPath, kDAVOneDepth, {}, false);
+  DavTransaction t =
+      _issuePropFindWithRetryAtPath(_schemasPath, kDAVOneDepth, dataclassRecordProperties(), false);
   vtc::Array records;
   if (!t.isSuccessful()) return records;
-  for (const auto& [href, props] : t.result().dictionary())
+  for (const auto& [href, props] : t.result().dictionary()) {
+    _dataclassesMet.insert(vtc::davpath::lastComponent(vtc::davpath::fromHref(href)));
     records.push_back(vtc::Value(recordFromProperties(props.dictionary())));
+  }
   return records;
 }
 
@@ -86,7 +94,8 @@ std::vector<std::string> NubiloRemoteSession::dataclassNames() {
 void NubiloRemoteSession::dumpDataclasses() {
   std::string path =
       stringByAppendingTesselPathComponent(_configuration.get("sync_path").string(), "Schemas");
-  DavTransaction t = _issuePropFindWithRetryAtPath(path, kDAVOneDepth, {}, false);
+  DavTransaction t =
+      _issuePropFindWithRetryAtPath(path, kDAVOneDepth, dataclassRecordProperties(), false);
   if (!t.isSuccessful()) return;
   for (const auto& [href, props] : t.result().dictionary()) {
     std::fprintf(stderr, "%s\n", href.c_str());

@@ -25,7 +25,7 @@ bool NubiloRemoteSession::eTagChangedForDataclass(const std::string& dataclass,
   if (result.empty()) return true;
   const vtc::Dictionary& props = std::prev(result.end())->second.dictionary();
   const vtc::Value* current = props.find("DAV:getetag");
-  if (previousETag == "eTagNotFound" && !current) return false;
+  if (previousETag == vtc::kNoETag && !current) return false;
   if (current && withoutWeakPrefix(previousETag) == withoutWeakPrefix(current->string()))
     return false;
   VTC_LOG_INFO("eTags are different previous:%@ current:%@", previousETag,

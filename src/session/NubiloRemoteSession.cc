@@ -81,6 +81,8 @@ NubiloRemoteSession::NubiloRemoteSession(std::shared_ptr<MemberAccount> account,
   // on the share that the configuration names, at its root, so that the
   // credentials then go with every request to the share (the trash of a
   // reset lies outside the sync area) instead of being asked for again.
+  _vantorAccount->setCertificateTrust(_configuration.get("tls_ca_file").string(),
+                                      _configuration.get("tls_pinned_certificate").string());
   _vantorAccount->setServer(scheme, hostName, port, "/", readTimeout(_configuration));
   DavTransaction check = _vantorAccount->credentialsAreValid();
 

@@ -7,13 +7,15 @@
 #include <filesystem>
 
 #include "VantorSyncManager/NubiloRemoteSession.h"
-#include "localshare/ApacheShare.h"
 #include "localshare/Computer.h"
+#include "localshare/Share.h"
+#include "support/ShareTest.h"
 #include "support/TestHome.h"
 
 using testing::HasSubstr;
-using vtc::local::ApacheShare;
 using vtc::local::Computer;
+using vtc::local::Share;
+using vtc::local::ShareKind;
 
 namespace {
 
@@ -23,17 +25,25 @@ std::string card(const std::string& uid, const std::string& fn, const std::strin
          ";;;;\r\nEMAIL;TYPE=work:" + email + "\r\nTEL:" + tel + "\r\nEND:VCARD\r\n";
 }
 
-class Account : public ::testing::Test {
+class TwoComputers : public ::testing::Test {
  protected:
+  explicit TwoComputers(ShareKind kind = ShareKind::Apache)
+      : server_(vtc::local::startShare(kind)) {}
+
   vtc::test::TestHome home;
-  vtc::local::ApacheShare share;
-  std::string url = "http://127.0.0.1:" + std::to_string(share.port()) + "/sync";
+
+ private:
+  std::unique_ptr<Share> server_;
+
+ protected:
+  Share& share = *server_;
+  std::string url = share.url("/sync");
   Computer a{"Mac A"};
   Computer b{"Mac B"};
 
   void SetUp() override {
-    a.join(url, vtc::local::ApacheShare::kUser, vtc::local::ApacheShare::kPassword);
-    b.join(url, vtc::local::ApacheShare::kUser, vtc::local::ApacheShare::kPassword);
+    a.join(url, Share::kUser, Share::kPassword);
+    b.join(url, Share::kUser, Share::kPassword);
   }
   // Syncs and expects success; the output for further checks.
   Computer::Result sync(const Computer& c, std::vector<std::string> more = {}) {
@@ -48,7 +58,13 @@ class Account : public ::testing::Test {
   }
 };
 
-TEST_F(Account, AFirstSyncGoesBothWaysAndLeavesEqualFolders) {
+// The scenarios that meet the servers' differences (records, resets,
+// repairs, entity tags) run on each; the rest on Apache.
+using Account = vtc::test::OnEachServer<TwoComputers>;
+using AccountGuards = TwoComputers;
+INSTANTIATE_TEST_SUITE_P(Servers, Account, vtc::test::kEachServer, vtc::test::serverName);
+
+TEST_P(Account, AFirstSyncGoesBothWaysAndLeavesEqualFolders) {
   Computer::write(a.contacts() + "/ann.vcf", card("ann", "Ann", "ann@example.org", "1"));
   Computer::write(a.contacts() + "/bob.vcf", card("bob", "Bob", "bob@example.org", "2"));
   Computer::write(b.contacts() + "/cat.vcf", card("cat", "Cat", "cat@example.org", "3"));
@@ -65,7 +81,7 @@ TEST_F(Account, AFirstSyncGoesBothWaysAndLeavesEqualFolders) {
   EXPECT_FALSE(std::filesystem::exists(a.contacts() + "/displayname"));
 }
 
-TEST_F(Account, EditsOfDifferentFieldsMergeDeletesTravelAndAConflictEndsTheSameEverywhere) {
+TEST_P(Account, EditsOfDifferentFieldsMergeDeletesTravelAndAConflictEndsTheSameEverywhere) {
   Computer::write(a.contacts() + "/ann.vcf", card("ann", "Ann", "ann@example.org", "1"));
   Computer::write(a.contacts() + "/bob.vcf", card("bob", "Bob", "bob@example.org", "2"));
   sync(a);
@@ -98,7 +114,7 @@ TEST_F(Account, EditsOfDifferentFieldsMergeDeletesTravelAndAConflictEndsTheSameE
   EXPECT_EQ(contactsOf(a), contactsOf(b));
 }
 
-TEST_F(Account, ADryRunSaysWhatWouldHappenAndWritesNothingAnywhere) {
+TEST_F(AccountGuards, ADryRunSaysWhatWouldHappenAndWritesNothingAnywhere) {
   Computer::write(a.contacts() + "/ann.vcf", card("ann", "Ann", "ann@example.org", "1"));
   sync(a);
   Computer::write(b.contacts() + "/cat.vcf", card("cat", "Cat", "cat@example.org", "3"));
@@ -115,7 +131,7 @@ TEST_F(Account, ADryRunSaysWhatWouldHappenAndWritesNothingAnywhere) {
   EXPECT_THAT(sync(b).out, HasSubstr("sent 1 change, received 1 change, wrote 1 file"));
 }
 
-TEST_F(Account, TheDeleteGuardRefusesBeforeAnythingIsWrittenAnywhere) {
+TEST_F(AccountGuards, TheDeleteGuardRefusesBeforeAnythingIsWrittenAnywhere) {
   for (int i = 0; i < 4; ++i)
     Computer::write(a.contacts() + "/p" + std::to_string(i) + ".vcf",
                     card("p" + std::to_string(i), "P", "p@example.org", std::to_string(i)));
@@ -140,7 +156,7 @@ TEST_F(Account, TheDeleteGuardRefusesBeforeAnythingIsWrittenAnywhere) {
   EXPECT_TRUE(contactsOf(b).empty());
 }
 
-TEST_F(Account, ANewComputerJoiningAnAccountWithHistoryGetsItAllAndKeepsItsOwn) {
+TEST_P(Account, ANewComputerJoiningAnAccountWithHistoryGetsItAllAndKeepsItsOwn) {
   Computer::write(a.contacts() + "/ann.vcf", card("ann", "Ann", "ann@example.org", "1"));
   sync(a);
   Computer::write(a.contacts() + "/ann.vcf", card("ann", "Ann", "ann@example.org", "11"));
@@ -151,7 +167,7 @@ TEST_F(Account, ANewComputerJoiningAnAccountWithHistoryGetsItAllAndKeepsItsOwn) 
   sync(a);
 
   Computer c{"Mac C"};
-  c.join(url, vtc::local::ApacheShare::kUser, vtc::local::ApacheShare::kPassword);
+  c.join(url, Share::kUser, Share::kPassword);
   Computer::write(c.contacts() + "/dan.vcf", card("dan", "Dan", "dan@example.org", "4"));
   EXPECT_THAT(sync(c).out, HasSubstr("(slow sync)"));
   sync(a);
@@ -163,9 +179,9 @@ TEST_F(Account, ANewComputerJoiningAnAccountWithHistoryGetsItAllAndKeepsItsOwn) 
 // A long history is written again as one reset commit. A computer with an
 // edit it had not sent, and one that was away throughout, both take the new
 // truth in once and lose nothing.
-TEST_F(Account, CompactionKeepsAnUnsentEditAndAComputerAwayThroughoutConverges) {
+TEST_P(Account, CompactionKeepsAnUnsentEditAndAComputerAwayThroughoutConverges) {
   Computer c{"Mac C"};
-  c.join(url, vtc::local::ApacheShare::kUser, vtc::local::ApacheShare::kPassword);
+  c.join(url, Share::kUser, Share::kPassword);
   Computer::write(a.contacts() + "/ann.vcf", card("ann", "Ann", "ann@example.org", "1"));
   Computer::write(a.contacts() + "/bob.vcf", card("bob", "Bob", "bob@example.org", "2"));
   sync(a);
@@ -201,7 +217,7 @@ TEST_F(Account, CompactionKeepsAnUnsentEditAndAComputerAwayThroughoutConverges) 
 
 // A changelog damaged on the share ends in a plain sentence, not a loop of
 // downloads, until a computer whose copy is whole repairs the share.
-TEST_F(Account, ADamagedShareIsReportedOnceAndRepairedFromAWholeCopy) {
+TEST_P(Account, ADamagedShareIsReportedOnceAndRepairedFromAWholeCopy) {
   Computer::write(a.contacts() + "/ann.vcf", card("ann", "Ann", "ann@example.org", "1"));
   sync(a);
   Computer::write(a.contacts() + "/bob.vcf", card("bob", "Bob", "bob@example.org", "2"));
@@ -236,13 +252,12 @@ TEST_F(Account, ADamagedShareIsReportedOnceAndRepairedFromAWholeCopy) {
 // A commit cut short after it published its record: the record names a
 // changelog that is not there. The next computer repairs the record and
 // reads from minversion.
-TEST_F(Account, ARecordNamingAMissingChangelogIsRepairedAndReadFromMinversion) {
+TEST_P(Account, ARecordNamingAMissingChangelogIsRepairedAndReadFromMinversion) {
   Computer::write(a.contacts() + "/ann.vcf", card("ann", "Ann", "ann@example.org", "1"));
   sync(a);
   vtc::Dictionary config = share.configuration();
   config.set("sync_path", vtc::Value("/sync"));
-  auto session =
-      NubiloRemoteSession::sessionWithUsername(ApacheShare::kUser, ApacheShare::kPassword, config);
+  auto session = NubiloRemoteSession::sessionWithUsername(Share::kUser, Share::kPassword, config);
   session->setInfoForDataclass(vtc::Dictionary{{"maxversion", "00002"}}, "com.korvo.Contacts");
   EXPECT_THAT(sync(b).out, HasSubstr("(slow sync)"));
   EXPECT_EQ(contactsOf(b), contactsOf(a));
@@ -254,10 +269,10 @@ TEST_F(Account, ARecordNamingAMissingChangelogIsRepairedAndReadFromMinversion) {
 }
 
 // What people use every day: khard and khal write and read the folders.
-class WithPrograms : public Account {
+class WithPrograms : public TwoComputers {
  protected:
   void SetUp() override {
-    Account::SetUp();
+    TwoComputers::SetUp();
     for (const Computer* c : {&a, &b}) {
       Computer::write(c->home() + "/.config/khard/khard.conf",
                       "[addressbooks]\n[[people]]\npath = " + c->contacts() +

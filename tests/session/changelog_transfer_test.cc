@@ -16,12 +16,12 @@
 #include "VantorSyncManager/NubiloException.h"
 #include "VantorSyncManager/PublicNames.h"
 #include "common/Format.h"
+#include "localshare/Processes.h"
 #include "platform/dav/TesselSession.h"
 #include "platform/os/HostIdentity.h"
 #include "platform/plist/PlistCodec.h"
 #include "session/SyncReport.h"
 #include "support/FaultProxy.h"
-#include "localshare/Processes.h"
 #include "support/ShareTest.h"
 
 using testing::HasSubstr;
@@ -68,8 +68,11 @@ std::pair<std::string, std::string> failureOf(F body) {
   return {"none", ""};
 }
 
-class Transfer : public vtc::test::ShareTest {
+class ShareWithChangelogs : public vtc::test::ShareTest {
  protected:
+  explicit ShareWithChangelogs(vtc::test::ShareKind kind = vtc::test::ShareKind::Apache)
+      : ShareTest(kind) {}
+
   vtc::test::FaultProxy proxy{share.port()};
   std::unique_ptr<NubiloRemoteSession> session;
 
@@ -120,10 +123,16 @@ class Transfer : public vtc::test::ShareTest {
   }
 };
 
-using Commit = Transfer;
-using Fetch = Transfer;
+// Commits and transfers that meet the servers' differences run on each;
+// faults, races and fetches, which go through the proxy alike, on Apache.
+using Commit = vtc::test::OnEachServer<ShareWithChangelogs>;
+using Transfer = vtc::test::OnEachServer<ShareWithChangelogs>;
+using CommitFaults = ShareWithChangelogs;
+using Fetch = ShareWithChangelogs;
+INSTANTIATE_TEST_SUITE_P(Servers, Commit, vtc::test::kEachServer, vtc::test::serverName);
+INSTANTIATE_TEST_SUITE_P(Servers, Transfer, vtc::test::kEachServer, vtc::test::serverName);
 
-TEST_F(Commit, PublishesWithThreeRequestsBeyondTheLockAndLeavesNoTemporaryFile) {
+TEST_P(Commit, PublishesWithThreeRequestsBeyondTheLockAndLeavesNoTemporaryFile) {
   session->getDataclassInfo(kDataclass);
   EXPECT_FALSE(session->commitChanges({}, kDataclass, 1, false));  // sends nothing
   session->lockDataclass(kDataclass);
@@ -160,7 +169,7 @@ TEST_F(Commit, PublishesWithThreeRequestsBeyondTheLockAndLeavesNoTemporaryFile) 
   EXPECT_EQ(r.get("status").string(), "normal");
 }
 
-TEST_F(Commit, AnExistingChangelogIsOverwrittenOnlyWhenADayOld) {
+TEST_P(Commit, AnExistingChangelogIsOverwrittenOnlyWhenADayOld) {
   populate(kDataclass, 1);
   const std::string final = session->changeLogPathForDataclass(kDataclass, 2);
   session->tesselSession().putData({'o', 'l', 'd'}, final);
@@ -201,7 +210,7 @@ TEST_F(Commit, AnExistingChangelogIsOverwrittenOnlyWhenADayOld) {
 // Each request of a commit fails once in each way. The outcome is the
 // exception of its kind and a server that a reader either does not notice
 // or can repair from the files present.
-TEST_F(Commit, EachRequestFailingInEachWayLeavesARecoverableServer) {
+TEST_F(CommitFaults, EachRequestFailingInEachWayLeavesARecoverableServer) {
   struct Case {
     const char* method;
     const char* fault;
@@ -269,7 +278,7 @@ TEST_F(Commit, EachRequestFailingInEachWayLeavesARecoverableServer) {
   }
 }
 
-TEST_F(Commit, ATimedOutUploadIsTriedExactlyOnceMoreUnderANewName) {
+TEST_F(CommitFaults, ATimedOutUploadIsTriedExactlyOnceMoreUnderANewName) {
   auto quick = open("GUID-Q", 1);  // a second for an answer, the shortest time-out
   quick->getDataclassInfo(kDataclass);
   proxy.timeOut({"PUT", "", 1});
@@ -298,7 +307,7 @@ TEST_F(Commit, ATimedOutUploadIsTriedExactlyOnceMoreUnderANewName) {
 
 // A child process that commits, stopped for ever at one request and killed
 // with SIGKILL there: the server holds what the steps before it did.
-TEST_F(Commit, AProcessKilledAtEachStepLeavesNothingOrARepairableRecordOrTheWholeCommit) {
+TEST_P(Commit, AProcessKilledAtEachStepLeavesNothingOrARepairableRecordOrTheWholeCommit) {
   for (const char* stopAt : {"PROPPATCH", "MOVE", "after"}) {
     SCOPED_TRACE(stopAt);
     const std::string dataclass = std::string("dc.kill.") + stopAt;
@@ -365,7 +374,7 @@ struct BriefSleeper : vtc::Sleeper {
 // as a computer whose lock expired while it slept would: the lock makes one
 // wait for the other, and the move that refuses to overwrite turns the
 // second commit away.
-TEST_F(Commit, TwoProcessesRacingForOneIndexHaveExactlyOneWinnerEveryRound) {
+TEST_F(CommitFaults, TwoProcessesRacingForOneIndexHaveExactlyOneWinnerEveryRound) {
   constexpr int kRounds = 100;
   session->getDataclassInfo(kDataclass);
   struct Racer {
@@ -530,7 +539,7 @@ TEST_F(Fetch, EachDownloadFailingInEachWayRaisesItsKind) {
             NubiloFailedToDownloadChangelogException);
 }
 
-TEST_F(Transfer, DirectoriesOfChangelogsAndTakingBackTheNewestCommit) {
+TEST_P(Transfer, DirectoriesOfChangelogsAndTakingBackTheNewestCommit) {
   populate(kDataclass, 3);
   const std::string local = home.path() + "/copies";
   session->downloadChangeLogsForDataclass(kDataclass, local);
@@ -582,7 +591,7 @@ TEST_F(Transfer, DirectoriesOfChangelogsAndTakingBackTheNewestCommit) {
   EXPECT_FALSE(session->removeLastChangelogForDataclass(kDataclass));
 }
 
-TEST_F(Transfer, ReportsAreFlattenedAndStoredUnderTheMachinesUUID) {
+TEST_P(Transfer, ReportsAreFlattenedAndStoredUnderTheMachinesUUID) {
   const vtc::Date start = time.now();
   vtc::Dictionary summary{
       {"GlobalSyncDuration", 2.5},

@@ -1,6 +1,6 @@
-// Opening sessions against a real Apache share: the sync area, the login and
-// network failures, HTTPS trust, the lock owner text and the one persistent
-// connection.
+// Opening sessions against a real share: the sync area (on each server),
+// the login and network failures, HTTPS trust and pinning, the lock owner
+// text and the one persistent connection.
 #include <gmock/gmock.h>
 
 #include <algorithm>
@@ -12,6 +12,7 @@
 
 #include "VantorSyncManager/NubiloException.h"
 #include "VantorSyncManager/PublicNames.h"
+#include "localshare/ApacheShare.h"
 #include "platform/dav/TesselSession.h"
 #include "support/Failures.h"
 #include "support/ShareTest.h"
@@ -36,14 +37,17 @@ struct ScopedEnv {
 };
 
 using SessionSetup = vtc::test::ShareTest;
+using SyncArea = vtc::test::OnEachServer<vtc::test::ShareTest>;
+INSTANTIATE_TEST_SUITE_P(Servers, SyncArea, vtc::test::kEachServer, vtc::test::serverName);
 
-TEST_F(SessionSetup, CreatesTheSyncAreaNotesTheRespondingServerAndRemovesTheArea) {
+TEST_P(SyncArea, CreatesTheSyncAreaNotesTheRespondingServerAndRemovesTheArea) {
   auto session = openSession();
   std::string sync = ApacheShare::kSyncPath;
   EXPECT_EQ(session->clientsPath(), sync + "/Clients");
   EXPECT_EQ(session->schemasPath(), sync + "/Schemas");
-  EXPECT_EQ(session->respondingServer(), "dav-test-1");
-  EXPECT_EQ(logged.count("Info", "Responding server: dav-test-1"), 1u);
+  EXPECT_EQ(session->respondingServer(), share.respondingServer());
+  EXPECT_EQ(logged.count("Info", std::string("Responding server: ") + share.respondingServer()),
+            1u);
   EXPECT_EQ(session->eventUUID().size(), 36u);
   EXPECT_TRUE(time.sleeps().empty());
 
@@ -51,10 +55,7 @@ TEST_F(SessionSetup, CreatesTheSyncAreaNotesTheRespondingServerAndRemovesTheArea
   // and nothing else.
   auto second = openSession();
   EXPECT_TRUE(second->createSyncPaths());
-  std::set<std::string> members;
-  for (const auto& entry : std::filesystem::directory_iterator(share.diskPath(sync)))
-    members.insert(entry.path().filename().string() + (entry.is_directory() ? "/" : ""));
-  EXPECT_EQ(members, (std::set<std::string>{"Clients/", "Schemas/"}));
+  EXPECT_EQ(share.members(sync), (std::set<std::string>{"Clients/", "Schemas/"}));
 
   EXPECT_TRUE(second->removeSyncPaths());
   EXPECT_FALSE(std::filesystem::exists(share.diskPath(sync)));
@@ -113,18 +114,38 @@ TEST_F(SessionSetup, MissingServerKeysAreNamedNotCrashed) {
   }
 }
 
-TEST_F(SessionSetup, HttpsTrustsWhatTheCaStoreTrustsAndNothingElse) {
+TEST_F(SessionSetup, HttpsTrustsWhatTheAuthoritiesVouchForOrThePinnedCertificateAlone) {
   ApacheShare tls(ApacheShare::Options{.tls = true});
   vtc::Dictionary config = tls.configuration();
-  config.set("max_lock_acquire_attempts", 0);
   auto open = [&] {
     return NubiloRemoteSession::sessionWithUsername("alice", "wonderland", config);
   };
-  // Unknown authority: the connection is refused as a network failure.
-  EXPECT_THAT(
-      open, ThrowsMessage<NubiloException>(testing::StartsWith("NubiloNetworkFailureException: ")));
-  ScopedEnv trust("SSL_CERT_FILE", tls.caFile());  // the system's store, pointed at our authority
+  // Unknown authority: refused at once, and no credentials go to it.
+  const auto refused = ThrowsMessage<NubiloException>(
+      "NubiloLoginFailureException: Failed to validate credentials for alice");
+  EXPECT_THAT(open, refused);
+  EXPECT_TRUE(time.sleeps().empty());
+  EXPECT_EQ(tls.accessEntries().size(), 0u);
+  std::string digest;
+  {
+    ScopedEnv trust("SSL_CERT_FILE", tls.caFile());  // the system's store, pointed at our authority
+    auto session = open();
+    EXPECT_EQ(session->respondingServer(), "dav-test-1");
+    digest = session->tesselSession().serverCertificateDigest();
+  }
+  EXPECT_THAT(digest, testing::MatchesRegex("([0-9a-f]{2}:){31}[0-9a-f]{2}"));
+  config.set("tls_ca_file", tls.caFile());  // an authority of the server's own
+  EXPECT_EQ(open()->tesselSession().serverCertificateDigest(), digest);
+
+  // Pinned, the certificate is trusted with no authority at all, and a new
+  // one is not, whoever signed it.
+  config.erase("tls_ca_file");
+  config.set("tls_pinned_certificate", digest);
   EXPECT_EQ(open()->respondingServer(), "dav-test-1");
+  tls.renewCertificate();
+  config.set("tls_ca_file", tls.caFile());
+  EXPECT_THAT(open, refused);
+  EXPECT_TRUE(time.sleeps().empty());
 }
 
 TEST_F(SessionSetup, LockOwnerTextQuotesNamesButNotTheClientId) {

@@ -5,7 +5,7 @@
 
 namespace vtc::test {
 
-void storeShareInPreferences(const ApacheShare& share, int port) {
+void storeShareInPreferences(const Share& share, int port) {
   auto& store = prefs::PreferenceStore::shared();
   Dictionary keys = share.configuration();
   for (const char* identity : {"Name", "guid", "ClientGuid", "ClientName"}) keys.erase(identity);

@@ -1,21 +1,12 @@
 #include "localshare/ApacheShare.h"
 
-#include "platform/fs/LocalPaths.h"
-
-#include <openssl/evp.h>
-#include <pwd.h>
-#include <sys/stat.h>
-#include <sys/wait.h>
 #include <unistd.h>
 
 #include <cstdlib>
 #include <filesystem>
-#include <fstream>
-#include <iterator>
 #include <sstream>
 #include <stdexcept>
-#include <thread>
-#include <utility>
+#include <vector>
 
 namespace vtc::local {
 
@@ -24,73 +15,20 @@ namespace {
 constexpr const char* kApache = "/usr/sbin/apache2";
 constexpr const char* kModules = "/usr/lib/apache2/modules";
 
-std::string shaPasswordLine(const std::string& user, const std::string& password) {
-  unsigned char digest[EVP_MAX_MD_SIZE];
-  unsigned int len = 0;
-  EVP_Digest(password.data(), password.size(), digest, &len, EVP_sha1(), nullptr);
-  unsigned char b64[64];
-  EVP_EncodeBlock(b64, digest, static_cast<int>(len));
-  return user + ":{SHA}" + reinterpret_cast<char*>(b64) + "\n";
-}
-
-void writeFile(const std::string& path, const std::string& text) {
-  std::ofstream out(path);
-  out << text;
-  if (!out) throw std::runtime_error("cannot write " + path);
-}
-
-// Started as root, Apache's workers run as www-data: hand them their folders.
-void giveToWorkers(const std::string& path) {
-  const passwd* pw = ::geteuid() == 0 ? getpwnam("www-data") : nullptr;
-  if (!pw) return;
-  for (auto& entry : std::filesystem::recursive_directory_iterator(path))
-    (void)::chown(entry.path().c_str(), pw->pw_uid, pw->pw_gid);
-  (void)::chown(path.c_str(), pw->pw_uid, pw->pw_gid);
-}
-
 }  // namespace
 
-int freeLoopbackPort() {
-  int port = 0;
-  ::close(listenLoopback(port));
-  return port;
-}
-
-ApacheShare::ApacheShare(Options options) : options_(options) {
-  std::string tmpl = paths::join(paths::temporaryDirectory(), "vsm-dav-XXXXXX");
-  if (!mkdtemp(tmpl.data())) throw std::runtime_error("mkdtemp failed");
-  root_ = tmpl;
-  ::chmod(root_.c_str(), 0755);
-  documentRoot_ = root_ + "/dav";
-  for (const char* dir : {"/dav", "/var", "/logs", "/run"})
-    std::filesystem::create_directories(root_ + dir);
+ApacheShare::ApacheShare(Options options) : Share("vsm-dav", options.tls) {
   writeConfiguration();
-  giveToWorkers(root_);
-
-  pid_ = startProcess({kApache, "-f", root_ + "/httpd.conf", "-DFOREGROUND"});
-  bool listening = waitUntil([&] {
-    if (::waitpid(pid_, nullptr, WNOHANG) == pid_) pid_ = -1;  // it gave up
-    int fd = pid_ < 0 ? -1 : connectLoopback(port_);
-    if (fd >= 0) ::close(fd);
-    return pid_ < 0 || fd >= 0;
-  });
-  if (pid_ < 0 || !listening) {
-    stop();
-    std::ifstream log(root_ + "/logs/error.log");
-    throw std::runtime_error("apache2 did not start: " +
-                             std::string(std::istreambuf_iterator<char>(log), {}));
-  }
+  giveToWorkers("www-data");
+  startApache();
 }
 
-ApacheShare::~ApacheShare() {
-  stop();
-  std::error_code ignored;
-  std::filesystem::remove_all(root_, ignored);
+void ApacheShare::startApache() {
+  start({kApache, "-f", root_ + "/httpd.conf", "-DFOREGROUND"}, root_ + "/logs/error.log");
 }
 
 void ApacheShare::writeConfiguration() {
-  port_ = freeLoopbackPort();
-  writeFile(root_ + "/htpasswd", shaPasswordLine(kUser, kPassword));
+  writeTextFile(root_ + "/htpasswd", passwordFileLine(kUser, kPassword));
   std::ostringstream c;
   c << "ServerRoot " << root_ << "\n"
     << "ServerName 127.0.0.1\n"
@@ -102,11 +40,11 @@ void ApacheShare::writeConfiguration() {
   std::vector<const char*> modules = {"mpm_prefork", "authn_core", "authn_file", "authz_core",
                                       "authz_user",  "auth_basic", "dav",        "dav_fs",
                                       "dav_lock",    "headers"};
-  if (options_.tls) modules.insert(modules.end(), {"socache_shmcb", "ssl"});
+  if (tls_) modules.insert(modules.end(), {"socache_shmcb", "ssl"});
   for (const char* m : modules)
     c << "LoadModule " << m << "_module " << kModules << "/mod_" << m << ".so\n";
-  if (options_.tls) {
-    makeCertificates();
+  if (tls_) {
+    makeCertificate(/*withAuthority=*/true);
     c << "SSLEngine on\n"
       << "SSLCertificateFile " << root_ << "/tls/server.pem\n"
       << "SSLCertificateKeyFile " << root_ << "/tls/server.key\n"
@@ -121,7 +59,7 @@ void ApacheShare::writeConfiguration() {
     << "KeepAlive On\nMaxKeepAliveRequests 0\nKeepAliveTimeout 60\nTimeout 30\n"
     << "LogFormat \"%{remote}p %m %>s\" share\n"
     << "CustomLog " << root_ << "/logs/access.log share\n"
-    << "Header always set X-Responding-Server \"dav-test-1\"\n"
+    << "Header always set X-Responding-Server \"" << respondingServer() << "\"\n"
     << "DavLockDB " << root_ << "/var/DavLock\n"
     << "DocumentRoot " << documentRoot_ << "\n"
     << "<Directory " << documentRoot_ << ">\n"
@@ -133,64 +71,42 @@ void ApacheShare::writeConfiguration() {
     << "<Directory " << documentRoot_ << "/configurations>\n"
     << "  Dav Off\n  Require all granted\n"
     << "</Directory>\n";
-  writeFile(root_ + "/httpd.conf", c.str());
+  writeTextFile(root_ + "/httpd.conf", c.str());
 }
 
-// A private authority and a certificate for 127.0.0.1 signed by it.
-void ApacheShare::makeCertificates() {
+// A certificate for 127.0.0.1 signed by the share's private authority (made
+// first when asked).
+void ApacheShare::makeCertificate(bool withAuthority) {
   std::string dir = root_ + "/tls";
   std::filesystem::create_directories(dir);
-  const char* commands =
-      "openssl req -x509 -newkey rsa:2048 -nodes -days 2 -subj '/CN=Share Test Authority' "
-      "-keyout ca.key -out ca.pem && "
+  std::string commands =
       "openssl req -newkey rsa:2048 -nodes -subj '/CN=127.0.0.1' -keyout server.key "
       "-out server.csr && printf 'subjectAltName=IP:127.0.0.1\\n' > ext.cnf && "
       "openssl x509 -req -in server.csr -CA ca.pem -CAkey ca.key -CAcreateserial -days 2 "
       "-extfile ext.cnf -out server.pem";
+  if (withAuthority)
+    commands =
+        "openssl req -x509 -newkey rsa:2048 -nodes -days 2 -subj '/CN=Share Test Authority' "
+        "-keyout ca.key -out ca.pem && " +
+        commands;
   if (std::system(("exec >/dev/null 2>&1 && cd '" + dir + "' && " + commands).c_str()) != 0)
     throw std::runtime_error("could not make test certificates");
+}
+
+void ApacheShare::renewCertificate() {
+  if (!tls_) throw std::logic_error("renewCertificate: the share does not serve HTTPS");
+  makeCertificate(/*withAuthority=*/false);
+  giveToWorkers("www-data");
+  // Stopped and started again on the same port: once it listens, it shows
+  // the new certificate.
+  stop();
+  startApache();
 }
 
 void ApacheShare::forgetLocks() {
   for (const auto& entry : std::filesystem::directory_iterator(root_ + "/var"))
     if (entry.path().filename().string().starts_with("DavLock"))
       std::filesystem::remove(entry.path());
-}
-
-Dictionary ApacheShare::configuration() const {
-  return Dictionary{
-      {"host_scheme", Value(options_.tls ? "https" : "http")},
-      {"host_name", Value("127.0.0.1")},
-      {"host_port", Value(port_)},
-      {"sync_path", Value(kSyncPath)},
-      {"sync_namespace", Value("http://nubilo.example/ns/sync/")},
-      {"sync_dav_timeout_seconds", Value(5)},
-      {"lock_duration_seconds", Value(240)},
-      {"max_lock_acquire_attempts", Value(3)},
-      {"lock_acquire_sleep_seconds", Value(4)},
-      {"user_agent", Value("VantorClient/-/-/488")},
-      {"Name", Value(kUser)},
-      {"guid", Value("11111111-2222-3333-4444-555555555555")},
-      {"ClientGuid", Value("11111111-2222-3333-4444-555555555555")},
-      {"ClientName", Value("Test Machine")},
-  };
-}
-
-std::vector<AccessEntry> ApacheShare::accessEntries() const {
-  // The server logs a request just after answering it: wait until the log
-  // stops growing (a few milliseconds) before reading it.
-  std::string path = root_ + "/logs/access.log";
-  std::error_code ignored;
-  uintmax_t size = std::filesystem::file_size(path, ignored), before = -1;
-  for (int i = 0; i < 10 && size != before; ++i) {
-    std::this_thread::sleep_for(std::chrono::milliseconds(15));
-    before = std::exchange(size, std::filesystem::file_size(path, ignored));
-  }
-  std::vector<AccessEntry> out;
-  std::ifstream in(path);
-  // A line a request: client port, method, status ("54321 PUT 201").
-  for (AccessEntry e; in >> e.clientPort >> e.method >> e.status;) out.push_back(e);
-  return out;
 }
 
 }  // namespace vtc::local

@@ -1,27 +1,15 @@
-// A private Apache httpd WebDAV share for one test (or the demo): its own
-// configuration under a temporary folder, one Basic-auth user, a lock
-// database, keep-alive, an access log that records the client port, and an
-// X-Responding-Server header on every answer. Started in the foreground on a
-// free 127.0.0.1 port, stopped by its PID.
+// Apache httpd with mod_dav_fs: the reference share. A lock database,
+// keep-alive, worker processes, and an X-Responding-Server header on every
+// answer; HTTPS on request, with a certificate from a private authority.
 #pragma once
 
-#include <sys/types.h>
-
 #include <string>
-#include <vector>
 
-#include "VantorSyncManager/Value.h"
-#include "localshare/Processes.h"
+#include "localshare/Share.h"
 
 namespace vtc::local {
 
-struct AccessEntry {
-  int clientPort = 0;
-  std::string method;
-  int status = 0;
-};
-
-class ApacheShare {
+class ApacheShare : public Share {
  public:
   struct Options {
     // Serve HTTPS with a certificate from a private authority; caFile()
@@ -31,49 +19,25 @@ class ApacheShare {
 
   ApacheShare() : ApacheShare(Options{}) {}
   explicit ApacheShare(Options options);
-  ~ApacheShare();
-  ApacheShare(const ApacheShare&) = delete;
-  ApacheShare& operator=(const ApacheShare&) = delete;
 
-  int port() const { return port_; }
-  pid_t pid() const { return pid_; }
-  // The folder on disk that the share serves.
-  const std::string& documentRoot() const { return documentRoot_; }
-  // The disk path of a server path.
-  std::string diskPath(const std::string& serverPath) const { return documentRoot_ + serverPath; }
+  const char* name() const override { return "Apache"; }
+  const char* respondingServer() const override { return "dav-test-1"; }
+  void forgetLocks() override;
 
   // The certificate of the authority that signed a TLS share's certificate.
   std::string caFile() const { return root_ + "/tls/ca.pem"; }
+  // Gives a TLS share a new key and certificate from the same authority and
+  // restarts the server on the same port with them.
+  void renewCertificate();
 
-  // A session configuration for this share (the keys a session reads).
-  Dictionary configuration() const;
-
-  // The requests the server has logged so far (Apache writes its access log
-  // as each request finishes).
-  std::vector<AccessEntry> accessEntries() const;
-
-  // Stops the server (by PID) before the end of the test: later requests
-  // find nothing listening.
-  void stop() { stopProcess(pid_); }
-  // Makes the server forget every lock it holds, as a lock that timed out.
-  void forgetLocks();
-
-  static constexpr const char* kUser = "alice";
-  static constexpr const char* kPassword = "wonderland";
-  static constexpr const char* kSyncPath = "/Library/Application Support/SyncWorks";
+ protected:
+  // mod_dav_fs keeps properties and state in a ".DAV" folder beside them.
+  bool ownFile(const std::string& name) const override { return name == ".DAV"; }
 
  private:
+  void startApache();
   void writeConfiguration();
-  void makeCertificates();
-
-  Options options_;
-  std::string root_;
-  std::string documentRoot_;
-  int port_ = 0;
-  pid_t pid_ = -1;
+  void makeCertificate(bool withAuthority);
 };
-
-// A TCP port on 127.0.0.1 that nothing listens on right now.
-int freeLoopbackPort();
 
 }  // namespace vtc::local

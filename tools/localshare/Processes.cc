@@ -50,11 +50,19 @@ pid_t startProcess(const std::vector<std::string>& argv, const std::string& inpu
 
 void stopProcess(pid_t& pid) {
   if (pid <= 0) return;
-  ::kill(pid, SIGTERM);
-  if (!waitUntil([&] { return ::waitpid(pid, nullptr, WNOHANG) == pid; })) {
-    ::kill(pid, SIGKILL);
-    ::waitpid(pid, nullptr, 0);
-  }
+  // The whole group: a server's workers end with it even when it does not
+  // stop them itself (PHP's built-in server does not). The leader is reaped
+  // last, so that its group id cannot be given to anyone else meanwhile.
+  ::kill(-pid, SIGTERM);
+  // Whether the leader ended in time or not, SIGKILL follows: for members
+  // that outlive it, or for all of them.
+  waitUntil([&] {
+    siginfo_t info{};
+    return ::waitid(P_PID, static_cast<id_t>(pid), &info, WEXITED | WNOHANG | WNOWAIT) == 0 &&
+           info.si_pid == pid;
+  });
+  ::kill(-pid, SIGKILL);
+  ::waitpid(pid, nullptr, 0);
   pid = -1;
 }
 

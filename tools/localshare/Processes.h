@@ -13,7 +13,8 @@ namespace vtc::local {
 // Starts argv[0] (looked up in PATH) with `input` on its standard input and
 // its output discarded; it dies with the test process.
 pid_t startProcess(const std::vector<std::string>& argv, const std::string& input = {});
-// SIGTERM, a few seconds to exit, then SIGKILL; pid becomes -1.
+// SIGTERM to its process group, a few seconds to exit, then SIGKILL; pid
+// becomes -1.
 void stopProcess(pid_t& pid);
 // Polls every 10 ms until ready() holds (true) or ten seconds pass (false).
 bool waitUntil(const std::function<bool()>& ready);

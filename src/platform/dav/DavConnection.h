@@ -1,6 +1,6 @@
-// One neon session to one server: credentials, TLS with the system's CA
-// store, time-outs, the lock store, and the capture of each request's status
-// and headers. Every request of a session travels over its one persistent
+// One neon session to one server: credentials, TLS (ServerCertificate.h),
+// time-outs, the lock store, and the capture of each request's status and
+// headers. Every request of a session travels over its one persistent
 // connection. Not thread-safe: callers serialise (TesselSession's monitor).
 #pragma once
 
@@ -15,8 +15,22 @@
 
 #include "VantorSyncManager/DavTransaction.h"
 #include "VantorSyncManager/Value.h"
+#include "platform/dav/ServerCertificate.h"
 
 namespace vtc {
+
+// What a connection has learnt of its server's ways from the server's
+// answers; each starts as the standard behaviour.
+struct ServerTraits {
+  // Whether a write under a locked collection must present only the locks
+  // of the resource itself, the server refusing (412) a token of the
+  // parent's lock; unknown until a 412 tells.
+  std::optional<bool> refusesParentTokens;
+  // The lock discovery leaves out the owner that the LOCK carried.
+  bool dropsLockOwners = false;
+  // A lock lasts as long as the server likes, not as long as asked.
+  bool ignoresLockTimeouts = false;
+};
 
 struct DavEndpoint {
   std::string scheme;
@@ -27,9 +41,9 @@ struct DavEndpoint {
 
 class DavConnection {
  public:
-  // readTimeout: seconds, 0 for neon's default.
+  // readTimeout: seconds, 0 for neon's default. trust applies to HTTPS.
   DavConnection(DavEndpoint endpoint, std::string user, std::string password, std::string userAgent,
-                int readTimeout = 0);
+                int readTimeout = 0, CertificateTrust trust = {});
   ~DavConnection();
   DavConnection(const DavConnection&) = delete;
   DavConnection& operator=(const DavConnection&) = delete;
@@ -37,6 +51,12 @@ class DavConnection {
   const DavEndpoint& endpoint() const { return endpoint_; }
   ne_session* session() const { return session_; }
   ne_lock_store* lockStore() const { return locks_; }
+  ServerTraits& traits() { return traits_; }
+  const CertificateTrust& trust() const { return trust_; }
+  // The digest of the certificate the server showed last; empty before one.
+  const std::string& certificateDigest() const { return certificateDigest_; }
+  // Why the server's certificate was refused last; none when it was not.
+  std::optional<CertificateRefusal> certificateRefusal() const { return refusal_; }
 
   // Read and connect time-out in seconds (neon's resolution). neon applies it
   // when it connects, so a change closes an open connection.
@@ -59,6 +79,7 @@ class DavConnection {
   static int onPostSend(ne_request* req, void* userdata, const ne_status* status);
   static int onAuthenticate(void* userdata, const char* realm, int attempt, char* username,
                             char* password);
+  static int onVerify(void* userdata, int failures, const ne_ssl_certificate* cert);
 
   DavEndpoint endpoint_;
   std::string user_;
@@ -66,6 +87,10 @@ class DavConnection {
   ne_session* session_ = nullptr;
   ne_lock_store* locks_ = nullptr;
   Capture capture_;
+  ServerTraits traits_;
+  CertificateTrust trust_;
+  std::string certificateDigest_;
+  std::optional<CertificateRefusal> refusal_;
   int readTimeout_ = 0;
   bool used_ = false;  // a connection may be open
 };

@@ -29,6 +29,12 @@ std::string propertyText(const XmlElement& prop) {
   return prop.children.empty() ? prop.text : prop.innerXml();
 }
 
+// A sync lock owner record: one element with text children.
+void addOwnerFields(const XmlElement& owner, Dictionary& lock) {
+  for (const auto& record : owner.children)
+    for (const auto& field : record->children) lock.set(field->name, Value(field->allText()));
+}
+
 }  // namespace
 
 std::vector<PropfindEntry> readMultistatus(const XmlElement& root) {
@@ -94,14 +100,23 @@ Array readActiveLocks(const XmlElement& lockDiscovery) {
     }
     if (const XmlElement* owner = active->child(kDav, "owner")) {
       lock.set("owner", Value(owner->innerXml()));
-      // A sync lock owner record: one element with text children.
-      for (const auto& record : owner->children) {
-        for (const auto& field : record->children) lock.set(field->name, Value(field->allText()));
-      }
+      addOwnerFields(*owner, lock);
     }
     locks.push_back(Value(std::move(lock)));
   }
   return locks;
+}
+
+Dictionary ownerFields(std::string_view ownerXml) {
+  const std::string document = "<owner>" + std::string(ownerXml) + "</owner>";
+  ne_xml_parser* parser = ne_xml_create();
+  XmlTreeBuilder builder(parser);
+  ne_xml_parse(parser, document.data(), document.size());
+  ne_xml_parse(parser, "", 0);
+  Dictionary fields;
+  if (!ne_xml_failed(parser) && builder.root()) addOwnerFields(*builder.root(), fields);
+  ne_xml_destroy(parser);
+  return fields;
 }
 
 }  // namespace vtc

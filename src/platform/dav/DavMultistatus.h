@@ -33,4 +33,9 @@ std::string propfindBody(const std::vector<std::string>& fullNames);
 // The active locks of a DAV:lockdiscovery element, as dictionaries.
 Array readActiveLocks(const XmlElement& lockDiscovery);
 
+// The fields of a sync lock owner record in an owner text ("lock-user",
+// "clientid", ...): one element with text children. Empty when the text is
+// no such record.
+Dictionary ownerFields(std::string_view ownerXml);
+
 }  // namespace vtc

@@ -42,11 +42,18 @@ void MemberAccount::setServer(std::string scheme, std::string host, int32_t port
   if (connection_) connection_->setReadTimeout(readTimeout);
 }
 
+void MemberAccount::setCertificateTrust(std::string caFile, std::string pinnedDigest) {
+  caFile_ = std::move(caFile);
+  pinnedDigest_ = std::move(pinnedDigest);
+  connection_.reset();  // a connection keeps the trust it was made with
+}
+
 std::shared_ptr<vtc::DavConnection> MemberAccount::connection() {
   if (host_.empty()) return nullptr;
   if (!connection_) {
     connection_ = std::make_shared<vtc::DavConnection>(
-        vtc::DavEndpoint{scheme_, host_, port_}, name_, password_, applicationID_, readTimeout_);
+        vtc::DavEndpoint{scheme_, host_, port_}, name_, password_, applicationID_, readTimeout_,
+        vtc::CertificateTrust{caFile_, pinnedDigest_});
   }
   return connection_;
 }
@@ -57,7 +64,8 @@ std::shared_ptr<vtc::DavConnection> MemberAccount::connectionTo(const std::strin
   vtc::DavEndpoint wanted{scheme, host, port};
   if (auto own = connection(); own && own->endpoint() == wanted) return own;
   return std::make_shared<vtc::DavConnection>(wanted, name_, password_, applicationID_,
-                                              readTimeout_);
+                                              readTimeout_,
+                                              vtc::CertificateTrust{caFile_, pinnedDigest_});
 }
 
 DavTransaction MemberAccount::credentialsAreValid() {
@@ -78,8 +86,13 @@ DavTransaction MemberAccount::credentialsAreValid() {
         [](void*, const ne_uri*, const ne_prop_result_set*) {}, nullptr);
   });
   const int status = t.httpStatusCode();
-  if (t.transactionState() == vtc::kTransactionCompleted &&
-      (status == 401 || status == 404 || t.isSuccessful())) {
+  if (conn->certificateRefusal()) {
+    // A server whose certificate is refused gets no credentials, on this
+    // check or any retry: they are as good as refused.
+    t.setOutcome(true, 101, vtc::kNoHTTPStatus, vtc::kTransactionCompleted);
+    t.setResult(vtc::Value(false));
+  } else if (t.transactionState() == vtc::kTransactionCompleted &&
+             (status == 401 || status == 404 || t.isSuccessful())) {
     t.setOutcome(true, status == 401 ? 101 : 1, status, t.transactionState());
     t.setResult(vtc::Value(status != 401));
   } else {

@@ -6,9 +6,11 @@
 #pragma once
 
 #include <cstdint>
+#include <functional>
 #include <memory>
 #include <mutex>
 #include <optional>
+#include <set>
 #include <string>
 #include <vector>
 
@@ -18,6 +20,7 @@
 
 namespace vtc {
 class DavConnection;
+struct LockRecord;
 // Keys of listing entries and attribute dictionaries beside kNBURI,
 // kNBLastModified (a date) and kNBContentLength (an integer).
 inline constexpr const char* kDavETag = "DAV:getetag";
@@ -51,12 +54,18 @@ class TesselSession {
 
   // Locks (depth 0, exclusive, write). A lock of a missing resource, or of
   // one whose parent is missing, fails as not found (result 104, HTTP 404)
-  // instead of leaving a lock-null resource. A lock of a path whose earlier
-  // lock the server no longer knows sets that lock's token aside and asks
-  // again. A granted lock is checked in the lock discovery; one that the
-  // server gave to another client at the same moment fails as locked (HTTP
-  // 423). A lock leaves the lock store only when an unlock succeeds or a new
-  // lock of the same path replaces it: a refused relock or unlock keeps it.
+  // instead of leaving a lock-null resource; a server that creates the
+  // resource anyway (201) has it deleted again (it made a file: a caller
+  // about to make a collection there should make it before locking it). A
+  // lock of a path whose earlier lock the server no longer knows sets that
+  // lock's token aside and asks again. A granted lock is checked in the lock
+  // discovery; one that the server gave to another client at the same moment
+  // fails as locked (HTTP 423). Where the discovery drops the owner or the
+  // time-out asked for, a lock record is kept beside the lock
+  // (platform/dav/LockRecord.h); a lock refused because of another client's
+  // lock that its record shows overdue is given back and asked for again. A
+  // lock leaves the lock store only when an unlock succeeds or a new lock of
+  // the same path replaces it: a refused relock or unlock keeps it.
   DavTransaction lockResourceAtPath(const std::string& path);
   DavTransaction unlockResourceAtPath(const std::string& path);
   DavTransaction _lockResourceAtPath(const std::string& path, double duration,
@@ -98,7 +107,9 @@ class TesselSession {
   // vtc::kDavIsCollection; extended ones add vtc::kDavLockDiscovery, an array
   // of active locks with "owner" (the owner XML, whole), "token", "depth",
   // "timeout", "scope" and the fields of a sync lock owner record
-  // ("lock-user", "clientid", "clientname", "acquiredate").
+  // ("lock-user", "clientid", "clientname", "acquiredate"). A lock whose
+  // discovery lacks the owner takes token and owner from its lock record,
+  // and is marked "recorded".
   DavTransaction basicAttributesAtPath(const std::string& path);
   DavTransaction extendedAttributesAtPath(const std::string& path);
   // The members of a collection (not the collection itself), as an array of
@@ -110,6 +121,8 @@ class TesselSession {
   DavTransaction _sendReportingInfo(const vtc::Dictionary& report, const std::string& reportsPath);
 
   const std::string& owner() const { return owner_; }
+  // The SHA-256 digest of the HTTPS server's certificate; empty over HTTP.
+  std::string serverCertificateDigest() const;
   bool isSynchronous() const { return synchronous_; }
   // Whether this session holds a lock on path in its lock store.
   bool holdsLockOnPath(const std::string& path) const;
@@ -124,12 +137,36 @@ class TesselSession {
                           const std::vector<std::string>& props, bool includingParent);
   DavTransaction attributes(const std::string& path, int32_t depth, bool withLocks);
   DavTransaction mkcol(const std::string& path);
-  // Whether the server's lock discovery of path shows token as its only lock.
-  bool lockStands(const std::string& path, const std::string& token);
+  // Sends a request that adds or removes members of the parents of paths;
+  // run builds and dispatches it, presenting the parents' locks when its
+  // argument says so. They are presented, as servers that guard a locked
+  // collection's members want; a server that refuses them (412 while such a
+  // lock stands) is noted, and the request sent again without them.
+  DavTransaction memberRequest(const std::string& method, const std::vector<std::string>& paths,
+                               const std::function<int(bool)>& run);
+  // The token of the lock this session holds on path's parent, or none.
+  std::optional<std::string> parentLockToken(const std::string& path) const;
+  // Whether the lock that this session holds on a parent of paths still
+  // stands on the server.
+  bool parentLockStands(const std::vector<std::string>& paths);
+  // Whether a lock discovery (extended attributes) shows token as the only
+  // lock; a discovery that hides tokens shows it as the one lock there is.
+  static bool lockStands(const DavTransaction& discovery, const std::string& token);
+  // After a granted lock: notes what the discovery dropped of the lock, and
+  // keeps the lock record where the server needs one.
+  void recordLockWhereNeeded(const std::string& path, const std::string& token,
+                             const std::string& owner, long seconds, const DavTransaction& answer,
+                             const DavTransaction& discovery);
+  DavTransaction writeLockRecord(const std::string& path, const vtc::LockRecord& record);
+  // On a server that keeps locks past their time-out: gives back the lock
+  // that refused this session when its record shows it overdue by the
+  // refusal's server time. True when it did.
+  bool giveBackOverdueLock(const std::string& path, const DavTransaction& refusal);
 
   std::shared_ptr<MemberAccount> account_;
   std::shared_ptr<vtc::DavConnection> connection_;
   std::string owner_;
   bool synchronous_ = true;
   std::recursive_mutex monitor_;
+  std::set<std::string> recordedLocks_;  // paths whose lock has a lock record
 };

@@ -13,6 +13,7 @@
 #include "platform/dav/DavConnection.h"
 #include "platform/dav/DavMultistatus.h"
 #include "platform/dav/DavPaths.h"
+#include "platform/dav/LockRecord.h"
 #include "platform/dav/TesselSession.h"
 #include "platform/dav/XmlTree.h"
 
@@ -68,6 +69,27 @@ vtc::Dictionary attributesOf(const vtc::PropfindEntry& entry) {
   a.set(vtc::kDavIsCollection,
         vtc::Value(type && type->string().find("collection") != std::string::npos));
   return a;
+}
+
+// Fills in a lock that its discovery shows without an owner from the lock
+// record beside it: the lock its token names, or, where the discovery hides
+// tokens, the one lock there is.
+vtc::Array withLockRecord(vtc::Array locks, const vtc::Dictionary& properties) {
+  const vtc::Value* text = properties.find(vtc::kLockRecordProperty);
+  const std::optional<vtc::LockRecord> record =
+      text ? vtc::LockRecord::parse(text->string()) : std::nullopt;
+  if (!record) return locks;
+  for (vtc::Value& value : locks) {
+    vtc::Dictionary& lock = value.mutableDictionary();
+    const std::string token = lock.get("token").string();
+    const bool itsLock = token.empty() ? locks.size() == 1 : token == record->token;
+    if (!itsLock || !lock.get("owner").string().empty()) continue;
+    lock.set("owner", vtc::Value(record->owner));
+    lock.merge(vtc::ownerFields(record->owner));
+    if (token.empty()) lock.set("token", vtc::Value(record->token));
+    lock.set("recorded", vtc::Value(true));
+  }
+  return locks;
 }
 
 }  // namespace
@@ -126,7 +148,7 @@ DavTransaction TesselSession::_issuePropPatchAtPath(const std::string& path,
 
 DavTransaction TesselSession::attributes(const std::string& path, int32_t depth, bool withLocks) {
   std::vector<std::string> props = kBasicProperties;
-  if (withLocks) props.push_back(vtc::kDavLockDiscovery);
+  if (withLocks) props.insert(props.end(), {vtc::kDavLockDiscovery, vtc::kLockRecordProperty});
   const std::string self = vtc::davpath::canonical(path);
   return runPropfind(*connection_, path, depth, props, [&](DavTransaction& t, auto& entries) {
     if (depth == 0) {
@@ -135,7 +157,10 @@ DavTransaction TesselSession::attributes(const std::string& path, int32_t depth,
         a = attributesOf(entries.front());
         if (withLocks && entries.front().lockDiscovery)
           a.set(vtc::kDavLockDiscovery,
-                vtc::Value(vtc::readActiveLocks(*entries.front().lockDiscovery)));
+                vtc::Value(withLockRecord(vtc::readActiveLocks(*entries.front().lockDiscovery),
+                                          entries.front().properties)));
+        if (const vtc::Value* record = entries.front().properties.find(vtc::kLockRecordProperty))
+          a.set(vtc::kLockRecordProperty, *record);
       }
       t.setResult(vtc::Value(std::move(a)));
       return;

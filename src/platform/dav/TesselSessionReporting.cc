@@ -18,7 +18,9 @@ DavTransaction TesselSession::_sendReportingInfo(const vtc::Dictionary& report,
   const std::string path =
       stringByAppendingTesselPathComponent(reportsPath, machine.string() + ".plist");
   DavTransaction t = putData(body, path);
-  if (t.httpStatusCode() == 409) {  // the first report of the account: no collection yet
+  // The first report of the account: no collection yet. Servers name a
+  // missing parent 409 (Apache) or 404 (SabreDAV).
+  if (t.httpStatusCode() == 409 || t.httpStatusCode() == 404) {
     mkcol(reportsPath);
     t = putData(body, path);
   }

@@ -1,5 +1,6 @@
 // GET and PUT.
 #include <fcntl.h>
+#include <sys/stat.h>
 #include <unistd.h>
 
 #include <ne_basic.h>
@@ -87,10 +88,10 @@ DavTransaction TesselSession::getDataAtPath(const std::string& path) {
 
 DavTransaction TesselSession::putData(const vtc::Bytes& data, const std::string& path) {
   std::string escaped = vtc::davpath::escape(path);
-  return connection_->perform("PUT", path, [&] {
+  return memberRequest("PUT", {path}, [&](bool presentParent) {
     ne_request* req = ne_request_create(connection_->session(), "PUT", escaped.c_str());
     ne_lock_using_resource(req, escaped.c_str(), 0);
-    ne_lock_using_parent(req, escaped.c_str());
+    if (presentParent) ne_lock_using_parent(req, escaped.c_str());
     // neon wants a buffer even for an empty body.
     static const char kEmpty = 0;
     ne_set_request_body_buffer(
@@ -110,9 +111,20 @@ DavTransaction TesselSession::putLocalFileAtPath(const std::string& localPath,
     t.setErrorText("cannot read " + localPath);
     return t;
   }
+  struct stat st {};
+  if (::fstat(fd, &st) != 0) st.st_size = 0;
   std::string escaped = vtc::davpath::escape(path);
-  DavTransaction t = connection_->perform(
-      "PUT", path, [&] { return ne_put(connection_->session(), escaped.c_str(), fd); });
+  DavTransaction t = memberRequest("PUT", {path}, [&](bool presentParent) {
+    ne_request* req = ne_request_create(connection_->session(), "PUT", escaped.c_str());
+    ne_lock_using_resource(req, escaped.c_str(), 0);
+    if (presentParent) ne_lock_using_parent(req, escaped.c_str());
+    // From the start of the file on every try (neon sends it again after a
+    // challenge, and so may the second try here).
+    ne_set_request_body_fd(req, fd, 0, st.st_size);
+    int ret = vtc::dispatchExpectingSuccess(req);
+    ne_request_destroy(req);
+    return ret;
+  });
   ::close(fd);
   return t;
 }
