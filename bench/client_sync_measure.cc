@@ -42,6 +42,7 @@ std::string card(int i, int edit) {
 struct Phase {
   const char* name;
   double seconds = 0;
+  double cpu = 0;  // the client's own user and system time
   size_t requests = 0;
   size_t writes = 0;
 };
@@ -52,6 +53,7 @@ Phase timed(const char* name, Share& share, const Computer& c) {
   Computer::Result r = c.run({"sync"});
   Phase p{name};
   p.seconds = std::chrono::duration<double>(std::chrono::steady_clock::now() - start).count();
+  p.cpu = r.cpuSeconds;
   if (r.status != 0) std::fprintf(stderr, "%s failed: %s\n", name, r.err.c_str());
   const auto entries = share.accessEntries();
   p.requests = entries.size() - before;
@@ -128,10 +130,11 @@ int main(int argc, char** argv) {
 
   std::printf("%s: %d cards, %zu bytes on average\n", share.name(), cards,
               bytes / static_cast<size_t>(cards));
-  std::printf("%-24s %10s %9s %7s %9s\n", "phase", "seconds", "requests", "writes", "x floor");
+  std::printf("%-24s %10s %8s %9s %7s %9s\n", "phase", "seconds", "cpu", "requests", "writes",
+              "x floor");
   for (const Phase& p : phases)
-    std::printf("%-24s %10.3f %9zu %7zu %9.2f\n", p.name, p.seconds, p.requests, p.writes,
-                p.seconds / floor);
+    std::printf("%-24s %10.3f %8.3f %9zu %7zu %9.2f\n", p.name, p.seconds, p.cpu, p.requests,
+                p.writes, p.seconds / floor);
   std::printf("%-24s %10.3f %9d\n", "floor: curl GETs", floor, cards);
   std::filesystem::remove_all(home);
   return 0;

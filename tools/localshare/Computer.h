@@ -19,6 +19,7 @@ class Computer {
     int status = -1;
     std::string out;
     std::string err;
+    double cpuSeconds = 0;  // user and system time of the run
   };
 
   // A fresh home whose per-host preferences name the computer.
