@@ -90,6 +90,9 @@ struct DataclassSync::Remote {
   bool slow = false;
   std::map<int64_t, std::unique_ptr<NubiloChangeLog>> changelogs;
   std::map<std::string, Dictionary> truth;  // slow: the records the changelogs add up to
+  // Slow: records of the truth known only from modifies (deleted before the
+  // first changelog read): their other fields are this computer's.
+  std::set<std::string> partial;
 };
 
 DataclassSync::DataclassSync(NubiloRemoteSession& session, engine::SyncEngine& engine,
@@ -378,15 +381,33 @@ DataclassSync::Remote DataclassSync::fetch(bool slow, const DataclassRecord& rec
   size_t deletes = 0;
   const int64_t records = engine_.recordCount(dataclass);
   if (slow) {
+    // A modify of a deleted record (its editor had not seen the delete)
+    // brings it back whole, as it was when deleted: the engine does the same
+    // with its tombstones when changes come one changelog at a time.
+    std::map<std::string, Dictionary> buried;
     for (const auto& [index, log] : remote.changelogs) {
       for (const SyncEngineChange& change : log->changes()) {
+        const std::string& id = change.recordIdentifier();
+        auto it = remote.truth.find(id);
         if (change.type() == SyncEngineChange::kDelete) {
-          remote.truth.erase(change.recordIdentifier());
+          if (it != remote.truth.end()) {
+            buried[id] = std::move(it->second);
+            remote.truth.erase(it);
+          }
+          remote.partial.erase(id);
           continue;
         }
-        Dictionary& fields = remote.truth[change.recordIdentifier()];
-        if (change.type() == SyncEngineChange::kAdd) fields = Dictionary{};
-        apply(fields, change.changes());
+        if (change.type() == SyncEngineChange::kAdd) {
+          remote.truth[id] = Dictionary{};
+          remote.partial.erase(id);
+        } else if (it == remote.truth.end()) {
+          if (auto b = buried.find(id); b != buried.end())
+            remote.truth[id] = std::move(b->second);
+          else
+            remote.partial.insert(id);
+        }
+        buried.erase(id);
+        apply(remote.truth[id], change.changes());
       }
     }
     for (const SyncEngineChange& have : engine_.records(dataclass))
@@ -448,12 +469,20 @@ void DataclassSync::applyRemote(Remote& remote, const engine::PullResult& pendin
   std::vector<SyncEngineChange> diff;
   for (const auto& [id, fields] : remote.truth) {
     auto here = current.find(id);
+    const bool partial = remote.partial.count(id);
     if (here == current.end()) {
-      if (!pendingRecords.count(id))  // not deleted here since the last sync
-        diff.emplace_back(SyncEngineChange::kAdd, id, setsOf(fields));
+      // Not deleted here since the last sync: added, or for a partial record
+      // modified, so that the engine brings back the rest from its tombstone.
+      if (!pendingRecords.count(id))
+        diff.emplace_back(partial ? SyncEngineChange::kModify : SyncEngineChange::kAdd, id,
+                          setsOf(fields));
       continue;
     }
-    Array changes = differences(here->second, fields, pendingFields[id]);
+    Dictionary from = here->second;
+    if (partial)  // only the fields the changelogs set; the rest stays as it is here
+      for (const std::string& name : here->second.keys())
+        if (!fields.contains(name)) from.erase(name);
+    Array changes = differences(from, fields, pendingFields[id]);
     if (!changes.empty()) diff.emplace_back(SyncEngineChange::kModify, id, std::move(changes));
   }
   for (const auto& [id, fields] : current)

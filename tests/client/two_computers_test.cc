@@ -204,8 +204,13 @@ TEST_P(Account, CompactionKeepsAnUnsentEditAndAComputerAwayThroughoutConverges) 
     changelogs += e.path().extension() == ".clog";
   EXPECT_LE(changelogs, 3u);
 
+  // Bob deleted on A after the compaction: B, whose edit of him was never
+  // sent, keeps him and sends the edit; C then reads the delete and the edit
+  // from the share in one slow sync and brings him back whole, as A does.
+  std::filesystem::remove(a.contacts() + "/bob.vcf");
+  sync(a);
   EXPECT_THAT(sync(b).out, HasSubstr("(slow sync)"));
-  sync(c);
+  EXPECT_THAT(sync(c).out, HasSubstr("(slow sync)"));
   sync(a);
   const std::string bob = card("bob", "Bob", "bob@home.example", "2");
   for (const Computer* each : {&a, &b, &c}) {
@@ -213,6 +218,8 @@ TEST_P(Account, CompactionKeepsAnUnsentEditAndAComputerAwayThroughoutConverges) 
     EXPECT_EQ(contactsOf(*each)["ann.vcf"], card("ann", "Ann", "ann@example.org", "103"))
         << each->name();
   }
+  // A is told that its delete was undone.
+  EXPECT_THAT(a.run({"conflicts"}).out, HasSubstr("bob.vcf"));
 }
 
 // A changelog damaged on the share ends in a plain sentence, not a loop of

@@ -61,6 +61,9 @@ void SqliteEngine::push(const std::string& client, const std::string& dataclass,
   Statement unseenDelete(db_.handle(),
                          "SELECT client, origin FROM journal WHERE dataclass = ?1 AND record = ?2 "
                          "AND seq > ?3 AND client != ?4 AND type = 3 ORDER BY seq DESC LIMIT 1");
+  Statement lastDelete(db_.handle(),
+                       "SELECT client, origin FROM journal WHERE dataclass = ?1 AND record = ?2 "
+                       "AND type = 3 ORDER BY seq DESC LIMIT 1");
   Statement unseen(db_.handle(),
                    "SELECT client, changes, pushed, origin FROM journal WHERE dataclass = ?1 AND "
                    "record = ?2 AND seq > ?3 AND client != ?4 ORDER BY seq");
@@ -118,21 +121,29 @@ void SqliteEngine::push(const std::string& client, const std::string& dataclass,
       // A change of a record that is not here adds it. A modify of a deleted
       // one brings it back whole, as it was, with the change on top (an add
       // carries the whole record itself).
+      bool restored = false;
       if (type == SyncEngineChange::kModify) {
         exhume.bind(1, dataclass).bind(2, id);
-        if (exhume.step()) properties = decode(exhume.blob(0)).dictionary();
+        restored = exhume.step();
+        if (restored) properties = decode(exhume.blob(0)).dictionary();
         exhume.reset();
       }
       type = SyncEngineChange::kAdd;
       forget.bind(1, dataclass).bind(2, id).run();
-      unseenDelete.bind(1, dataclass).bind(2, id).bind(3, anchor).bind(4, client);
-      if (unseenDelete.step()) {
+      // The delete undone: for a restored record the last one, even one this
+      // pusher has seen (its user deleted it, then an edit made elsewhere
+      // before the delete was seen brought it back); for an add, one it has
+      // not seen.
+      Statement& undone = restored ? lastDelete : unseenDelete;
+      undone.bind(1, dataclass).bind(2, id);
+      if (!restored) undone.bind(3, anchor).bind(4, client);
+      if (undone.step() && undone.text(0) != client) {
         VTC_LOG_INFO("Conflict on record %@ in %@: restored by %@, deleted by %@", id, dataclass,
-                     client, unseenDelete.text(0));
+                     client, undone.text(0));
         tell({dataclass, id, "(record)", Value("restored"), Value("deleted"), client,
-              unseenDelete.text(0), options.origin, unseenDelete.text(1), currentClock().now()});
+              undone.text(0), options.origin, undone.text(1), currentClock().now()});
       }
-      unseenDelete.reset();
+      undone.reset();
     }
 
     if (exists) readCompeting();

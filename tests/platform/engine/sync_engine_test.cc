@@ -178,6 +178,26 @@ TEST_F(Engine, ADeleteAndAnEditOfOneRecordSettleWholeAndKeepTheLoser) {
   EXPECT_EQ(conflicts[1].lost, Value("Anna"));
   EXPECT_EQ(sync("vdir"), Changes{SyncEngineChange(3, "r1", Array{})});
   EXPECT_EQ(engine->recordCount("Contacts"), 0);
+
+  // Deleted here and already sent; an edit made elsewhere before that
+  // computer saw the delete still brings the record back whole, and the
+  // delete here is noted as the loser. A delete that came from the network
+  // itself, undone the same way, is no one's loss here.
+  push("vdir", {SyncEngineChange(1, "r2", Array{set("FN", Value("Bo")), set("TEL", Value("3"))})});
+  sync("net");
+  push("vdir", {SyncEngineChange(3, "r2", Array{})});
+  sync("net");
+  sync("vdir");
+  engine->push("net", "Contacts", {SyncEngineChange(2, "r2", Array{set("TEL", Value("4"))})}, told);
+  ASSERT_EQ(conflicts.size(), 3u);
+  EXPECT_EQ(conflicts[2].record, "r2");
+  EXPECT_EQ(conflicts[2].lost, Value("deleted"));
+  EXPECT_EQ(sync("vdir"), Changes{SyncEngineChange(
+                              1, "r2", Array{set("FN", Value("Bo")), set("TEL", Value("4"))})});
+  engine->push("net", "Contacts", {SyncEngineChange(3, "r2", Array{})}, told);
+  engine->push("net", "Contacts", {SyncEngineChange(2, "r2", Array{set("TEL", Value("5"))})}, told);
+  EXPECT_EQ(conflicts.size(), 3u);
+  EXPECT_EQ(engine->recordCount("Contacts"), 1);
 }
 
 TEST_F(Engine, StatesTravelWithPushesAndAcknowledgementsAndADryRunForgetsEverything) {
