@@ -2,16 +2,22 @@
 // in their folders: at the end they hold the same data, and every edit is
 // present, overridden, undone by a delete or kept as a conflict.
 #include <gtest/gtest.h>
+#include <unistd.h>
 
 #include "localshare/Soak.h"
+#include "platform/fs/LocalPaths.h"
 #include "support/TestHome.h"
 
 namespace {
+
+namespace paths = vtc::paths;
 
 TEST(Soak, ThreeComputersEditingAndSyncingAtOnceLoseAndDuplicateNothing) {
   vtc::test::TestHome home;
   vtc::local::SoakOptions options;
   options.seconds = 30;
+  options.evidenceFolder =
+      paths::join(paths::temporaryDirectory(), "vsm-soak-evidence-" + std::to_string(::getpid()));
   const vtc::local::SoakReport r = vtc::local::runSoak(options);
   std::printf(
       "soak: %lld syncs (%lld failed and retried), %lld adds, %lld edits, %lld deletes, "

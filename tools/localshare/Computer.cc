@@ -1,13 +1,18 @@
 #include "localshare/Computer.h"
 
 #include <fcntl.h>
+#include <poll.h>
 #include <pty.h>
+#include <signal.h>
 #include <sys/resource.h>
 #include <sys/stat.h>
+#include <sys/syscall.h>
 #include <sys/wait.h>
 #include <unistd.h>
 
 #include <algorithm>
+#include <cerrno>
+#include <cstdio>
 #include <filesystem>
 #include <fstream>
 #include <sstream>
@@ -77,41 +82,90 @@ pid_t Computer::start(const std::vector<std::string>& args) const {
   return spawn(args, "/dev/null");
 }
 
+// The client's command line and environment, made before fork(): the child
+// of a process with threads may only call async-signal-safe functions, and
+// allocating is not one.
+struct Computer::Exec {
+  std::vector<std::string> argv, env;
+  std::vector<char*> cargv, cenv;
+  Exec(const std::vector<std::string>& args, std::vector<std::string> environment)
+      : env(std::move(environment)) {
+    argv.push_back(clientProgram());
+    argv.insert(argv.end(), args.begin(), args.end());
+    for (auto& a : argv) cargv.push_back(a.data());
+    cargv.push_back(nullptr);
+    for (auto& v : env) cenv.push_back(v.data());
+    cenv.push_back(nullptr);
+  }
+  [[noreturn]] void run() const {
+    ::execve(cargv[0], cargv.data(), cenv.data());
+    ::_exit(127);
+  }
+};
+
 pid_t Computer::spawn(const std::vector<std::string>& args, const std::string& input) const {
   const std::string out = home_ + "/.last-out", err = home_ + "/.last-err";
+  const Exec exec(args, environment());
   pid_t pid = ::fork();
   if (pid == 0) {
     ::dup2(::open(input.c_str(), O_RDONLY), 0);  // a file: never a terminal
     ::dup2(::open(out.c_str(), O_WRONLY | O_CREAT | O_TRUNC, 0644), 1);
     ::dup2(::open(err.c_str(), O_WRONLY | O_CREAT | O_TRUNC, 0644), 2);
-    execClient(args, environment());
+    exec.run();
   }
   return pid;
 }
 
-void Computer::execClient(const std::vector<std::string>& args,
-                          std::vector<std::string> env) const {
-  std::vector<std::string> argv{clientProgram()};
-  argv.insert(argv.end(), args.begin(), args.end());
-  std::vector<char*> cargv, cenv;
-  for (auto& a : argv) cargv.push_back(a.data());
-  cargv.push_back(nullptr);
-  for (auto& v : env) cenv.push_back(v.data());
-  cenv.push_back(nullptr);
-  ::execve(cargv[0], cargv.data(), cenv.data());
-  ::_exit(127);
+namespace {
+
+// Whether the process ends within the time limit (a pidfd turns readable when
+// it does).
+bool endsInTime(pid_t pid) {
+  const int fd = static_cast<int>(::syscall(SYS_pidfd_open, pid, 0));
+  if (fd < 0) return true;  // already reaped or no pidfds: wait4 decides
+  pollfd p{fd, POLLIN, 0};
+  int ready;
+  do ready = ::poll(&p, 1, Computer::kTimeLimitSeconds * 1000);
+  while (ready < 0 && errno == EINTR);
+  ::close(fd);
+  return ready != 0;
 }
 
+// The stacks of every thread of a live process, from gdb when it is there.
+std::string threadStacks(pid_t pid) {
+  if (::access("/usr/bin/gdb", X_OK) != 0) return "(no gdb to show its threads)\n";
+  const std::string command =
+      "/usr/bin/gdb -p " + std::to_string(pid) + " -batch -ex 'thread apply all bt' 2>&1";
+  std::string text;
+  if (FILE* out = ::popen(command.c_str(), "r")) {
+    char buffer[4096];
+    for (size_t n; (n = std::fread(buffer, 1, sizeof buffer, out)) > 0;) text.append(buffer, n);
+    ::pclose(out);
+  }
+  return text;
+}
+
+}  // namespace
+
 Computer::Result Computer::finish(pid_t pid) const {
+  Result r;
+  std::string stacks;
+  if (!endsInTime(pid)) {
+    r.timedOut = true;
+    stacks = threadStacks(pid);
+    ::kill(pid, SIGKILL);
+  }
   int status = 0;
   struct rusage usage {};
   ::wait4(pid, &status, 0, &usage);
-  Result r;
   r.cpuSeconds = static_cast<double>(usage.ru_utime.tv_sec + usage.ru_stime.tv_sec) +
                  static_cast<double>(usage.ru_utime.tv_usec + usage.ru_stime.tv_usec) / 1e6;
   r.status = WIFEXITED(status) ? WEXITSTATUS(status) : 128 + WTERMSIG(status);
   r.out = read(home_ + "/.last-out");
   r.err = read(home_ + "/.last-err");
+  if (r.timedOut)
+    r.err += "\n(still running after " + std::to_string(kTimeLimitSeconds) +
+             " s, killed; its threads were:)\n" + stacks;
   return r;
 }
 
@@ -126,9 +180,10 @@ Computer::Result Computer::run(const std::vector<std::string>& args,
 Computer::Result Computer::runOnTerminal(const std::vector<std::string>& args) const {
   std::vector<std::string> env = environment();
   env.push_back("TERM=xterm");
+  const Exec exec(args, std::move(env));
   int terminal = -1;
   pid_t pid = ::forkpty(&terminal, nullptr, nullptr, nullptr);
-  if (pid == 0) execClient(args, std::move(env));
+  if (pid == 0) exec.run();
   Result r;
   char buffer[4096];
   for (ssize_t n; (n = ::read(terminal, buffer, sizeof buffer)) > 0;) r.out.append(buffer, n);

@@ -20,7 +20,12 @@ class Computer {
     std::string out;
     std::string err;
     double cpuSeconds = 0;  // user and system time of the run
+    bool timedOut = false;  // killed at the time limit; err ends with its threads' stacks
   };
+
+  // A run still going after this long is taken to hang: finish() notes the
+  // stacks of its threads (where gdb is installed) and kills it.
+  static constexpr int kTimeLimitSeconds = 120;
 
   // A fresh home whose per-host preferences name the computer.
   explicit Computer(const std::string& name);
@@ -64,9 +69,7 @@ class Computer {
 
  private:
   std::vector<std::string> environment() const;
-  // In a child: becomes the client ([[noreturn]]).
-  [[noreturn]] void execClient(const std::vector<std::string>& args,
-                               std::vector<std::string> env) const;
+  struct Exec;  // a prepared command line
   // Starts the client with standard input read from the file input.
   pid_t spawn(const std::vector<std::string>& args, const std::string& input) const;
   std::string name_;

@@ -146,10 +146,11 @@ SoakReport runSoak(const SoakOptions& options) {
             ++report.deletes;
           }
         }
-        const int status = c.run({"sync", "--max-delete", "100"}).status;
+        const Computer::Result r = c.run({"sync", "--max-delete", "100"});
         std::lock_guard<std::mutex> lock(mutex);
         ++report.syncs;
-        if (status != 0) ++report.failedSyncs;
+        if (r.status != 0) ++report.failedSyncs;
+        if (r.timedOut) report.problems.push_back(c.name() + "'s sync hung: " + r.err);
       }
     });
   }
@@ -246,6 +247,23 @@ SoakReport runSoak(const SoakOptions& options) {
   for (const auto& [name, content] : final)
     if (!uids.insert(field(content, "UID")).second)
       report.problems.push_back("twice: " + field(content, "UID"));
+
+  if (!report.problems.empty() && !options.evidenceFolder.empty()) {
+    namespace fs = std::filesystem;
+    const fs::path folder = options.evidenceFolder;
+    std::error_code error;
+    fs::create_directories(folder, error);
+    for (auto& c : computers)
+      fs::copy(c->home(), folder / c->name(), fs::copy_options::recursive, error);
+    fs::copy(share.documentRoot(), folder / "share", fs::copy_options::recursive, error);
+    std::ostringstream log;
+    for (const Edit& e : edits)
+      log << std::chrono::duration<double>(e.when.time_since_epoch()).count() << ' '
+          << "ASD"[e.kind] << ' ' << e.computer << ' ' << e.record << ' ' << e.field << ' '
+          << e.value << '\n';
+    Computer::write((folder / "edits").string(), log.str());
+    report.problems.push_back("the homes, the share and the edits are kept in " + folder.string());
+  }
   return report;
 }
 

@@ -17,6 +17,9 @@ struct SoakOptions {
   double seconds = 30;
   int startingCards = 100;  // made on the first computer before the loops
   unsigned seed = 1;
+  // When set and the soak finds a problem, every computer's home and the
+  // share's folder are copied here, for a person to read what happened.
+  std::string evidenceFolder;
 };
 
 struct SoakReport {
