@@ -131,12 +131,23 @@ bool endsInTime(pid_t pid) {
   return ready != 0;
 }
 
-// The stacks of every thread of a live process, from gdb when it is there.
+// What every thread of a live process is doing: its state and kernel wait
+// channel, and the stacks from gdb where it is installed and may attach.
 std::string threadStacks(pid_t pid) {
-  if (::access("/usr/bin/gdb", X_OK) != 0) return "(no gdb to show its threads)\n";
+  std::string text;
+  const std::string task = "/proc/" + std::to_string(pid) + "/task";
+  std::error_code error;
+  for (auto it = std::filesystem::directory_iterator(task, error);
+       !error && it != std::filesystem::directory_iterator(); it.increment(error)) {
+    const std::string stat = Computer::read(it->path() / "stat");
+    const size_t state = stat.rfind(')');
+    text += "thread " + it->path().filename().string() + ": state " +
+            (state == std::string::npos ? "?" : stat.substr(state + 2, 1)) + ", waiting in " +
+            Computer::read(it->path() / "wchan") + "\n";
+  }
+  if (::access("/usr/bin/gdb", X_OK) != 0) return text;
   const std::string command =
       "/usr/bin/gdb -p " + std::to_string(pid) + " -batch -ex 'thread apply all bt' 2>&1";
-  std::string text;
   if (FILE* out = ::popen(command.c_str(), "r")) {
     char buffer[4096];
     for (size_t n; (n = std::fread(buffer, 1, sizeof buffer, out)) > 0;) text.append(buffer, n);
