@@ -4,6 +4,8 @@
 #include <gtest/gtest.h>
 #include <unistd.h>
 
+#include <cstdio>
+
 #include "localshare/Soak.h"
 #include "platform/fs/LocalPaths.h"
 #include "support/TestHome.h"
@@ -18,6 +20,10 @@ TEST(Soak, ThreeComputersEditingAndSyncingAtOnceLoseAndDuplicateNothing) {
   options.seconds = 30;
   options.evidenceFolder =
       paths::join(paths::temporaryDirectory(), "vsm-soak-evidence-" + std::to_string(::getpid()));
+  options.progress = [](const std::string& line) {
+    std::printf("soak: %s\n", line.c_str());
+    std::fflush(stdout);
+  };
   const vtc::local::SoakReport r = vtc::local::runSoak(options);
   std::printf(
       "soak: %lld syncs (%lld failed and retried), %lld adds, %lld edits, %lld deletes, "

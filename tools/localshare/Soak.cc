@@ -3,6 +3,7 @@
 #include <algorithm>
 #include <atomic>
 #include <chrono>
+#include <cstdio>
 #include <filesystem>
 #include <map>
 #include <mutex>
@@ -94,6 +95,24 @@ int64_t lockWaits(const Computer& c) {
 
 SoakReport runSoak(const SoakOptions& options) {
   SoakReport report;
+  const auto started = Clock::now();
+  auto tell = [&](const std::string& what) {
+    if (!options.progress) return;
+    char at[32];
+    std::snprintf(at, sizeof at,
+                  "%.1f s: ", std::chrono::duration<double>(Clock::now() - started).count());
+    options.progress(at + what);
+  };
+  // A run of the client, told when it is slow.
+  auto run = [&](const Computer& c, const std::vector<std::string>& args) {
+    const auto before = Clock::now();
+    Computer::Result r = c.run(args);
+    const double took = std::chrono::duration<double>(Clock::now() - before).count();
+    if (took > 10)
+      tell(c.name() + "'s " + args[0] + " took " + std::to_string(static_cast<int>(took)) +
+           " s and ended with status " + std::to_string(r.status));
+    return r;
+  };
   ApacheShare share;
   const std::string url = "http://127.0.0.1:" + std::to_string(share.port()) + "/soak";
   std::vector<std::unique_ptr<Computer>> computers;
@@ -109,7 +128,8 @@ SoakReport runSoak(const SoakOptions& options) {
                     card("s" + std::to_string(i), "start", "start"));
     edits.push_back({Edit::Add, Clock::now(), 0, name, "", ""});
   }
-  for (auto& c : computers) c->run({"sync"});
+  for (auto& c : computers) run(*c, {"sync"});
+  tell("the computers joined and took in the first cards");
 
   const auto deadline = Clock::now() + std::chrono::duration_cast<Clock::duration>(
                                            std::chrono::duration<double>(options.seconds));
@@ -146,7 +166,7 @@ SoakReport runSoak(const SoakOptions& options) {
             ++report.deletes;
           }
         }
-        const Computer::Result r = c.run({"sync", "--max-delete", "100"});
+        const Computer::Result r = run(c, {"sync", "--max-delete", "100"});
         std::lock_guard<std::mutex> lock(mutex);
         ++report.syncs;
         if (r.status != 0) ++report.failedSyncs;
@@ -155,11 +175,12 @@ SoakReport runSoak(const SoakOptions& options) {
     });
   }
   for (std::thread& t : loops) t.join();
+  tell("the editing ended after " + std::to_string(report.syncs) + " syncs");
 
   // Quiet: every computer syncs in turn until nothing moves.
   for (int round = 0; round < 3; ++round)
     for (auto& c : computers) {
-      Computer::Result r = c->run({"sync", "--max-delete", "100"});
+      Computer::Result r = run(*c, {"sync", "--max-delete", "100"});
       ++report.syncs;
       if (r.status != 0) {
         // With the computer's last words, from its log.
@@ -173,6 +194,7 @@ SoakReport runSoak(const SoakOptions& options) {
       }
     }
 
+  tell("the computers synced until quiet");
   const auto final = Computer::files(computers[0]->contacts());
   report.cardsAtEnd = static_cast<int64_t>(final.size());
   for (auto& c : computers) {

@@ -7,6 +7,7 @@
 #pragma once
 
 #include <cstdint>
+#include <functional>
 #include <string>
 #include <vector>
 
@@ -20,6 +21,9 @@ struct SoakOptions {
   // When set and the soak finds a problem, every computer's home and the
   // share's folder are copied here, for a person to read what happened.
   std::string evidenceFolder;
+  // Told how far the soak has come: each phase as it ends, and every run of
+  // the client that took more than ten seconds.
+  std::function<void(const std::string&)> progress;
 };
 
 struct SoakReport {
