@@ -1,7 +1,10 @@
 #include "support/SessionBus.h"
 
+#include <sys/socket.h>
 #include <sys/stat.h>
+#include <sys/un.h>
 #include <systemd/sd-bus.h>
+#include <unistd.h>
 
 #include <cstdlib>
 #include <filesystem>
@@ -32,6 +35,19 @@ bool nameHasOwner(const char* name) {
   return has;
 }
 
+// Whether something accepts connections on the socket: the daemon makes the
+// file before it listens on it.
+bool accepts(const std::string& socketPath) {
+  sockaddr_un address{};
+  address.sun_family = AF_UNIX;
+  if (socketPath.size() >= sizeof address.sun_path) return false;
+  socketPath.copy(address.sun_path, socketPath.size());
+  const int fd = ::socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0);
+  const bool ok = ::connect(fd, reinterpret_cast<sockaddr*>(&address), sizeof address) == 0;
+  ::close(fd);
+  return ok;
+}
+
 }  // namespace
 
 SessionBus::SessionBus() {
@@ -41,7 +57,7 @@ SessionBus::SessionBus() {
   std::string address = "unix:path=" + dir_ + "/bus";
   busPid_ =
       startProcess({"dbus-daemon", "--session", "--nofork", "--nopidfile", "--address=" + address});
-  if (!waitUntil([&] { return std::filesystem::exists(dir_ + "/bus"); })) {
+  if (!waitUntil([&] { return accepts(dir_ + "/bus"); })) {
     stopProcess(busPid_);
     throw std::runtime_error("dbus-daemon did not start");
   }
