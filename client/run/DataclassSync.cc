@@ -390,11 +390,12 @@ DataclassSync::Remote DataclassSync::fetch(bool slow, const DataclassRecord& rec
         const std::string& id = change.recordIdentifier();
         auto it = remote.truth.find(id);
         if (change.type() == SyncEngineChange::kDelete) {
+          // Only a whole record is kept aside: a partial one edited again
+          // is partial again.
           if (it != remote.truth.end()) {
-            buried[id] = std::move(it->second);
+            if (!remote.partial.erase(id)) buried[id] = std::move(it->second);
             remote.truth.erase(it);
           }
-          remote.partial.erase(id);
           continue;
         }
         if (change.type() == SyncEngineChange::kAdd) {
