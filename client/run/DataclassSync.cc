@@ -50,6 +50,12 @@ void apply(Dictionary& fields, const Array& changes) {
   }
 }
 
+// A field's value, or none.
+Value valueIn(const Dictionary& fields, const std::string& name) {
+  const Value* value = fields.find(name);
+  return value ? *value : Value();
+}
+
 // What the engine keeps of the folder's files: their stamps, with the
 // fields of each left empty until they are needed.
 std::map<std::string, ItemState> knownFiles(engine::SyncEngine& engine, const std::string& client,
@@ -93,6 +99,7 @@ struct DataclassSync::Remote {
   // Slow: records of the truth known only from modifies (deleted before the
   // first changelog read): their other fields are this computer's.
   std::set<std::string> partial;
+  std::map<std::string, std::string> origins;  // slow: the computer that last changed each record
 };
 
 DataclassSync::DataclassSync(NubiloRemoteSession& session, engine::SyncEngine& engine,
@@ -114,11 +121,13 @@ engine::PushOptions DataclassSync::pushOptions(const std::string& origin,
   engine::PushOptions options;
   options.origin = origin;
   options.state = std::move(state);
-  options.onConflict = [this](const engine::Conflict& conflict) {
-    ++outcome_.conflicts;
-    if (!options_.dryRun) conflicts_.keep(conflict);
-  };
+  options.onConflict = [this](const engine::Conflict& conflict) { noteConflict(conflict); };
   return options;
+}
+
+void DataclassSync::noteConflict(const engine::Conflict& conflict) {
+  ++outcome_.conflicts;
+  if (!options_.dryRun) conflicts_.keep(conflict);
 }
 
 void DataclassSync::report(const char* what, size_t done, size_t total, int64_t bytes) {
@@ -194,7 +203,7 @@ DataclassOutcome DataclassSync::run(const std::optional<DataclassRecord>& listed
     remote = fetch(slow, remote.record);
 
     engine_.push(folderClient_, dataclass, local, pushOptions(options_.computerName, scanned));
-    applyRemote(remote, engine_.pull(kNetworkClient, dataclass));
+    applyRemote(remote, engine_.pull(kNetworkClient, dataclass), lastFields);
     commit(remote);
     compactIfLong(remote);
     if (needsTruth && !options_.dryRun)
@@ -386,8 +395,10 @@ DataclassSync::Remote DataclassSync::fetch(bool slow, const DataclassRecord& rec
     // with its tombstones when changes come one changelog at a time.
     std::map<std::string, Dictionary> buried;
     for (const auto& [index, log] : remote.changelogs) {
+      const std::string origin = log->headerValueForKey("CreatorClientName").string();
       for (const SyncEngineChange& change : log->changes()) {
         const std::string& id = change.recordIdentifier();
+        remote.origins[id] = origin;
         auto it = remote.truth.find(id);
         if (change.type() == SyncEngineChange::kDelete) {
           // Only a whole record is kept aside: a partial one edited again
@@ -432,7 +443,8 @@ DataclassSync::Remote DataclassSync::fetch(bool slow, const DataclassRecord& rec
   return remote;
 }
 
-void DataclassSync::applyRemote(Remote& remote, const engine::PullResult& pending) {
+void DataclassSync::applyRemote(Remote& remote, const engine::PullResult& pending,
+                                const std::map<std::string, Dictionary>& lastFields) {
   const std::string& dataclass = collection_.dataclass;
   if (remote.changelogs.empty()) return;
   const int64_t last = remote.changelogs.rbegin()->first;
@@ -479,6 +491,19 @@ void DataclassSync::applyRemote(Remote& remote, const engine::PullResult& pendin
                           setsOf(fields));
       continue;
     }
+    // A field edited here that the share changed too since this computer
+    // last saw it: the value of here stays and is sent; the share's is kept
+    // as the loser, as when the changes come one changelog at a time.
+    if (auto seen = lastFields.find(id); seen != lastFields.end())
+      for (const std::string& name : pendingFields[id]) {
+        const Value base = valueIn(seen->second, name), theirs = valueIn(fields, name),
+                    ours = valueIn(here->second, name);
+        if (theirs == base || theirs == ours) continue;
+        VTC_LOG_INFO("Conflict on %@ of record %@ in %@: kept %@ from here, dropped %@ from %@",
+                     name, id, dataclass, ours, theirs, remote.origins[id]);
+        noteConflict({dataclass, id, name, ours, theirs, folderClient_, kNetworkClient,
+                      options_.computerName, remote.origins[id], currentClock().now()});
+      }
     Dictionary from = here->second;
     if (partial)  // only the fields the changelogs set; the rest stays as it is here
       for (const std::string& name : here->second.keys())

@@ -79,7 +79,11 @@ class DataclassSync {
   void lockReleasingOwnLeftovers(const std::function<void()>& lockOperation);
   void unlock();
   Remote fetch(bool slow, const DataclassRecord& record);
-  void applyRemote(Remote& remote, const engine::PullResult& pending);
+  // lastFields: the fields of the files edited here as this computer last
+  // saw them, to tell the share's concurrent edits of the same fields.
+  void applyRemote(Remote& remote, const engine::PullResult& pending,
+                   const std::map<std::string, Dictionary>& lastFields);
+  void noteConflict(const engine::Conflict& conflict);
   void commit(Remote& remote);
   void compactIfLong(Remote& remote);
   // Sets the record right when it names a changelog below index.

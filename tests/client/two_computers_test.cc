@@ -222,6 +222,23 @@ TEST_P(Account, CompactionKeepsAnUnsentEditAndAComputerAwayThroughoutConverges) 
   EXPECT_THAT(a.run({"conflicts"}).out, HasSubstr("bob.vcf"));
 }
 
+// A field edited here and on the share, met in a slow sync: this computer's
+// value is sent, and the share's is kept as the loser.
+TEST_F(AccountGuards, ASlowSyncKeepsTheShareValueOfAFieldEditedHereTooAsTheLoser) {
+  Computer::write(a.contacts() + "/ann.vcf", card("ann", "Ann", "ann@example.org", "1"));
+  sync(a);
+  sync(b);
+  Computer::write(b.contacts() + "/ann.vcf", card("ann", "Ann", "ann@example.org", "2"));
+  Computer::write(a.contacts() + "/ann.vcf", card("ann", "Ann", "ann@example.org", "3"));
+  sync(a);
+  EXPECT_EQ(a.run({"repair", "com.korvo.Contacts"}).status, 0);
+  EXPECT_THAT(sync(b).out, HasSubstr("(slow sync)"));
+  sync(a);
+  EXPECT_EQ(contactsOf(a)["ann.vcf"], card("ann", "Ann", "ann@example.org", "2"));
+  EXPECT_EQ(contactsOf(a), contactsOf(b));
+  EXPECT_THAT(b.run({"conflicts"}).out, HasSubstr("TEL:3"));
+}
+
 // A changelog damaged on the share ends in a plain sentence, not a loop of
 // downloads, until a computer whose copy is whole repairs the share.
 TEST_P(Account, ADamagedShareIsReportedOnceAndRepairedFromAWholeCopy) {
