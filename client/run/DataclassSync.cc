@@ -50,12 +50,6 @@ void apply(Dictionary& fields, const Array& changes) {
   }
 }
 
-// A field's value, or none.
-Value valueIn(const Dictionary& fields, const std::string& name) {
-  const Value* value = fields.find(name);
-  return value ? *value : Value();
-}
-
 // What the engine keeps of the folder's files: their stamps, with the
 // fields of each left empty until they are needed.
 std::map<std::string, ItemState> knownFiles(engine::SyncEngine& engine, const std::string& client,
@@ -496,8 +490,8 @@ void DataclassSync::applyRemote(Remote& remote, const engine::PullResult& pendin
     // as the loser, as when the changes come one changelog at a time.
     if (auto seen = lastFields.find(id); seen != lastFields.end())
       for (const std::string& name : pendingFields[id]) {
-        const Value base = valueIn(seen->second, name), theirs = valueIn(fields, name),
-                    ours = valueIn(here->second, name);
+        const Value &base = seen->second.get(name), &theirs = fields.get(name),
+                    &ours = here->second.get(name);
         if (theirs == base || theirs == ours) continue;
         VTC_LOG_INFO("Conflict on %@ of record %@ in %@: kept %@ from here, dropped %@ from %@",
                      name, id, dataclass, ours, theirs, remote.origins[id]);

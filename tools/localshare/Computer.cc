@@ -12,7 +12,6 @@
 
 #include <algorithm>
 #include <cerrno>
-#include <cstdio>
 #include <filesystem>
 #include <fstream>
 #include <sstream>
@@ -21,6 +20,7 @@
 #include "common/Uuid.h"
 #include "platform/fs/LocalPaths.h"
 #include "platform/plist/PlistCodec.h"
+#include "platform/process/Command.h"
 
 extern char** environ;
 
@@ -145,14 +145,9 @@ std::string threadStacks(pid_t pid) {
             (state == std::string::npos ? "?" : stat.substr(state + 2, 1)) + ", waiting in " +
             Computer::read(it->path() / "wchan") + "\n";
   }
-  if (::access("/usr/bin/gdb", X_OK) != 0) return text;
-  const std::string command =
-      "/usr/bin/gdb -p " + std::to_string(pid) + " -batch -ex 'thread apply all bt' 2>&1";
-  if (FILE* out = ::popen(command.c_str(), "r")) {
-    char buffer[4096];
-    for (size_t n; (n = std::fread(buffer, 1, sizeof buffer, out)) > 0;) text.append(buffer, n);
-    ::pclose(out);
-  }
+  const process::CommandResult gdb =
+      process::run({"gdb", "-p", std::to_string(pid), "-batch", "-ex", "thread apply all bt"});
+  if (gdb.status != 127) text += gdb.out + gdb.err;
   return text;
 }
 
