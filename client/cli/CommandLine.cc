@@ -96,9 +96,10 @@ int runCommandLine(int argc, char** argv) {
   auto* sync = app.add_subcommand("sync", "Sync now");
   sync->add_option("NAME", run.dataclasses, "Only these dataclasses");
   sync->add_flag("--dry-run", run.dryRun, "Say what would happen; change nothing");
-  sync->add_option("--max-delete", run.maxDeletePercent,
-                   "Refuse to delete more than this percentage of a dataclass's items")
-      ->check(CLI::Range(0, 100));
+  auto* maxDelete =
+      sync->add_option("--max-delete", run.maxDeletePercent,
+                       "Refuse to delete more than this percentage of a dataclass's items")
+          ->check(CLI::Range(0, 100));
   sync->footer("Example: nubilosyncclient sync com.korvo.Contacts --dry-run");
 
   std::string repaired;
@@ -165,7 +166,11 @@ int runCommandLine(int argc, char** argv) {
                         dataclass.empty() ? std::nullopt : std::optional<std::string>(dataclass),
                         output);
     if (*remove) return removeCommand(removed, output);
-    if (*sync) return syncCommand(run, output);
+    if (*sync) {
+      // Deletes the user let through go out as confirmed.
+      run.deletesConfirmed = maxDelete->count() > 0;
+      return syncCommand(run, output);
+    }
     if (*repair) {
       RunRequest request;
       request.dataclasses = {repaired};

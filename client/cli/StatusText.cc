@@ -5,6 +5,7 @@
 #include <ctime>
 #include <ostream>
 
+#include "client/items/ItemRecord.h"
 #include "common/Format.h"
 
 namespace vtc::client {
@@ -154,7 +155,10 @@ std::string statusAsJson(const StatusReport& s) {
     doc["conflicts"].push_back({{"id", c.id},
                                 {"dataclass", c.dataclass},
                                 {"record", c.record},
-                                {"field", c.field},
+                                {"file", c.file},
+                                {"name", c.name},
+                                {"field", std::string(nameOf(c.field))},
+                                {"key", c.field},
                                 {"kept", jsonOf(c.kept)},
                                 {"lost", jsonOf(c.lost)},
                                 {"keptComputer", c.keptComputer},

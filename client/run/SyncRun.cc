@@ -44,7 +44,10 @@ void rememberLastError(const std::string& dataclass, const std::string* sentence
 }  // namespace
 
 int RunResult::exitStatus() const {
-  return failures.empty() ? 0 : static_cast<int>(failures.front().kind);
+  if (!failures.empty()) return static_cast<int>(failures.front().kind);
+  for (const DataclassOutcome& o : outcomes)
+    if (o.leftOver()) return static_cast<int>(FailureKind::LeftOver);
+  return 0;
 }
 
 RunResult runSync(const RunRequest& request) {
@@ -90,6 +93,7 @@ RunResult runSync(const RunRequest& request) {
   SyncOptions options;
   options.dryRun = request.dryRun;
   options.maxDeletePercent = request.maxDeletePercent;
+  options.deletesConfirmed = request.deletesConfirmed;
   options.repair = request.repair;
   options.progress = request.progress;
   options.computerName = prefs.clientName().value_or("this computer");

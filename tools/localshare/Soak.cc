@@ -68,7 +68,8 @@ std::vector<std::string> itemNames(const std::string& folder) {
   return names;
 }
 
-// Every losing value kept on a computer: "record field lost".
+// Every losing value kept on a computer: "file property lost", where a
+// delete that lost is "(record) deleted".
 std::vector<std::string> lostValues(const Computer& c) {
   std::vector<std::string> lost;
   std::error_code error;
@@ -77,8 +78,14 @@ std::vector<std::string> lostValues(const Computer& c) {
        !error && it != std::filesystem::directory_iterator(); it.increment(error))
     if (auto kept = plist::readFile(it->path().string())) {
       const Dictionary& d = kept->dictionary();
-      lost.push_back(d.get("Record").string() + " " + d.get("Field").string() + " " +
-                     d.get("Lost").string());
+      // The property of a field's key ("TEL#1f3a09c2" is a TEL).
+      std::string property = d.get("Field").string();
+      property = property.substr(property.rfind('/') + 1);
+      property = property.substr(0, property.find('#'));
+      const Value& value = d.get("Lost");
+      std::string text = value.isString() ? value.string() : "deleted";
+      if (value.kind() == Value::Kind::Data) text.assign(value.data().begin(), value.data().end());
+      lost.push_back(d.get("File").string() + " " + property + " " + text);
     }
   return lost;
 }
