@@ -99,6 +99,7 @@ void printStatus(const StatusReport& s, std::ostream& out) {
           << "\n";
     else if (!s.serverError)
       out << "  on the share: nothing yet\n";
+    for (const std::string& line : d.leftOver) out << "  " << line << "\n";
     if (d.serverStatus == std::optional<std::string>("needstruth"))
       out << "  this computer takes in the whole truth at its next sync (needstruth)\n";
   }
@@ -136,6 +137,7 @@ std::string statusAsJson(const StatusReport& s) {
                                   {"lastSuccess", optionalDate(d.lastSuccess)},
                                   {"failedCount", d.failedCount},
                                   {"lastError", optional(d.lastError)},
+                                  {"leftOver", d.leftOver},
                                   {"share",
                                    {{"minversion", optional(d.minversion)},
                                     {"maxversion", optional(d.maxversion)},

@@ -703,8 +703,12 @@ void DataclassSync::writeFolder(const std::map<std::string, std::string>* origin
   FolderWriteResult written = writer.write();
   outcome_.filesWritten += written.written;
   outcome_.filesSkipped += written.skipped;
-  outcome_.setAside = std::move(written.setAside);
   outcome_.writeFailures = std::move(written.failures);
+  // Every record still set aside is named, every sync, until a change to it
+  // makes it an item again.
+  outcome_.setAside.clear();
+  for (const auto& [id, item] : engine_.setAsideRecords(collection_.dataclass))
+    outcome_.setAside.push_back({item.file, item.reason, item.origin});
 }
 
 }  // namespace vtc::client

@@ -83,6 +83,10 @@ std::string lastErrorKey(const std::string& dataclass) {
   return "LastError." + dataclass;
 }
 
+std::string leftOverKey(const std::string& dataclass) {
+  return "LeftOverItems." + dataclass;
+}
+
 StatusReport gatherStatus() {
   VTCPrefsCenter& prefs = VTCPrefsCenter::defaultCenter();
   StatusReport status;
@@ -119,6 +123,15 @@ StatusReport gatherStatus() {
     const Value error = prefs::PreferenceStore::shared().copyValue(
         lastErrorKey(c.dataclass), kVantorDefaultsKey, prefs::Scope::CurrentHost);
     if (error.isString()) d.lastError = error.string();
+    const Value leftOver = prefs::PreferenceStore::shared().copyValue(
+        leftOverKey(c.dataclass), kVantorDefaultsKey, prefs::Scope::CurrentHost);
+    for (const Value& line : leftOver.array())
+      if (line.isString()) d.leftOver.push_back(line.string());
+    if (engine)
+      for (const auto& [id, item] : engine->setAsideRecords(c.dataclass))
+        d.leftOver.push_back("set aside " + item.file +
+                             (item.origin.empty() ? "" : " (from " + item.origin + ")") + ": " +
+                             item.reason);
     status.dataclasses.push_back(std::move(d));
   }
   if (!status.setUp) return status;
