@@ -4,7 +4,7 @@
 #include <filesystem>
 #include <stdexcept>
 
-#include "VantorSyncManager/VTCPrefsCenter.h"
+#include "client/run/SupportFolder.h"
 #include "common/Uuid.h"
 #include "platform/fs/LocalPaths.h"
 #include "platform/plist/PlistCodec.h"
@@ -48,10 +48,7 @@ std::optional<KeptConflict> fromValue(const Value& v) {
 
 }  // namespace
 
-ConflictStore::ConflictStore()
-    : ConflictStore(paths::join(VTCPrefsCenter::applicationSupportDirectory().value_or(paths::join(
-                                    paths::applicationSupportDirectory(), "NubiloSyncClient")),
-                                "Conflicts")) {}
+ConflictStore::ConflictStore() : ConflictStore(paths::join(supportFolder(), "Conflicts")) {}
 
 ConflictStore::ConflictStore(std::string folder) : folder_(std::move(folder)) {}
 

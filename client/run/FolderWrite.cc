@@ -8,9 +8,12 @@
 #include "changelog/ChangeLogFormat.h"
 #include "client/items/ItemRecord.h"
 #include "client/run/FolderRead.h"
+#include "client/run/SupportFolder.h"
 #include "client/stores/ItemFiles.h"
 #include "common/Clock.h"
 #include "common/Logging.h"
+#include "platform/fs/AtomicWrite.h"
+#include "platform/fs/LocalPaths.h"
 
 namespace vtc::client {
 
@@ -62,8 +65,16 @@ FolderWriteResult FolderWriter::write() {
     auto it = origins->find(id);
     return it == origins->end() ? std::string() : it->second;
   };
-  auto setAside = [&](const std::string& id, const std::string& file, const std::string& why) {
+  // The bytes of a record set aside are kept where the user can read them.
+  const std::string asideFolder = paths::join(paths::join(supportFolder(), "SetAside"), dataclass);
+  auto setAside = [&](const std::string& id, const std::string& file, const std::string& why,
+                      const std::optional<std::string>& bytes) {
     VTC_LOG_WARNING("Setting aside record %@ of %@ (%@): %@", id, dataclass, file, why);
+    if (bytes) {
+      paths::makeDirectories(asideFolder, 0700);
+      if (!fs::writeFileAtomically(paths::join(asideFolder, fileNameFor(id, kind)), *bytes, 0600))
+        VTC_LOG_ERROR("Could not keep the bytes of record %@ in %@", id, asideFolder);
+    }
     result.setAside.push_back({file, why, origin(id)});
     update.setAside.emplace_back(id, engine::SetAside{file, why, origin(id), currentClock().now()});
     update.taken.push_back(id);
@@ -124,7 +135,7 @@ FolderWriteResult FolderWriter::write() {
     std::optional<Dictionary> written =
         bytes ? recordOfBytes(kind, *bytes, target, &merged, &problem) : std::nullopt;
     if (!written) {
-      setAside(id, target, problem);
+      setAside(id, target, problem, bytes);
       continue;
     }
     if (currentFile && target == *currentFile && bytesNow == bytes) {

@@ -1,5 +1,8 @@
 #include "client/run/StatusReport.h"
 
+#include "client/run/SupportFolder.h"
+#include "platform/fs/LocalPaths.h"
+
 #include <fstream>
 
 #include "VantorSyncManager/NubiloException.h"
@@ -11,6 +14,7 @@
 #include "client/run/Collections.h"
 #include "client/run/DataclassSync.h"
 #include "client/run/ServerView.h"
+#include "client/run/SupportFolder.h"
 #include "platform/dav/DavPaths.h"
 #include "platform/dav/TesselSession.h"
 #include "platform/engine/SyncEngine.h"
@@ -131,7 +135,8 @@ StatusReport gatherStatus() {
       for (const auto& [id, item] : engine->setAsideRecords(c.dataclass))
         d.leftOver.push_back("set aside " + item.file +
                              (item.origin.empty() ? "" : " (from " + item.origin + ")") + ": " +
-                             item.reason);
+                             item.reason + "; its bytes are in " +
+                             paths::join(paths::join(supportFolder(), "SetAside"), c.dataclass));
     status.dataclasses.push_back(std::move(d));
   }
   if (!status.setUp) return status;
