@@ -1,8 +1,5 @@
 #include "client/run/StatusReport.h"
 
-#include "client/run/SupportFolder.h"
-#include "platform/fs/LocalPaths.h"
-
 #include <fstream>
 
 #include "VantorSyncManager/NubiloException.h"
