@@ -176,28 +176,44 @@ Dictionary toRecord(const ItemText& text, const std::string& fileName, const Dic
 
   for (auto& [plain, indices] : instances) {
     const std::string_view baseName = baseNameOf(nameOf(plain));
-    std::vector<InstanceFacts> now;
-    for (size_t i : indices)
-      now.push_back(factsOf(baseName, text.units[i].role, text.units[i].raw));
     std::vector<std::string> oldKeys;
-    std::vector<InstanceFacts> old;
-    if (auto it = before.find(plain); it != before.end()) {
-      for (const std::string& key : it->second) {
-        const std::string_view raw = rawOf(previous->get(key));
-        oldKeys.push_back(key);
-        old.push_back(factsOf(baseName, roleOfRaw(raw), raw));
-      }
-    }
-    std::vector<bool> taken(old.size(), false);
+    if (auto it = before.find(plain); it != before.end()) oldKeys = it->second;
+    std::vector<bool> taken(oldKeys.size(), false);
     std::vector<std::string> chosen(indices.size());
     auto take = [&](size_t k, size_t o) {
       chosen[k] = oldKeys[o];
       taken[o] = true;
     };
-    // The same instance, unchanged or by its identity.
+    // Most instances are the bytes they were: those keep their keys at once,
+    // and only the others are read for what they mean.
+    if (!oldKeys.empty()) {
+      std::unordered_multimap<std::string_view, size_t> byBytes;
+      for (size_t o = oldKeys.size(); o-- > 0;)
+        byBytes.emplace(rawOf(previous->get(oldKeys[o])), o);
+      for (size_t k = 0; k < indices.size(); ++k) {
+        auto [first, last] = byBytes.equal_range(text.units[indices[k]].raw);
+        for (auto it = first; it != last; ++it)
+          if (!taken[it->second]) {
+            take(k, it->second);
+            break;
+          }
+      }
+    }
+    std::vector<InstanceFacts> now(indices.size()), old(oldKeys.size());
+    for (size_t k = 0; k < indices.size(); ++k)
+      if (chosen[k].empty())
+        now[k] = factsOf(baseName, text.units[indices[k]].role, text.units[indices[k]].raw);
+    for (size_t o = 0; o < oldKeys.size(); ++o)
+      if (!taken[o]) {
+        const std::string_view raw = rawOf(previous->get(oldKeys[o]));
+        old[o] = factsOf(baseName, roleOfRaw(raw), raw);
+      }
+    // The same instance by its identity.
     std::unordered_multimap<std::string_view, size_t> byIdentity;
-    for (size_t o = old.size(); o-- > 0;) byIdentity.emplace(old[o].identity, o);
+    for (size_t o = old.size(); o-- > 0;)
+      if (!taken[o]) byIdentity.emplace(old[o].identity, o);
     for (size_t k = 0; k < now.size(); ++k) {
+      if (!chosen[k].empty()) continue;
       auto [first, last] = byIdentity.equal_range(now[k].identity);
       for (auto it = first; it != last; ++it)
         if (!taken[it->second]) {
@@ -205,11 +221,8 @@ Dictionary toRecord(const ItemText& text, const std::string& fileName, const Dic
           break;
         }
     }
-    // Only instances left unmatched are compared half by half.
-    bool open = false;
-    for (size_t k = 0; k < now.size() && !open; ++k) open = chosen[k].empty();
     // An edit of one half: the parameters or the value stayed.
-    for (size_t k = 0; open && k < now.size(); ++k) {
+    for (size_t k = 0; k < now.size(); ++k) {
       if (!chosen[k].empty() || now[k].byIdentityOnly) continue;
       for (size_t o = 0; o < old.size(); ++o)
         if (!taken[o] && !old[o].byIdentityOnly &&
@@ -230,6 +243,8 @@ Dictionary toRecord(const ItemText& text, const std::string& fileName, const Dic
       if (!key.empty() && !used.insert(key).second) key.clear();
     for (size_t k = 0; k < now.size(); ++k) {
       if (chosen[k].empty()) {
+        if (now[k].identity.empty() && now[k].value.empty())
+          now[k] = factsOf(baseName, text.units[indices[k]].role, text.units[indices[k]].raw);
         const std::string stem = plain + '#' + hashText(now[k].identity);
         std::string key = stem;
         for (int again = 2; used.count(key); ++again) key = stem + "." + std::to_string(again);
@@ -323,7 +338,7 @@ const std::string& recordFile(const Dictionary& record) {
 }
 
 std::optional<std::string> renderRecord(const Dictionary& record, const Dictionary* local,
-                                        std::string* problem) {
+                                        std::string* problem, Dictionary* rendered) {
   auto fail = [&](std::string why) -> std::optional<std::string> {
     if (problem) *problem = std::move(why);
     return std::nullopt;
@@ -340,19 +355,28 @@ std::optional<std::string> renderRecord(const Dictionary& record, const Dictiona
 
   std::string out;
   std::set<std::string_view> written;
+  std::string renderedOrder;
+  if (rendered) {
+    rendered->clear();
+    rendered->reserve(record.size());
+    rendered->set(kFileField, record.get(kFileField));
+    rendered->set(kOrderField, Value());
+  }
   auto append = [&](std::string_view key) -> bool {
     const Value* value = record.find(key);
     if (!value) return true;  // named by the order only
     if (!written.insert(key).second) return true;
-    const std::string_view raw = rawOf(*value);
-    if (raw.empty()) return false;
+    if (rawOf(*value).empty()) return false;
     if (local)
       if (const Value* mine = local->find(key);
-          mine && !(*mine == *value) && sameMeaning(*mine, *value)) {
-        out += rawOf(*mine);
-        return true;
-      }
-    out += raw;
+          mine && !(*mine == *value) && sameMeaning(*mine, *value))
+        value = mine;
+    out += rawOf(*value);
+    if (rendered) {
+      if (!renderedOrder.empty()) renderedOrder += '\n';
+      renderedOrder += key;
+      rendered->set(key, *value);
+    }
     return true;
   };
   for (const std::string& key : order) {
@@ -371,6 +395,7 @@ std::optional<std::string> renderRecord(const Dictionary& record, const Dictiona
     }
     if (!append(key)) return fail("the value of " + key + " is not text");
   }
+  if (rendered) rendered->set(kOrderField, Value(std::move(renderedOrder)));
   return out;
 }
 

@@ -54,8 +54,11 @@ Dictionary rekeyInstances(const Dictionary& record, const Dictionary& reference)
 // now) has a unit of the same key and meaning, its bytes are used, so that
 // a file keeps the bytes nothing changed. None, with *problem set, when the
 // record cannot make an item (no frame, a value that is no unit's bytes).
+// *rendered (when given) is the record of the bytes made: the units
+// written, in order, under the record's keys and file name.
 std::optional<std::string> renderRecord(const Dictionary& record, const Dictionary* local = nullptr,
-                                        std::string* problem = nullptr);
+                                        std::string* problem = nullptr,
+                                        Dictionary* rendered = nullptr);
 
 // The keys of a record in order ("(order)" read).
 std::vector<std::string> recordOrder(const Dictionary& record);

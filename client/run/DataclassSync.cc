@@ -180,7 +180,7 @@ DataclassOutcome DataclassSync::run(const std::optional<DataclassRecord>& listed
       // An idle sync writes nothing: the engine hears only of files read again.
       if (!local.folder.scan.read.empty() || !local.folder.scan.deleted.empty())
         store(local, plan, none);
-      writeFolder(nullptr);
+      writeFolder(nullptr, &local.folder.scan.states);
     }
     return outcome_;
   }
@@ -242,7 +242,7 @@ DataclassOutcome DataclassSync::run(const std::optional<DataclassRecord>& listed
   if (locked_) unlock();
   if (!options_.dryRun) {
     outcome_.filesWritten = 0;
-    writeFolder(&origins);
+    writeFolder(&origins, &local.folder.scan.states);
   }
   return outcome_;
 }
@@ -697,9 +697,10 @@ void DataclassSync::compactIfLong(DataclassRecord& record) {
   outcome_.committedIndex = index;
 }
 
-void DataclassSync::writeFolder(const std::map<std::string, std::string>* origins) {
-  FolderWriter writer{folder_, engine_,          folderClient_, collection_.dataclass,
-                      origins, options_.progress};
+void DataclassSync::writeFolder(const std::map<std::string, std::string>* origins,
+                                std::map<std::string, ItemState>* known) {
+  FolderWriter writer{folder_, engine_,           folderClient_, collection_.dataclass,
+                      origins, options_.progress, known};
   FolderWriteResult written = writer.write();
   outcome_.filesWritten += written.written;
   outcome_.filesSkipped += written.skipped;

@@ -110,7 +110,9 @@ class DataclassSync {
   void repairLaggingRecord(int64_t index);
   // After a reset commit: every other computer takes the truth in once.
   void markOthersNeedingTruth();
-  void writeFolder(const std::map<std::string, std::string>* origins);
+  // known: the folder's item states as stored (none: read them).
+  void writeFolder(const std::map<std::string, std::string>* origins,
+                   std::map<std::string, ItemState>* known);
   void report(const char* what, size_t done, size_t total, int64_t bytes = 0);
 
   NubiloRemoteSession& session_;

@@ -50,7 +50,9 @@ FolderWriteResult FolderWriter::write() {
   const std::vector<std::string> takes = engine.folderTakes(client, dataclass);
   if (takes.empty()) return result;
   const ItemKind kind = folder.kind();
-  std::map<std::string, ItemState> known = knownFiles(engine, client, dataclass);
+  std::map<std::string, ItemState> loaded;
+  if (!this->known) loaded = knownFiles(engine, client, dataclass);
+  std::map<std::string, ItemState>& known = this->known ? *this->known : loaded;
   std::map<std::string, std::string> fileOf;
   for (const auto& [name, state] : known) fileOf.emplace(state.record, name);
   const std::map<std::string, Dictionary> truth = engine.recordsWithIdentifiers(dataclass, takes);
@@ -116,35 +118,28 @@ FolderWriteResult FolderWriter::write() {
         (known.count(target) && (!currentFile || target != *currentFile)))
       target = currentFile ? *currentFile : fileNameFor(id, kind);
 
-    std::optional<std::string> bytesNow;
-    std::optional<Dictionary> local;
+    // The file as the engine last recorded it: unchanged since, its record
+    // is the one stored, and its bytes need no reading.
+    const Dictionary* local = nullptr;
     if (currentFile) {
       const std::optional<ItemState> onDisk = folder.stat(*currentFile);
       if (onDisk && !onDisk->sameFileAs(known.at(*currentFile))) {
         ++result.skipped;  // changed since the sync read it: the next sync reads it first
         continue;
       }
-      bytesNow = folder.read(*currentFile);
       const Value& detail = details[*currentFile];
-      if (bytesNow)
-        local = recordOfBytes(kind, *bytesNow, *currentFile,
-                              detail.isDictionary() ? &detail.dictionary() : nullptr);
+      if (detail.isDictionary()) local = &detail.dictionary();
     }
     std::string problem;
-    std::optional<std::string> bytes = renderRecord(merged, local ? &*local : nullptr, &problem);
-    std::optional<Dictionary> written =
-        bytes ? recordOfBytes(kind, *bytes, target, &merged, &problem) : std::nullopt;
-    if (!written) {
+    Dictionary written;
+    std::optional<std::string> bytes = renderRecord(merged, local, &problem, &written);
+    if (!bytes || !readItemText(kind, *bytes, &problem)) {
       setAside(id, target, problem, bytes);
       continue;
     }
-    if (currentFile && target == *currentFile && bytesNow == bytes) {
+    written.set(kFileField, Value(target));
+    if (local && target == *currentFile && written == *local) {
       // Nothing to write: the file means what the truth says.
-      ItemState state = known.at(target);
-      update.state.items.emplace_back(
-          target, engine::StoredItem{{state.size, state.modifiedNanoseconds,
-                                      state.changedNanoseconds, state.inode, id},
-                                     Value(std::move(*written))});
       update.taken.push_back(id);
       update.setAside.emplace_back(id, std::nullopt);
       continue;
@@ -165,7 +160,8 @@ FolderWriteResult FolderWriter::write() {
     update.state.items.emplace_back(
         target, engine::StoredItem{{state.size, state.modifiedNanoseconds, state.changedNanoseconds,
                                     state.inode, id},
-                                   Value(std::move(*written))});
+                                   Value(std::move(written))});
+    state.record = id;
     known[target] = state;
     if (currentFile && !inPlace) removeFile(*currentFile);
     update.taken.push_back(id);

@@ -38,6 +38,9 @@ struct FolderWriter {
   // The computers that last changed records in this run, for set-aside notes.
   const std::map<std::string, std::string>* origins = nullptr;
   Progress* progress = nullptr;
+  // The folder's item states as the engine holds them, when the caller has
+  // them already (kept up to date with what is written); else read.
+  std::map<std::string, ItemState>* known = nullptr;
 
   FolderWriteResult write();
 };

@@ -90,6 +90,12 @@ struct Computer::Exec {
   std::vector<char*> cargv, cenv;
   Exec(const std::vector<std::string>& args, std::vector<std::string> environment)
       : env(std::move(environment)) {
+    // A profiler or debugger the client runs under, for measurements:
+    // VSM_CLIENT_WRAPPER="valgrind --tool=callgrind".
+    if (const char* wrapper = std::getenv("VSM_CLIENT_WRAPPER")) {
+      std::istringstream words(wrapper);
+      for (std::string word; words >> word;) argv.push_back(word);
+    }
     argv.push_back(clientProgram());
     argv.insert(argv.end(), args.begin(), args.end());
     for (auto& a : argv) cargv.push_back(a.data());
