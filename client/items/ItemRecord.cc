@@ -1,5 +1,6 @@
 #include "client/items/ItemRecord.h"
 
+#include <algorithm>
 #include <cstdio>
 #include <map>
 #include <set>
@@ -397,6 +398,25 @@ std::optional<std::string> renderRecord(const Dictionary& record, const Dictiona
   }
   if (rendered) rendered->set(kOrderField, Value(std::move(renderedOrder)));
   return out;
+}
+
+uint64_t recordDigest(const std::string& id, const Dictionary& record) {
+  std::vector<std::pair<std::string_view, std::string_view>> units;
+  units.reserve(record.size());
+  for (const auto& [key, value] : record) units.emplace_back(key, rawOf(value));
+  std::sort(units.begin(), units.end());
+  auto bytes = [](std::string_view s) {
+    return ByteView(reinterpret_cast<const uint8_t*>(s.data()), s.size());
+  };
+  const uint8_t separator = 0;
+  uint64_t h = clog::stableHash(bytes(id));
+  for (const auto& [key, raw] : units) {
+    h = clog::stableHash(ByteView(&separator, 1), h);
+    h = clog::stableHash(bytes(key), h);
+    h = clog::stableHash(ByteView(&separator, 1), h);
+    h = clog::stableHash(bytes(raw), h);
+  }
+  return h;
 }
 
 std::string displayName(const Dictionary& record) {

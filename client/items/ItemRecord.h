@@ -17,6 +17,7 @@
 // its file name.
 #pragma once
 
+#include <cstdint>
 #include <optional>
 #include <string>
 #include <string_view>
@@ -73,6 +74,11 @@ std::string_view scopeOf(std::string_view key);
 std::string_view nameOf(std::string_view key);
 // Whether a key is structure, not content: the frame, "(file)", "(order)".
 bool isStructureKey(std::string_view key);
+
+// A digest of a record under its identity: the same for the same units,
+// keys and file name on every computer, whatever order they were set in.
+// The digest of a set of records is the exclusive or of theirs.
+uint64_t recordDigest(const std::string& id, const Dictionary& record);
 
 // A person's name for the item: its FN or SUMMARY, else its file name.
 std::string displayName(const Dictionary& record);

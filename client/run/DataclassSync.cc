@@ -61,6 +61,7 @@ struct DataclassSync::Incoming {
   NetworkState state;
   bool slow = false;
   bool fetched = false;
+  bool stateChanged = false;  // the state moved on without a fetch
   std::map<std::string, merge::FoldState> folds;
   std::map<std::string, Dictionary> base;
   std::set<std::string> confirmedDeletes;
@@ -210,21 +211,39 @@ DataclassOutcome DataclassSync::run(const std::optional<DataclassRecord>& listed
                               " yet, so its copy cannot repair the share's; repair on a "
                               "computer whose last sync of it succeeded.");
     }
+    // A compaction by another computer whose truth this computer holds
+    // already: the new history starts from what it has, so it goes on from
+    // there instead of reading the whole truth again.
+    NetworkState state = network;
+    bool resumed = false;
+    if (!options_.repair && record.truthIndex && record.minversion &&
+        *record.minversion == *record.truthIndex + 1 && network.index == record.truthIndex &&
+        network.minversion != record.minversion && record.truthDigest == truthDigestText()) {
+      VTC_LOG_INFO("%@ was compacted at changelog %d from a truth this computer holds", dataclass,
+                   *record.minversion);
+      state = NetworkState{record.minversion, record.minversion};
+      resumed = true;
+    }
     const bool slow = !options_.repair && record.maxversion &&
-                      (!network.index || record.minversion != network.minversion ||
-                       *record.maxversion < *network.index || needsTruth);
-    Incoming incoming = fetch(slow, record, local);
+                      (!state.index || record.minversion != state.minversion ||
+                       *record.maxversion < *state.index || (needsTruth && !resumed));
+    Incoming incoming = fetch(slow, record, state, local);
+    incoming.stateChanged = resumed;
     Plan plan = decide(local, incoming, record);
     origins = plan.origins;
     guardDeletes(local, plan);
     outcome_.sentChanges = plan.send.size();
     outcome_.filesWritten = plan.takes.size();
     if (!options_.dryRun) {
+      // A long history is written again before this computer's changes go
+      // out, as the truth the share holds now: computers that took it in
+      // go on from it.
+      if (!plan.send.empty() && compactionDue(record)) compact(record, incoming);
       commit(plan, record);
       incoming.record = record;
       keepConflicts(plan);
       store(local, plan, incoming);
-      compactIfLong(record);
+      if (options_.repair) repair(record);
       if (needsTruth)
         session_.setStatus("normal", session_.configuration().get("guid").string(), dataclass);
     }
@@ -309,11 +328,11 @@ void DataclassSync::unlock() {
 }
 
 DataclassSync::Incoming DataclassSync::fetch(bool slow, const DataclassRecord& record,
-                                             const Local& local) {
+                                             const NetworkState& state, const Local& local) {
   const std::string& dataclass = collection_.dataclass;
   Incoming in;
   in.record = record;
-  in.state = NetworkState::fromValue(engine_.clientState(kNetworkClient, dataclass));
+  in.state = state;
   in.slow = slow;
   if (slow)
     for (const SyncEngineChange& have : engine_.records(dataclass)) {
@@ -369,7 +388,7 @@ DataclassSync::Incoming DataclassSync::fetch(bool slow, const DataclassRecord& r
       DataclassRecord repaired = DataclassRecord::fromRecord(session_.getDataclassInfo(dataclass));
       if (!slow || repaired.minversion != record.minversion ||
           repaired.maxversion != record.maxversion)
-        return fetch(true, repaired, local);
+        return fetch(true, repaired, state, local);
     }
     prefs.setFailedETag(record.etag, dataclass);
     throw;
@@ -587,7 +606,8 @@ void DataclassSync::store(Local& local, Plan& plan, const Incoming& incoming) {
   NetworkState state = incoming.state;
   if (outcome_.committedIndex)
     state = NetworkState{outcome_.committedIndex, incoming.record.minversion};
-  if (incoming.fetched || outcome_.committedIndex) o.network.clientState = state.toValue();
+  if (incoming.fetched || incoming.stateChanged || outcome_.committedIndex)
+    o.network.clientState = state.toValue();
   // The files read are taken in: their states and records go with the truth.
   for (const auto& [name, file] : local.folder.scan.read) {
     const ItemState& s = local.folder.scan.states.at(name);
@@ -631,45 +651,97 @@ void DataclassSync::markOthersNeedingTruth() {
   locks_.record();
 }
 
-void DataclassSync::compactIfLong(DataclassRecord& record) {
-  if (!outcome_.committedIndex && !options_.repair) return;
-  if (!record.maxversion) return;
-  const std::string& dataclass = collection_.dataclass;
-  const Dictionary& configuration = session_.configuration();
-  const int64_t min = record.minversion.value_or(1);
-  const int64_t max = *record.maxversion;
-  const int64_t count = max - min + 1;
-  if (!options_.repair && count <= 1) return;  // the first commit was the whole truth
-  int64_t maxCount = configuration.get("compaction_max_changelogs").integer();
-  if (maxCount <= 0) maxCount = 64;
-  int64_t sizeFactor = configuration.get("compaction_size_factor").integer();
-  if (sizeFactor <= 0) sizeFactor = 4;
-  bool compact = options_.repair || count > maxCount;
-  if (!compact && count >= 8) {
-    // Bytes against the size of the data: the oldest changelog is the last
-    // whole truth that was written.
-    int64_t chain = 0, truth = 0;
-    DavTransaction listing =
-        session_.tesselSession().listCollectionAtPath(session_.schemasPath() + "/" + dataclass);
-    for (const Value& entry : listing.result().array()) {
-      const std::string& uri = entry.dictionary().get(kNBURI).string();
-      if (!uri.ends_with(".clog")) continue;
-      const int64_t size = entry.dictionary().get(kNBContentLength).integer();
-      chain += size;
-      if (uri == session_.changeLogPathForDataclass(dataclass, min)) truth = size;
-    }
-    compact = chain > sizeFactor * std::max<int64_t>(truth, 64 * 1024);
-  }
-  if (!compact) return;
+std::string DataclassSync::truthDigestText() {
+  const std::map<std::string, engine::SetAside> aside =
+      engine_.setAsideRecords(collection_.dataclass);
+  uint64_t digest = 0;
+  engine_.forEachRecord(collection_.dataclass, [&](const std::string& id, const Dictionary& r) {
+    if (!aside.count(id)) digest ^= recordDigest(id, r);
+  });
+  return format("%016llx", static_cast<unsigned long long>(digest));
+}
 
-  // The whole truth as a reset commit, without the records set aside here
-  // (they make no item anywhere); every other computer then takes it in
-  // once, and the changelogs before it go.
-  VTC_LOG_INFO("Compacting %@: %d changelogs from %d", dataclass, count, min);
+bool DataclassSync::compactionDue(const DataclassRecord& record) {
+  if (!record.maxversion) return false;  // the first commit is the whole truth
+  const std::string& dataclass = collection_.dataclass;
+  const int64_t min = record.minversion.value_or(1);
+  const int64_t count = *record.maxversion - min + 1;
+  if (count <= 1) return false;
+  // A count bounds how many changelogs a computer that was away fetches.
+  int64_t maxCount = session_.configuration().get("compaction_max_changelogs").integer();
+  if (maxCount <= 0) maxCount = 1024;
+  if (count > maxCount) return true;
+  // By bytes: once the changes after the last whole truth outweigh it, it is
+  // written again, so the history never holds much more than twice the data
+  // (or a small history) and its cost follows the changes.
+  int64_t chain = 0, truth = 0;
+  DavTransaction listing =
+      session_.tesselSession().listCollectionAtPath(session_.schemasPath() + "/" + dataclass);
+  for (const Value& entry : listing.result().array()) {
+    const std::string& uri = entry.dictionary().get(kNBURI).string();
+    if (!uri.ends_with(".clog")) continue;
+    const int64_t size = entry.dictionary().get(kNBContentLength).integer();
+    if (uri == session_.changeLogPathForDataclass(dataclass, min))
+      truth = size;
+    else
+      chain += size;
+  }
+  constexpr int64_t kSmallHistory = 64 * 1024;
+  return truth > 0 && chain > std::max(truth, kSmallHistory);
+}
+
+void DataclassSync::compact(DataclassRecord& record, Incoming& incoming) {
+  // The truth at the share's last changelog: this computer's, with what the
+  // changelogs just taken in made of each record (a slow sync's truth is
+  // theirs alone), without the records set aside here (they make no item
+  // anywhere).
+  const std::string& dataclass = collection_.dataclass;
   const std::map<std::string, engine::SetAside> aside = engine_.setAsideRecords(dataclass);
-  std::vector<SyncEngineChange> whole = engine_.records(dataclass);
+  std::vector<SyncEngineChange> whole;
+  uint64_t digest = 0;
+  auto add = [&](const std::string& id, const Dictionary& r) {
+    if (aside.count(id)) return;
+    digest ^= recordDigest(id, r);
+    whole.emplace_back(SyncEngineChange::kAdd, id, merge::recordSets(r));
+  };
+  if (!incoming.slow)
+    engine_.forEachRecord(dataclass, [&](const std::string& id, const Dictionary& r) {
+      if (!incoming.folds.count(id)) add(id, r);
+    });
+  for (const auto& [id, fold] : incoming.folds)
+    if (fold.record) add(id, *fold.record);
+  const int64_t truthIndex = *record.maxversion;
+  writeTruth(record, whole);
+  session_.setInfoForDataclass(
+      Dictionary{{"truthdigest", Value(format("%d:%016llx", truthIndex,
+                                              static_cast<unsigned long long>(digest)))}},
+      dataclass);
+  incoming.state = NetworkState{record.minversion, record.minversion};
+  incoming.stateChanged = true;
+}
+
+void DataclassSync::repair(DataclassRecord& record) {
+  const std::map<std::string, engine::SetAside> aside =
+      engine_.setAsideRecords(collection_.dataclass);
+  std::vector<SyncEngineChange> whole = engine_.records(collection_.dataclass);
   std::erase_if(whole,
                 [&](const SyncEngineChange& c) { return aside.count(c.recordIdentifier()) > 0; });
+  writeTruth(record, whole);
+  engine::StateUpdate state;
+  state.clientState = NetworkState{record.minversion, record.minversion}.toValue();
+  engine_.saveState(kNetworkClient, collection_.dataclass, state);
+  outcome_.committedIndex = record.maxversion;
+}
+
+void DataclassSync::writeTruth(DataclassRecord& record,
+                               const std::vector<SyncEngineChange>& whole) {
+  // The whole truth as a reset commit; every other computer then takes it
+  // in once (or, holding it already, goes on from it), and the changelogs
+  // before it go.
+  const std::string& dataclass = collection_.dataclass;
+  const int64_t min = record.minversion.value_or(1);
+  const int64_t max = record.maxversion.value_or(0);
+  VTC_LOG_INFO("Compacting %@: %d changelogs from %d", dataclass, max - min + 1, min);
   const int64_t index = max + 1;
   session_.relockDataclass(dataclass);
   session_.commitChanges(whole, dataclass, index, true);
@@ -683,18 +755,14 @@ void DataclassSync::compactIfLong(DataclassRecord& record) {
       session_.relockClient();
       renewBy = currentClock().now() + halfLock;
     }
-    // Not tested: a leftover old changelog is outside the record's range
-    // and never read again.
+    // A leftover old changelog is outside the record's range; the next sync
+    // that finds one removes it.
     session_.tesselSession().deleteResourceAtPath(
         session_.changeLogPathForDataclass(dataclass, old));
   }
   record.minversion = index;
   record.maxversion = index;
-  engine::StateUpdate state;
-  state.clientState = NetworkState{index, index}.toValue();
-  engine_.saveState(kNetworkClient, dataclass, state);
   outcome_.compacted = true;
-  outcome_.committedIndex = index;
 }
 
 void DataclassSync::writeFolder(const std::map<std::string, std::string>* origins,

@@ -99,13 +99,25 @@ class DataclassSync {
   void lock(bool listed);
   void lockReleasingOwnLeftovers(const std::function<void()>& lockOperation);
   void unlock();
-  Incoming fetch(bool slow, const DataclassRecord& record, const Local& local);
+  // state: what the network side has taken in.
+  Incoming fetch(bool slow, const DataclassRecord& record, const NetworkState& state,
+                 const Local& local);
+  // The digest of this computer's truth, without the records set aside:
+  // what a compaction of it writes to the share.
+  std::string truthDigestText();
   Plan decide(Local& local, Incoming& incoming, const DataclassRecord& record);
   void guardDeletes(const Local& local, const Plan& plan);
   void commit(Plan& plan, DataclassRecord& record);
   void store(Local& local, Plan& plan, const Incoming& incoming);
   void keepConflicts(const Plan& plan);
-  void compactIfLong(DataclassRecord& record);
+  // Whether the history has grown long enough to be written again whole.
+  bool compactionDue(const DataclassRecord& record);
+  // Writes the share's truth at its last changelog as a reset, with its
+  // digest in the record; incoming's state then starts from it.
+  void compact(DataclassRecord& record, Incoming& incoming);
+  // Writes this computer's whole truth as a reset (repair).
+  void repair(DataclassRecord& record);
+  void writeTruth(DataclassRecord& record, const std::vector<SyncEngineChange>& whole);
   // Sets the record right when it names a changelog below index.
   void repairLaggingRecord(int64_t index);
   // After a reset commit: every other computer takes the truth in once.

@@ -25,8 +25,8 @@ vtc::Dictionary NubiloRemoteSession::recordFromProperties(const vtc::Dictionary&
 
 std::vector<std::string> NubiloRemoteSession::dataclassRecordProperties() const {
   std::vector<std::string> names;
-  for (const char* local :
-       {"displayname", "dataclassname", "minversion", "maxversion", "status", "lastsync"})
+  for (const char* local : {"displayname", "dataclassname", "minversion", "maxversion", "status",
+                            "lastsync", "truthdigest"})
     names.push_back(_syncNamespace + local);
   names.push_back("DAV:getetag");
   return names;

@@ -200,6 +200,38 @@ TEST_F(NeverLose, ARecordNoComputerCanWriteIsSetAsideAndNamedAndTheRestGoesOn) {
   EXPECT_THAT(b.run({"status"}).out, Not(HasSubstr("set aside")));
 }
 
+// A compaction writes the whole truth again; a computer that held that
+// truth already goes on from it, and only one that did not reads it whole.
+TEST_F(NeverLose, AComputerUpToDateAtACompactionGoesOnWithoutReadingTheWholeTruth) {
+  for (int i = 0; i < 3; ++i)
+    Computer::write(a.contacts() + "/p" + std::to_string(i) + ".vcf",
+                    card("p" + std::to_string(i), "P", std::to_string(i)));
+  sync(a);
+  sync(b);
+  Computer c{"Mac C"};
+  c.join(url, ApacheShare::kUser, ApacheShare::kPassword);
+  sync(c);
+  Computer::write(c.contacts() + "/p0.vcf", card("p0", "P", "from C"));  // not sent yet
+  a.setPreference("compaction_max_changelogs", vtc::Value(2));
+  bool compacted = false;
+  for (int round = 0; round < 3; ++round) {
+    Computer::write(a.contacts() + "/p1.vcf", card("p1", "P", std::to_string(100 + round)));
+    compacted = sync(a).out.find("history compacted") != std::string::npos || compacted;
+    if (round < 2) sync(b);  // B keeps up until the last round
+  }
+  ASSERT_TRUE(compacted);
+  Computer::Result resumed = sync(b);
+  EXPECT_THAT(resumed.out, Not(HasSubstr("slow sync")));
+  EXPECT_EQ(contactsOf(b), contactsOf(a));
+  // C was behind: it reads the truth, and its edit still goes out.
+  EXPECT_THAT(sync(c).out, HasSubstr("(slow sync)"));
+  sync(a);
+  sync(b);
+  EXPECT_EQ(contactsOf(a)["p0.vcf"], card("p0", "P", "from C"));
+  EXPECT_EQ(contactsOf(a), contactsOf(b));
+  EXPECT_EQ(contactsOf(a), contactsOf(c));
+}
+
 TEST_F(NeverLose,
        EmptyingAFolderOfAnySizeIsRefusedAndADeleteConfirmedOnOneComputerTravelsAsConfirmed) {
   Computer::write(a.contacts() + "/one.vcf", card("one", "One", "1"));

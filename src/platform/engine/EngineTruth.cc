@@ -49,6 +49,14 @@ std::map<std::string, Tombstone> SqliteEngine::tombstones(const std::string& dat
   return found;
 }
 
+void SqliteEngine::forEachRecord(
+    const std::string& dataclass,
+    const std::function<void(const std::string& id, const Dictionary& record)>& visit) {
+  Statement s(db_.handle(), "SELECT id, properties FROM records WHERE dataclass = ?1");
+  s.bind(1, dataclass);
+  while (s.step()) visit(s.text(0), decode(s.blob(1)).dictionary());
+}
+
 void SqliteEngine::storeSync(const std::string& dataclass, const SyncOutcome& outcome) {
   const double now = secondsOf(currentClock().now());
   Transaction t(db_);

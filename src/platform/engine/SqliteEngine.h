@@ -46,6 +46,9 @@ class SqliteEngine final : public SyncEngine {
       const std::string& dataclass, const std::vector<std::string>& ids) override;
   std::map<std::string, Tombstone> tombstones(const std::string& dataclass,
                                               const std::vector<std::string>& ids) override;
+  void forEachRecord(
+      const std::string& dataclass,
+      const std::function<void(const std::string& id, const Dictionary& record)>& visit) override;
   void storeSync(const std::string& dataclass, const SyncOutcome& outcome) override;
   std::vector<std::string> folderTakes(const std::string& client,
                                        const std::string& dataclass) override;

@@ -196,6 +196,10 @@ class SyncEngine {
       const std::string& dataclass, const std::vector<std::string>& ids) = 0;
   virtual std::map<std::string, Tombstone> tombstones(const std::string& dataclass,
                                                       const std::vector<std::string>& ids) = 0;
+  // Every record of the truth, one at a time, without holding them all.
+  virtual void forEachRecord(
+      const std::string& dataclass,
+      const std::function<void(const std::string& id, const Dictionary& record)>& visit) = 0;
   virtual void storeSync(const std::string& dataclass, const SyncOutcome& outcome) = 0;
   virtual std::vector<std::string> folderTakes(const std::string& client,
                                                const std::string& dataclass) = 0;
