@@ -79,6 +79,11 @@ int runCommandLine(int argc, char** argv) {
                                "mqtt[s]://host[:port] of the push server (same account)");
   setupCommandLine->add_option("--ca-file", setup.caFile,
                                "The certificate (PEM) of the authority of an HTTPS server");
+  setupCommandLine->add_flag("--new", setup.newArea,
+                             "Start a new, empty sync area where none is found, without asking");
+  setupCommandLine->add_flag("--allow-insecure", setup.allowInsecure,
+                             "Send the password over plain http:// or mqtt:// (readable on the "
+                             "way)");
 
   std::string kind, folder, dataclass;
   auto* add = app.add_subcommand("add", "Sync a vdir folder of contacts or calendars");
@@ -156,10 +161,8 @@ int runCommandLine(int argc, char** argv) {
   try {
     if (*setupCommandLine) {
       if (!passwordCommand.empty()) setup.passwordCommand = passwordCommand;
-      if (!pushServer.empty()) pushServer = checkedPushServer(pushServer);
-      const int status = setupCommand(setup, output);
-      if (status == 0 && !pushServer.empty()) storePushServer(pushServer);
-      return status;
+      if (!pushServer.empty()) setup.pushServer = pushServer;
+      return setupCommand(setup, output);
     }
     if (*add)
       return addCommand(kind, folder,

@@ -70,6 +70,17 @@ std::string localTime(const std::optional<Date>& date) {
   return buf;
 }
 
+std::string timeAgo(Date then, Date now) {
+  const auto minutes = std::chrono::duration_cast<std::chrono::minutes>(now - then).count();
+  auto count = [](long long n, const char* unit) {
+    return std::to_string(n) + " " + unit + (n == 1 ? "" : "s") + " ago";
+  };
+  if (minutes < 1) return "just now";
+  if (minutes < 60) return count(minutes, "minute");
+  if (minutes < 48 * 60) return count(minutes / 60, "hour");
+  return count(minutes / (24 * 60), "day");
+}
+
 void printStatus(const StatusReport& s, std::ostream& out) {
   if (!s.setUp) {
     out << "Syncing is not set up; run `nubilosyncclient setup URL --user NAME`.\n";

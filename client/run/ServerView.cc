@@ -44,8 +44,9 @@ DataclassRecord DataclassRecord::fromRecord(const Dictionary& record) {
 }
 
 ServerView ServerView::read(NubiloRemoteSession& session) {
-  DavTransaction t = session._issuePropFindWithRetryAtPath(session.schemasPath(), kDAVOneDepth,
-                                                           session.dataclassRecordProperties());
+  DavTransaction t =
+      session._issuePropFindWithRetryAtPath(davpath::collection(session.schemasPath()),
+                                            kDAVOneDepth, session.dataclassRecordProperties());
   if (!t.isSuccessful())
     throw NubiloException(NubiloTransactionFailureException,
                           format("The dataclass records could not be read %@", t));
