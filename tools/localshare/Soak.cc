@@ -403,8 +403,6 @@ SoakReport runSoak(const SoakOptions& options) {
       ++report.setAside;
   }
   for (const auto& [uid, content] : finalEvents) final[uid] = content;
-  if (poisoned && !final.count("poisoned-good"))
-    report.problems.push_back("lost: the good card sent beside the faulty record");
   if (poisoned && report.leftOverSyncs == 0)
     report.problems.push_back("no sync named the faulty record as set aside");
   std::set<std::string> lost;
@@ -423,6 +421,8 @@ SoakReport runSoak(const SoakOptions& options) {
       lastSet[e.uid] = std::max(lastSet[e.uid], e.when);
     if (e.kind == Edit::Add) added.insert(e.uid);
   }
+  if (poisoned && !final.count("poisoned-good") && !lastDelete.count("poisoned-good"))
+    report.problems.push_back("lost: the good card sent beside the faulty record");
   auto lostHas = [&](const std::string& uid, const std::string& field, const std::string& value) {
     for (const std::string& text : lost)
       if (text.starts_with(uid + " " + field + " ") && text.find(value) != std::string::npos)
