@@ -608,14 +608,24 @@ void DataclassSync::store(Local& local, Plan& plan, const Incoming& incoming) {
     state = NetworkState{outcome_.committedIndex, incoming.record.minversion};
   if (incoming.fetched || incoming.stateChanged || outcome_.committedIndex)
     o.network.clientState = state.toValue();
-  // The files read are taken in: their states and records go with the truth.
+  // The files read are taken in: their states and records go with the
+  // truth; a file that holds its record's truth byte for byte keeps none of
+  // its own.
+  std::map<std::string_view, const std::optional<Dictionary>*> truth;
+  for (const engine::SyncOutcome::Entry& entry : o.truth) truth[entry.id] = &entry.record;
   for (const auto& [name, file] : local.folder.scan.read) {
     const ItemState& s = local.folder.scan.states.at(name);
     auto now = local.fileNow.find(s.record);
     if (now == local.fileNow.end() || !now->second) continue;
-    o.folder.items.emplace_back(name, engine::StoredItem{{s.size, s.modifiedNanoseconds,
-                                                          s.changedNanoseconds, s.inode, s.record},
-                                                         Value(*now->second)});
+    const Dictionary* held = nullptr;
+    if (auto t = truth.find(s.record); t != truth.end())
+      held = *t->second ? &**t->second : nullptr;
+    else if (auto l = local.truth.find(s.record); l != local.truth.end())
+      held = &l->second;
+    o.folder.items.emplace_back(
+        name,
+        engine::StoredItem{{s.size, s.modifiedNanoseconds, s.changedNanoseconds, s.inode, s.record},
+                           held && *held == *now->second ? Value() : Value(*now->second)});
   }
   for (const std::string& name : local.folder.scan.deleted)
     o.folder.items.emplace_back(name, std::nullopt);

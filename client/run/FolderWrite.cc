@@ -157,10 +157,11 @@ FolderWriteResult FolderWriter::write() {
       result.failures.push_back(target + ": " + strerror(errno));
       continue;
     }
+    // A file that holds its record's truth byte for byte keeps none of its own.
     update.state.items.emplace_back(
         target, engine::StoredItem{{state.size, state.modifiedNanoseconds, state.changedNanoseconds,
                                     state.inode, id},
-                                   Value(std::move(written))});
+                                   written == merged ? Value() : Value(std::move(written))});
     state.record = id;
     known[target] = state;
     if (currentFile && !inPlace) removeFile(*currentFile);

@@ -69,7 +69,13 @@ void SqliteEngine::storeSync(const std::string& dataclass, const SyncOutcome& ou
                  "INSERT OR REPLACE INTO tombstones (dataclass, id, properties, deleted, origin, "
                  "here) VALUES (?1, ?2, ?3, ?4, ?5, ?6)");
   Statement forget(db_.handle(), "DELETE FROM tombstones WHERE dataclass = ?1 AND id = ?2");
+  // Items that hold a record's truth keep it, as their own, before it changes.
+  Statement keepAside(db_.handle(),
+                      "UPDATE item_states SET detail = COALESCE((SELECT properties FROM records "
+                      "r WHERE r.dataclass = ?1 AND r.id = ?2), detail) WHERE dataclass = ?1 AND "
+                      "record = ?2 AND length(detail) = 0");
   for (const SyncOutcome::Entry& entry : outcome.truth) {
+    keepAside.bind(1, dataclass).bind(2, entry.id).run();
     if (entry.record) {
       write.bind(1, dataclass).bind(2, entry.id).bind(3, encode(Value(*entry.record))).run();
       forget.bind(1, dataclass).bind(2, entry.id).run();

@@ -35,7 +35,11 @@ Statement& Statement::bind(int index, double number) {
 }
 
 Statement& Statement::bind(int index, const Bytes& blob) {
-  sqlite3_bind_blob(stmt_, index, blob.data(), static_cast<int>(blob.size()), SQLITE_TRANSIENT);
+  // An empty blob is a blob, not NULL (an empty vector has no data pointer).
+  if (blob.empty())
+    sqlite3_bind_zeroblob(stmt_, index, 0);
+  else
+    sqlite3_bind_blob(stmt_, index, blob.data(), static_cast<int>(blob.size()), SQLITE_TRANSIENT);
   return *this;
 }
 

@@ -55,7 +55,8 @@ const char* const kMigrations[] = {
                                   record TEXT NOT NULL, PRIMARY KEY (client, dataclass, record));
        CREATE TABLE set_aside (dataclass TEXT NOT NULL, record TEXT NOT NULL, file TEXT NOT NULL,
                                reason TEXT NOT NULL, origin TEXT NOT NULL, date REAL NOT NULL,
-                               PRIMARY KEY (dataclass, record));)",
+                               PRIMARY KEY (dataclass, record));
+       CREATE INDEX item_states_by_record ON item_states (dataclass, record);)",
 };
 
 double seconds(Date d) {
@@ -295,12 +296,15 @@ std::map<std::string, ItemStamp> SqliteEngine::itemStamps(const std::string& cli
 std::map<std::string, Value> SqliteEngine::itemDetails(const std::string& client,
                                                        const std::string& dataclass,
                                                        const std::vector<std::string>& items) {
+  // An empty detail is the record's truth.
   Statement s(db_.handle(),
-              "SELECT detail FROM item_states WHERE client = ?1 AND dataclass = ?2 AND item = ?3");
+              "SELECT CASE WHEN length(s.detail) > 0 THEN s.detail ELSE r.properties END "
+              "FROM item_states s LEFT JOIN records r ON r.dataclass = s.dataclass AND "
+              "r.id = s.record WHERE s.client = ?1 AND s.dataclass = ?2 AND s.item = ?3");
   std::map<std::string, Value> details;
   for (const std::string& item : items) {
     s.bind(1, client).bind(2, dataclass).bind(3, item);
-    if (s.step()) details.emplace(item, decode(s.blob(0)));
+    if (s.step() && !s.isNull(0)) details.emplace(item, decode(s.blob(0)));
     s.reset();
   }
   return details;
@@ -331,7 +335,8 @@ void SqliteEngine::writeState(const std::string& client, const std::string& data
     if (stored) {
       put.bind(1, client).bind(2, dataclass).bind(3, item).bind(4, stored->stamp.size);
       put.bind(5, stored->stamp.modified).bind(6, stored->stamp.changed);
-      put.bind(7, static_cast<int64_t>(stored->stamp.inode)).bind(8, encode(stored->detail));
+      put.bind(7, static_cast<int64_t>(stored->stamp.inode));
+      put.bind(8, stored->detail.isNone() ? Bytes{} : encode(stored->detail));
       put.bind(9, stored->stamp.record).run();
     } else {
       drop.bind(1, client).bind(2, dataclass).bind(3, item).run();

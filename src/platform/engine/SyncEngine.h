@@ -62,6 +62,8 @@ struct ItemStamp {
 };
 struct StoredItem {
   ItemStamp stamp;
+  // None: the item holds its record's truth, which is not stored twice
+  // (the engine keeps the truth it held aside before the truth changes).
   Value detail;
 };
 

@@ -228,6 +228,40 @@ TEST_F(Engine, StatesTravelWithPushesAndAcknowledgementsAndADryRunForgetsEveryth
   ::unsetenv("XDG_DATA_HOME");
 }
 
+// The sync client's truth: one transaction stores records, what a folder
+// must take in and its item states; an item that holds its record's truth
+// stores none of its own, and keeps the old truth when the truth changes.
+TEST_F(Engine, ASyncStoresItsTruthWholeAndAnItemKeepsTheTruthItHeld) {
+  vtc::engine::SyncOutcome first;
+  first.networkClient = "net";
+  first.folderClient = "vdir";
+  first.truth = {{"ann", Dictionary{{"FN", "Ann"}}, "Mac A", false},
+                 {"bob", Dictionary{{"FN", "Bob"}}, "Mac A", false}};
+  first.folderTakes = {"bob"};
+  first.folder.items = {{"ann.vcf", vtc::engine::StoredItem{{1, 2, 3, 4, "ann"}, Value()}}};
+  engine->storeSync("Contacts", first);
+  EXPECT_EQ(engine->folderTakes("vdir", "Contacts"), std::vector<std::string>{"bob"});
+  EXPECT_EQ(engine->itemDetails("vdir", "Contacts", {"ann.vcf"}).at("ann.vcf"),
+            Value(Dictionary{{"FN", "Ann"}}));
+
+  vtc::engine::SyncOutcome second = first;
+  second.truth = {{"ann", Dictionary{{"FN", "Ann Smith"}}, "Mac B", false},
+                  {"bob", std::nullopt, "Mac B", false}};
+  second.folderTakes = {"ann"};
+  second.folder.items.clear();
+  engine->storeSync("Contacts", second);
+  // The file still holds the truth it was written with.
+  EXPECT_EQ(engine->itemDetails("vdir", "Contacts", {"ann.vcf"}).at("ann.vcf"),
+            Value(Dictionary{{"FN", "Ann"}}));
+  EXPECT_EQ(engine->recordsWithIdentifiers("Contacts", {"ann", "bob"}).size(), 1u);
+  const auto buried = engine->tombstones("Contacts", {"bob"});
+  ASSERT_EQ(buried.count("bob"), 1u);
+  EXPECT_EQ(buried.at("bob").origin, "Mac B");
+  EXPECT_EQ(buried.at("bob").record, (Dictionary{{"FN", "Bob"}}));
+  engine->storeFolderUpdate("vdir", "Contacts", {{"ann", "bob"}, {}, {}});
+  EXPECT_TRUE(engine->folderTakes("vdir", "Contacts").empty());
+}
+
 TEST_F(Engine, ResetsBadInputAndOddChanges) {
   // A reset client gets the whole truth as adds, once.
   push("app.a", {SyncEngineChange(1, "r1", Array{set("n", Value(1))}),
