@@ -4,6 +4,7 @@
 
 #include <cstdint>
 #include <string>
+#include <vector>
 
 #include "VantorSyncManager/NubiloException.h"
 #include "VantorSyncManager/PublicNames.h"
@@ -32,5 +33,13 @@ inline constexpr uint64_t kHashSeed = 14695981039346656037ull;
 
 // "~/.local/share/NubiloSyncClient/<hash>.cflag"
 std::string crashFlagPath(uint64_t hash);
+
+// The writers' shared pieces: the "CreationTimestamp" text of now, and the
+// text of a zero-terminated field, refused (std::invalid_argument) when it
+// holds a zero byte, which would cut it short for every reader.
+std::string creationTimestamp();
+const std::string& textWithoutZero(const std::string& text, const char* what);
+// The header lines of a changelog in file order, "key=value" each.
+std::vector<std::string> headerLines(const Dictionary& headers);
 
 }  // namespace vtc::clog

@@ -13,6 +13,17 @@
 
 namespace {
 
+void putUInt32At(vtc::Bytes& out, size_t offset, uint32_t v) {
+  out[offset] = static_cast<uint8_t>(v >> 24);
+  out[offset + 1] = static_cast<uint8_t>(v >> 16);
+  out[offset + 2] = static_cast<uint8_t>(v >> 8);
+  out[offset + 3] = static_cast<uint8_t>(v);
+}
+
+}  // namespace
+
+namespace vtc::clog {
+
 std::string creationTimestamp() {
   std::time_t t = std::chrono::system_clock::to_time_t(vtc::currentClock().now());
   std::tm tm{};
@@ -22,15 +33,6 @@ std::string creationTimestamp() {
   return buf;
 }
 
-void putUInt32At(vtc::Bytes& out, size_t offset, uint32_t v) {
-  out[offset] = static_cast<uint8_t>(v >> 24);
-  out[offset + 1] = static_cast<uint8_t>(v >> 16);
-  out[offset + 2] = static_cast<uint8_t>(v >> 8);
-  out[offset + 3] = static_cast<uint8_t>(v);
-}
-
-// Text written zero-terminated: a zero inside it would end it early for every
-// reader, so it is refused.
 const std::string& textWithoutZero(const std::string& text, const char* what) {
   if (text.find('\0') != std::string::npos)
     throw std::invalid_argument(std::string("Cannot write a changelog ") + what +
@@ -38,7 +40,18 @@ const std::string& textWithoutZero(const std::string& text, const char* what) {
   return text;
 }
 
-}  // namespace
+std::vector<std::string> headerLines(const Dictionary& headers) {
+  std::vector<std::string> lines;
+  lines.reserve(headers.size());
+  for (const auto& [key, value] : headers)
+    lines.push_back(textWithoutZero(vtc::format("%@=%@", key, value), "header"));
+  return lines;
+}
+
+}  // namespace vtc::clog
+
+using vtc::clog::creationTimestamp;
+using vtc::clog::textWithoutZero;
 
 void NubiloChangeLog::writeToData(vtc::Bytes& output) {
   // The body and the header lines are made first: what every reader would
@@ -62,10 +75,7 @@ void NubiloChangeLog::writeToData(vtc::Bytes& output) {
   // Set directly: a mapped changelog refuses header changes from callers.
   if (!_headers) _headers = vtc::Dictionary{};
   _headers->set("CreationTimestamp", vtc::Value(creationTimestamp()));
-  std::vector<std::string> lines;
-  lines.reserve(_headers->size());
-  for (const auto& [key, value] : *_headers)
-    lines.push_back(textWithoutZero(vtc::format("%@=%@", key, value), "header"));
+  const std::vector<std::string> lines = vtc::clog::headerLines(*_headers);
 
   // The index is written in place: format number, header offset, one entry
   // per record, then the end marker.
