@@ -513,9 +513,17 @@ TEST_F(ChangeLog, EverythingTheWriterAcceptsIsReadBack) {
   }
   // A long text repeated many times in one record is written out each time,
   // not shared: sharing it would ask the reader for more than it allows.
-  Array repeated(400, Value(std::string(20000, 'n')));
+  Array repeated(40, Value(std::string(20000, 'n')));
   NubiloChangeLog log(std::vector<SyncEngineChange>{SyncEngineChange(2, "notes", repeated)});
   EXPECT_EQ(NubiloChangeLog(written(log)).changes().at(0).changes(), repeated);
+  // Ten times as much inflates beyond what readers take from so few bytes.
+  NubiloChangeLog bomb(std::vector<SyncEngineChange>{
+      SyncEngineChange(2, "notes", Array(400, Value(std::string(20000, 'n'))))});
+  Bytes untouched{1, 2, 3};
+  EXPECT_THAT([&] { bomb.writeToData(untouched); },
+              testing::ThrowsMessage<std::invalid_argument>(
+                  testing::HasSubstr("readers refuse more than 256 times a changelog's size")));
+  EXPECT_EQ(untouched, (Bytes{1, 2, 3}));
 }
 
 }  // namespace
