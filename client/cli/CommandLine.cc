@@ -198,6 +198,10 @@ int runCommandLine(int argc, char** argv) {
   } catch (const NubiloException& e) {
     std::cerr << "nubilosyncclient: " << e.reason() << "\n";
     return static_cast<int>(FailureKind::Other);
+  } catch (const std::bad_alloc&) {
+    std::cerr << "nubilosyncclient: this computer could not give the command the memory it "
+                 "needed; nothing more was done.\n";
+    return static_cast<int>(FailureKind::Other);
   } catch (const std::exception& e) {
     std::cerr << "nubilosyncclient: " << e.what() << "\n";
     return static_cast<int>(FailureKind::Other);

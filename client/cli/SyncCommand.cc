@@ -70,6 +70,8 @@ int syncCommand(RunRequest request, Output& output) {
   }
   RunResult result = runSync(request);
   progress.reset();
+  for (const std::string& warning : result.warnings)
+    output.err << "nubilosyncclient: warning: " << warning << "\n";
   const bool perDataclass = output.verbosity > 1 || (output.terminal && output.verbosity > 0);
   for (const DataclassOutcome& outcome : result.outcomes) {
     bool failed = false;

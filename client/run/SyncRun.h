@@ -29,6 +29,9 @@ struct DataclassFailure {
 struct RunResult {
   std::vector<DataclassOutcome> outcomes;
   std::vector<DataclassFailure> failures;
+  // Sentences the user is told whatever the outcome (a password that went
+  // unencrypted over the network).
+  std::vector<std::string> warnings;
   // 0, or the exit status of the first failure.
   int exitStatus() const;
 };
