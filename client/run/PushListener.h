@@ -26,6 +26,7 @@
 #include <vector>
 
 #include "VantorSyncManager/Value.h"
+#include "common/SecretMemory.h"
 #include "platform/push/PushRegistry.h"
 
 namespace vtc::client {
@@ -41,6 +42,7 @@ class PushListener {
 
   // Raises SyncFailure when no account or no push server is set up.
   explicit PushListener(Options options);
+  ~PushListener();
   // Runs until stop becomes true; waits for a command still running.
   void run(const std::atomic<bool>& stop);
 
@@ -53,6 +55,7 @@ class PushListener {
 
   Options options_;
   std::string member_, password_, guid_;
+  std::optional<SecretHold> hold_;  // while the password is held
   std::vector<push::Launchable> launchables_;
   std::vector<std::string> subscribed_;
   std::optional<int64_t> registrationsStamp_;
