@@ -4,6 +4,7 @@
 
 #include "client/cli/Commands.h"
 #include "client/cli/StatusText.h"
+#include "client/cli/TerminalText.h"
 #include "client/run/Collections.h"
 #include "client/run/ConflictStore.h"
 #include "client/run/SyncFailure.h"
@@ -29,7 +30,7 @@ std::string shown(const Value& value) {
     }
     out += text[i];
   }
-  return out;
+  return shownSafely(out);
 }
 
 KeptConflict findOrFail(const ConflictStore& store, const std::string& id) {
@@ -75,8 +76,9 @@ int conflictsCommand(const std::string& action, const std::string& id, Output& o
     if (action == "restore") restore(c);
     store.drop(id);
     if (output.verbosity > 0)
-      output.out << (action == "restore" ? "Restored " : "Dropped ") << c.field << " of "
-                 << c.record << (action == "restore" ? "; the next sync sends it." : ".") << "\n";
+      output.out << (action == "restore" ? "Restored " : "Dropped ") << shownSafely(c.field)
+                 << " of " << shownSafely(c.record)
+                 << (action == "restore" ? "; the next sync sends it." : ".") << "\n";
     return 0;
   }
   const auto conflicts = store.list();
@@ -85,9 +87,11 @@ int conflictsCommand(const std::string& action, const std::string& id, Output& o
     return 0;
   }
   for (const KeptConflict& c : conflicts)
-    output.out << c.id << "  " << c.dataclass << "  " << c.record << "  " << c.field << "\n"
-               << "    kept: " << shown(c.kept) << "  (from " << c.keptComputer << ")\n"
-               << "    lost: " << shown(c.lost) << "  (from " << c.lostComputer << ", "
+    output.out << c.id << "  " << c.dataclass << "  " << shownSafely(c.record) << "  "
+               << shownSafely(c.field) << "\n"
+               << "    kept: " << shown(c.kept) << "  (from " << shownSafely(c.keptComputer)
+               << ")\n"
+               << "    lost: " << shown(c.lost) << "  (from " << shownSafely(c.lostComputer) << ", "
                << localTime(c.date) << ")\n";
   return 0;
 }

@@ -6,6 +6,7 @@
 
 #include "client/cli/Commands.h"
 #include "client/cli/ProgressLine.h"
+#include "client/cli/TerminalText.h"
 
 namespace vtc::client {
 
@@ -81,7 +82,7 @@ int syncCommand(RunRequest request, Output& output) {
   }
   if (!perDataclass && output.verbosity > 0) output.out << summary(result, request.dryRun) << "\n";
   for (const DataclassFailure& failure : result.failures)
-    output.err << "nubilosyncclient: " << failure.sentence << "\n";
+    output.err << "nubilosyncclient: " << shownSafely(failure.sentence) << "\n";
   return result.exitStatus();
 }
 
