@@ -70,7 +70,12 @@ void PushListener::queue(const std::string& topic) {
 
 void PushListener::handle(const std::string& topic, ByteView payload) {
   const std::optional<push::PushMessage> message = push::decodePushMessage(payload);
-  const std::string from = message ? message->guid : std::string();
+  if (!message) {
+    VTC_LOG_WARNING("A message of %d bytes on %@ is no announcement of a computer; ignored",
+                    payload.size(), topic);
+    return;
+  }
+  const std::string& from = message->guid;
   if (!guid_.empty() && from == guid_) return;  // this computer's own announcement
   VTC_LOG_INFO("Push on %@ from %@", topic,
                from.empty() ? std::string("an unknown computer") : from);

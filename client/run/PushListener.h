@@ -2,7 +2,8 @@
 // login): it stays connected to the push server with this computer's own
 // persistent session, subscribed to the topics registered for launch, and
 // for a message from another computer runs the registered command
-// (nubilosyncclient --sync --dataclasses NAME).
+// (nubilosyncclient --sync --dataclasses NAME). A message that is no
+// computer's announcement is ignored.
 //
 // One command runs at a time. A push that comes alone (the one before it is
 // at least a quiet interval old) and finds nothing running starts its

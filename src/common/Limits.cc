@@ -78,13 +78,21 @@ std::string overLimitText(std::string_view what, uint64_t allowedBytes, std::str
   return format("%@ is larger than %@ %@%@)", what, byteCountText(allowedBytes), kLimitWords, key);
 }
 
-std::optional<std::string> overLimitKey(std::string_view text) {
+std::optional<OverLimit> overLimitIn(std::string_view text) {
+  constexpr std::string_view kLarger = " more than ";
   const size_t at = text.find(kLimitWords);
   if (at == std::string_view::npos) return std::nullopt;
   const size_t start = at + kLimitWords.size();
   const size_t end = text.find(')', start);
   if (end == std::string_view::npos) return std::nullopt;
-  return std::string(text.substr(start, end - start));
+  OverLimit found{"", std::string(text.substr(start, end - start))};
+  const std::string_view before = text.substr(0, at);
+  if (const size_t larger = before.rfind(" larger than "); larger != std::string_view::npos)
+    found.allowed = std::string(before.substr(larger + 13));
+  else if (const size_t more = before.rfind(kLarger); more != std::string_view::npos)
+    found.allowed = std::string(before.substr(more + kLarger.size()));
+  while (!found.allowed.empty() && found.allowed.back() == ' ') found.allowed.pop_back();
+  return found;
 }
 
 }  // namespace vtc

@@ -59,10 +59,14 @@ const Limits& limits();
 void setLimits(const Limits& limits);
 
 // The sentence for input over a cap: what was refused, the size allowed,
-// and the configuration key that raises it. overLimitKey finds the key in
-// such a sentence (or in any text that quotes one).
+// and the configuration key that raises it. overLimitIn finds the size and
+// the key in such a sentence, or in any text that quotes one.
 std::string overLimitText(std::string_view what, uint64_t allowedBytes, std::string_view key);
-std::optional<std::string> overLimitKey(std::string_view text);
+struct OverLimit {
+  std::string allowed;  // "16 MB", or "262144 XML elements"
+  std::string key;
+};
+std::optional<OverLimit> overLimitIn(std::string_view text);
 
 // "64 KB", "16 MB", "1.5 GB".
 std::string byteCountText(uint64_t bytes);

@@ -51,11 +51,11 @@ DavTransaction runPropfind(
     std::vector<vtc::PropfindEntry> entries = vtc::readMultistatus(*builder.root());
     onParsed(t, entries);
   } else if (t.transactionState() == vtc::kTransactionCompleted &&
-             !vtc::overLimitKey(t.errorText())) {
+             !vtc::overLimitIn(t.errorText())) {
     // An answer, but not one of WebDAV: say what came instead.
     const int status = t.httpStatusCode();
     const char* xmlError = ne_xml_failed(parser) ? ne_xml_get_error(parser) : nullptr;
-    if (xmlError && vtc::overLimitKey(xmlError))
+    if (xmlError && vtc::overLimitIn(xmlError))
       t.setErrorText(xmlError);
     else if (status / 100 == 2 && status != 207)
       t.setErrorText(vtc::format(
