@@ -22,6 +22,7 @@
 #include "platform/engine/SyncEngine.h"
 #include "platform/plist/PlistCodec.h"
 #include "platform/prefs/PreferenceStore.h"
+#include "support/LogCapture.h"
 #include "support/TestHome.h"
 
 using testing::HasSubstr;
@@ -385,6 +386,46 @@ TEST_F(ChangeLog, TruncatedRecordsAndBadIndexesAreRefusedWithTheirReason) {
     bad[7] = offset;
     EXPECT_THAT(refusal(bad), HasSubstr("inside the index")) << int{offset};
   }
+}
+
+TEST_F(ChangeLog, ARecordWhoseArchiveCannotBeDecodedIsPassedOverAndTheOthersRead) {
+  vtc::test::LogCapture logged;
+  auto record = [](Bytes& body, const std::string& identifier, const Bytes& archive) {
+    NubiloAppendString(body, identifier);
+    NubiloAppendUInt32(body, 2);
+    NubiloAppendUInt32(body, static_cast<uint32_t>(archive.size()));
+    body.insert(body.end(), archive.begin(), archive.end());
+  };
+  const Array changes{Value(setting("first", "Ann"))};
+  std::string deep = "<plist version=\"1.0\">";
+  for (int i = 0; i < 200; ++i) deep += "<array>";
+  for (int i = 0; i < 200; ++i) deep += "</array>";
+  deep += "</plist>";
+  Bytes body;
+  record(body, "first", vtc::plist::toBinary(changes));
+  record(body, "garbled", Bytes{'b', 'p', 'l', 'i', 's', 't', '0', '0', 1, 2, 3});
+  record(body, "too deep", Bytes(deep.begin(), deep.end()));
+  record(body, "no list", vtc::plist::toBinary(Value("text")));
+  record(body, "last", vtc::plist::toBinary(changes));
+  NubiloChangeLog log(changelogWithBody(5, body));
+  ASSERT_EQ(log.changes().size(), 2u);
+  EXPECT_EQ(log.changes()[1], SyncEngineChange(2, "last", changes));
+  ASSERT_EQ(log.refusedChanges().size(), 3u);
+  EXPECT_EQ(log.refusedChanges()[0].position, 1u);
+  EXPECT_EQ(log.refusedChanges()[1].recordIdentifier, "too deep");
+  EXPECT_EQ(log.refusedChanges()[1].reason,
+            "its archive is not a property list that can be read within its size");
+  EXPECT_EQ(log.refusedChanges()[2].reason, "its archive is not a list of changes");
+  EXPECT_THAT(logged.messages("Warning"),
+              testing::Contains("Record 3 (no list) of a changelog was passed over: its archive is "
+                                "not a list of changes"));
+  // The frame around the records is still whole or refused whole.
+  body.resize(body.size() - 1);
+  EXPECT_THAT(refusal(changelogWithBody(5, body)),
+              HasSubstr("record archive beyond the end of changelog data"));
+  EXPECT_TRUE(NubiloChangeLog(written(*std::make_unique<NubiloChangeLog>(sampleChanges())))
+                  .refusedChanges()
+                  .empty());
 }
 
 TEST_F(ChangeLog, TheErrorLineShowsOnlyTheHeadersReadFromTheseBytes) {
