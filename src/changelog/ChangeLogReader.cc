@@ -3,6 +3,7 @@
 // body's inflated size and the decoded records' memory are both held to a
 // budget derived from the changelog's size (common/Limits.h).
 #include <cstring>
+#include <new>
 
 #include "VantorSyncManager/NubiloChangeLog.h"
 #include "VantorSyncManager/NubiloDataAdditions.h"
@@ -125,6 +126,10 @@ void NubiloChangeLog::parseData(vtc::ByteView data) {
       body.finish();
     }
     _version = version;
+  } catch (const std::bad_alloc&) {
+    // Memory this computer could not give is no damage of the changelog.
+    clearCrashFlagForHash(hash);
+    throw;
   } catch (const std::exception& e) {
     clearCrashFlagForHash(hash);
     VTC_LOG_ERROR("Exception caught while trying to process changelog %@ \n Headers:%@",
