@@ -80,6 +80,11 @@ int runCommandLine(int argc, char** argv) {
                                "mqtt[s]://host[:port] of the push server (same account)");
   setupCommandLine->add_option("--ca-file", setup.caFile,
                                "The certificate (PEM) of the authority of an HTTPS server");
+  setupCommandLine->add_flag("--new", setup.newArea,
+                             "Start a new, empty sync area where none is found, without asking");
+  setupCommandLine->add_flag("--allow-insecure", setup.allowInsecure,
+                             "Send the password over plain http:// or mqtt:// (readable on the "
+                             "way)");
 
   std::string kind, folder, dataclass;
   auto* add = app.add_subcommand("add", "Sync a vdir folder of contacts or calendars");
@@ -97,9 +102,10 @@ int runCommandLine(int argc, char** argv) {
   auto* sync = app.add_subcommand("sync", "Sync now");
   sync->add_option("NAME", run.dataclasses, "Only these dataclasses");
   sync->add_flag("--dry-run", run.dryRun, "Say what would happen; change nothing");
-  sync->add_option("--max-delete", run.maxDeletePercent,
-                   "Refuse to delete more than this percentage of a dataclass's items")
-      ->check(CLI::Range(0, 100));
+  auto* maxDelete =
+      sync->add_option("--max-delete", run.maxDeletePercent,
+                       "Refuse to delete more than this percentage of a dataclass's items")
+          ->check(CLI::Range(0, 100));
   sync->footer("Example: nubilosyncclient sync com.korvo.Contacts --dry-run");
 
   std::string repaired;
@@ -156,17 +162,19 @@ int runCommandLine(int argc, char** argv) {
   try {
     if (*setupCommandLine) {
       if (!passwordCommand.empty()) setup.passwordCommand = passwordCommand;
-      if (!pushServer.empty()) pushServer = checkedPushServer(pushServer);
-      const int status = setupCommand(setup, output);
-      if (status == 0 && !pushServer.empty()) storePushServer(pushServer);
-      return status;
+      if (!pushServer.empty()) setup.pushServer = pushServer;
+      return setupCommand(setup, output);
     }
     if (*add)
       return addCommand(kind, folder,
                         dataclass.empty() ? std::nullopt : std::optional<std::string>(dataclass),
                         output);
     if (*remove) return removeCommand(removed, output);
-    if (*sync) return syncCommand(run, output);
+    if (*sync) {
+      // Deletes the user let through go out as confirmed.
+      run.deletesConfirmed = maxDelete->count() > 0;
+      return syncCommand(run, output);
+    }
     if (*repair) {
       RunRequest request;
       request.dataclasses = {repaired};

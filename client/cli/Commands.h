@@ -23,7 +23,10 @@ struct SetupRequest {
   std::string member;
   std::optional<std::string> passwordCommand;
   bool passwordFromStdin = false;
-  std::optional<std::string> caFile;  // an authority's certificate to trust (HTTPS)
+  std::optional<std::string> caFile;      // an authority's certificate to trust (HTTPS)
+  std::optional<std::string> pushServer;  // mqtt[s]://host[:port], stored once setup succeeds
+  bool allowInsecure = false;             // the password may cross plain http:// or mqtt://
+  bool newArea = false;  // start a new sync area where none was expected, without asking
 };
 
 int setupCommand(const SetupRequest& request, Output& output);

@@ -5,8 +5,14 @@
 #include "client/cli/Commands.h"
 #include "client/cli/StatusText.h"
 #include "client/cli/TerminalText.h"
+#include "client/items/ItemRecord.h"
+#include "client/items/Meaning.h"
+#include "client/merge/RecordMerge.h"
+#include "client/merge/Restore.h"
 #include "client/run/Collections.h"
 #include "client/run/ConflictStore.h"
+#include "client/run/DataclassSync.h"
+#include "client/run/FolderWrite.h"
 #include "client/run/SyncFailure.h"
 #include "client/stores/VdirCollection.h"
 #include "common/Format.h"
@@ -15,10 +21,11 @@ namespace vtc::client {
 
 namespace {
 
-// A field's lines on one line: folding undone, line ends dropped.
+// A unit's lines on one line: folding undone, line ends dropped.
 std::string shown(const Value& value) {
-  if (value.isNone()) return "(cleared)";
-  std::string text = textOf(value), out;
+  if (value.isNone()) return "(removed)";
+  if (value.isDictionary()) return "(the whole item as it was here)";
+  std::string text(rawOf(value)), out;
   for (size_t i = 0; i < text.size(); ++i) {
     if (text[i] == '\r') continue;
     if (text[i] == '\n') {
@@ -33,6 +40,18 @@ std::string shown(const Value& value) {
   return shownSafely(out);
 }
 
+// What the conflict is about: a property, an occurrence, or the item.
+std::string subject(const KeptConflict& c) {
+  if (c.field == merge::kRecordField) return "the item";
+  if (nameOf(c.field) == merge::kComponentName) {
+    const std::string_view scope = scopeOf(c.field);
+    const size_t first = scope.find('/'), second = scope.find('/', first + 1);
+    const std::string_view rid = scope.substr(first + 1, second - first - 1);
+    return rid.empty() ? "the series" : "the occurrence of " + std::string(rid);
+  }
+  return std::string(nameOf(c.field));
+}
+
 KeptConflict findOrFail(const ConflictStore& store, const std::string& id) {
   auto conflict = store.find(id);
   if (!conflict)
@@ -41,30 +60,47 @@ KeptConflict findOrFail(const ConflictStore& store, const std::string& id) {
   return *conflict;
 }
 
-// The losing value written into the item's file, as if edited there: the
-// next sync sends it as an ordinary edit.
+// The losing side written into the item's file (or the file made again,
+// or removed, for a delete that lost), as if edited there: the next sync
+// sends it as an ordinary edit.
 void restore(const KeptConflict& c) {
   auto collection = configuredCollection(c.dataclass);
   if (!collection)
     throw SyncFailure(FailureKind::Usage, c.dataclass + " is no longer synced on this computer.");
   VdirCollection folder(collection->folder, collection->kind);
-  auto state = folder.stat(c.record);
-  auto current = folder.read(c.record);
-  if (!state || !current)
-    throw SyncFailure(FailureKind::Other, c.record + " is no longer in " + collection->folder +
-                                              "; the losing value has nothing to go back into.");
-  if (c.field == "(record)") {  // the delete lost: restoring it deletes the item again
-    if (folder.remove(c.record, *state) != WriteOutcome::Removed)
-      throw SyncFailure(FailureKind::Other,
-                        c.record + " changed while it was being restored; try again.");
-    return;
+  // The file that holds the record now: it may have been renamed since.
+  std::string file = c.file;
+  {
+    auto engine = engine::SyncEngine::open();
+    for (const auto& [name, stamp] : engine->itemStamps(folderClient(c.dataclass), c.dataclass))
+      if (stamp.record == c.record) file = name;
   }
-  Dictionary change{{"action", c.lost.isNone() ? "clear" : "set"}, {"name", c.field}};
-  if (!c.lost.isNone()) change.set("value", c.lost);
-  const std::string bytes = applyFieldChanges(collection->kind, current, Array{Value(change)});
-  if (folder.write(c.record, bytes, state, nullptr) != WriteOutcome::Written)
+  std::optional<ItemState> state =
+      isAcceptableFileName(file, collection->kind) ? folder.stat(file) : std::nullopt;
+  if (!isAcceptableFileName(file, collection->kind)) file = fileNameFor(c.record, collection->kind);
+  std::optional<std::string> bytes = state ? folder.read(file) : std::nullopt;
+  std::optional<Dictionary> current;
+  if (bytes) current = recordOfBytes(collection->kind, *bytes, file, &c.item);
+  if (bytes && !current)
     throw SyncFailure(FailureKind::Other,
-                      c.record + " changed while it was being restored; try again.");
+                      file + " is not a valid item now; fix it first, then restore.");
+  std::optional<Dictionary> restored =
+      merge::restoredRecord(collection->kind, current, c.field, c.lost, c.item);
+  WriteOutcome outcome = WriteOutcome::Removed;
+  if (!restored) {
+    if (state) outcome = folder.remove(file, *state);
+  } else {
+    std::string problem;
+    std::optional<std::string> out =
+        renderRecord(*restored, current ? &*current : nullptr, &problem);
+    if (!out)
+      throw SyncFailure(FailureKind::Other, "The losing value cannot be written back: " + problem);
+    outcome = folder.write(file, *out, state, nullptr);
+    if (outcome == WriteOutcome::Written) outcome = WriteOutcome::Removed;
+  }
+  if (outcome != WriteOutcome::Removed)
+    throw SyncFailure(FailureKind::Other,
+                      file + " changed while it was being restored; try again.");
 }
 
 }  // namespace
@@ -76,8 +112,9 @@ int conflictsCommand(const std::string& action, const std::string& id, Output& o
     if (action == "restore") restore(c);
     store.drop(id);
     if (output.verbosity > 0)
-      output.out << (action == "restore" ? "Restored " : "Dropped ") << shownSafely(c.field)
-                 << " of " << shownSafely(c.record)
+      output.out << (action == "restore" ? "Restored " : "Dropped ") << shownSafely(subject(c))
+                 << " of " << shownSafely(c.file)
+                 << (c.name.empty() || c.name == c.file ? "" : " (" + shownSafely(c.name) + ")")
                  << (action == "restore" ? "; the next sync sends it." : ".") << "\n";
     return 0;
   }
@@ -86,13 +123,21 @@ int conflictsCommand(const std::string& action, const std::string& id, Output& o
     if (output.verbosity > 0) output.out << "No conflicts are kept.\n";
     return 0;
   }
-  for (const KeptConflict& c : conflicts)
-    output.out << c.id << "  " << c.dataclass << "  " << shownSafely(c.record) << "  "
-               << shownSafely(c.field) << "\n"
-               << "    kept: " << shown(c.kept) << "  (from " << shownSafely(c.keptComputer)
-               << ")\n"
-               << "    lost: " << shown(c.lost) << "  (from " << shownSafely(c.lostComputer) << ", "
-               << localTime(c.date) << ")\n";
+  for (const KeptConflict& c : conflicts) {
+    output.out << c.id << "  " << c.dataclass << "  " << shownSafely(c.file) << "  "
+               << shownSafely(subject(c))
+               << (c.name.empty() || c.name == c.file ? "" : "  (" + shownSafely(c.name) + ")")
+               << "\n";
+    if (c.field == merge::kRecordField && c.lost.isNone())
+      output.out << "    deleted here, and kept because " << shownSafely(c.keptComputer)
+                 << " edited it; `nubilosyncclient conflicts restore " << c.id
+                 << "` deletes it again\n";
+    else
+      output.out << "    kept: " << shown(c.kept) << "  (from " << shownSafely(c.keptComputer)
+                 << ")\n"
+                 << "    lost: " << shown(c.lost) << "  (from " << shownSafely(c.lostComputer)
+                 << ", " << localTime(c.date) << ")\n";
+  }
   return 0;
 }
 

@@ -1,7 +1,10 @@
-// `setup URL --user NAME`: checks the login and the share at once, then
-// stores the account and turns syncing on.
+// `setup URL --user NAME`: checks the share and says what it found there
+// before it changes anything; only once every check has passed and the
+// password is stored does it make the sync area, register this computer
+// and store the account.
 #include <unistd.h>
 
+#include <algorithm>
 #include <filesystem>
 #include <iostream>
 #include <ostream>
@@ -11,13 +14,17 @@
 #include "VantorSyncManager/PublicNames.h"
 #include "VantorSyncManager/VTCPrefsCenter.h"
 #include "client/cli/Commands.h"
+#include "client/cli/StatusText.h"
 #include "client/cli/Terminal.h"
 #include "client/run/Account.h"
+#include "client/run/Automation.h"
 #include "client/run/ServerQualification.h"
+#include "client/run/SyncAreaFinding.h"
 #include "client/run/SyncFailure.h"
 #include "common/Clock.h"
 #include "common/Format.h"
 #include "common/Uuid.h"
+#include "platform/dav/DavPaths.h"
 #include "platform/dav/TesselSession.h"
 #include "prefs/ClientConfiguration.h"
 
@@ -29,6 +36,69 @@ std::string hostName() {
   char name[256] = {};
   if (::gethostname(name, sizeof name - 1) != 0 || !name[0]) return "Linux computer";
   return name;
+}
+
+// A password over plain http:// or mqtt:// only when the user says so, and
+// then with a warning each time. True when it was allowed.
+bool allowPlainPassword(const SetupRequest& request, const ServerAddress& server,
+                        const std::optional<std::string>& push, Output& output) {
+  std::string plain;
+  if (server.plain()) plain = server.origin();
+  if (push && push->starts_with("mqtt://")) plain += (plain.empty() ? "" : " and ") + *push;
+  if (plain.empty()) return false;
+  if (!request.allowInsecure)
+    throw SyncFailure(FailureKind::Usage,
+                      "Setup does not send a password over a plain connection (" + plain +
+                          "): anyone on the way could read it. Use https:// (and mqtts://), or "
+                          "say --allow-insecure to send it in the clear all the same.");
+  output.err << "nubilosyncclient: warning: the password for " << request.member << " will cross "
+             << plain << " in the clear (--allow-insecure); anyone on the network between can "
+             << "read it.\n";
+  return true;
+}
+
+std::string readSetupPassword(const SetupRequest& request, const ServerAddress& server) {
+  if (request.passwordCommand) return passwordFromCommand(*request.passwordCommand);
+  if (request.passwordFromStdin) {
+    std::string line;
+    if (std::getline(std::cin, line) && !line.empty() && line.back() == '\r') line.pop_back();
+    if (line.empty()) throw SyncFailure(FailureKind::Usage, "No password came on standard input.");
+    return line;
+  }
+  auto typed = readPassword("Password for " + request.member + " at " + server.url() + ": ");
+  if (!typed || typed->empty()) throw SyncFailure(FailureKind::Usage, "No password was given.");
+  return *typed;
+}
+
+// "Mac A, Mac B"
+std::string names(const std::vector<AreaComputer>& computers) {
+  std::string out;
+  for (const AreaComputer& c : computers) out += (out.empty() ? "" : ", ") + c.name;
+  return out;
+}
+
+// What setup found, in one sentence, before it changes anything. area and
+// beside are addresses.
+std::string findingSentence(const SyncAreaFinding& found, const std::string& member,
+                            const std::string& area, const std::string& beside) {
+  if (!found.startsNewArea()) {
+    std::string s = "This computer joins the account of " + member + " on " + area;
+    const size_t n = found.others.size();
+    if (n == 0) return s + ", which no other computer uses yet.";
+    s += ", used by " + std::to_string(n) + " other computer" + (n == 1 ? "" : "s") + " (" +
+         names(found.others) + ")";
+    std::optional<Date> last;
+    for (const AreaComputer& c : found.others)
+      if (c.lastSync && (!last || *c.lastSync > *last)) last = c.lastSync;
+    if (!last)
+      return s + (n == 1 ? ", which has not synced yet." : ", none of which has synced yet.");
+    return s + ", last sync " + timeAgo(*last, currentClock().now()) + ".";
+  }
+  std::string why = "no sync area was found there";
+  if (found.kind == SyncAreaFinding::Kind::OtherFolder)
+    why = "the folder holds other files and no sync area";
+  if (found.areaBeside) why += "; the share has one at " + beside;
+  return "This computer starts a new, empty sync area at " + area + " (" + why + ").";
 }
 
 // This computer on the account: its client record, which must come back
@@ -49,33 +119,13 @@ Dictionary registerComputer(NubiloRemoteSession& session, const std::string& gui
   return record;
 }
 
-}  // namespace
-
-int setupCommand(const SetupRequest& request, Output& output) {
-  const ServerAddress server = ServerAddress::parse(request.url);
-  if (request.member.empty())
-    throw SyncFailure(FailureKind::Usage, "Give the member name with --user NAME.");
-  std::string password;
-  if (request.passwordCommand) {
-    password = passwordFromCommand(*request.passwordCommand);
-  } else if (request.passwordFromStdin) {
-    std::string line;
-    if (std::getline(std::cin, line) && !line.empty() && line.back() == '\r') line.pop_back();
-    if (line.empty()) throw SyncFailure(FailureKind::Usage, "No password came on standard input.");
-    password = line;
-  } else {
-    auto typed = readPassword("Password for " + request.member + " at " + server.url() + ": ");
-    if (!typed || typed->empty()) throw SyncFailure(FailureKind::Usage, "No password was given.");
-    password = *typed;
-  }
-
-  VTCPrefsCenter& prefs = VTCPrefsCenter::defaultCenter();
-  // A computer set up before keeps its identity on the account.
-  const std::string guid = prefs.clientGuid().value_or(makeUUIDString());
-  const std::string name = prefs.clientName().value_or(hostName());
+// The configuration of setup's sessions: the built-in defaults, the
+// address, the authority to trust (kept in caFile) and this computer.
+Dictionary setupConfiguration(const SetupRequest& request, const ServerAddress& server,
+                              const std::string& guid, const std::string& name, bool allowInsecure,
+                              std::optional<std::string>& caFile) {
   Dictionary configuration = config::builtInDefaults(guid, request.member);
   configuration.merge(server.configurationKeys());
-  std::optional<std::string> caFile;
   if (request.caFile) {
     std::error_code error;
     const std::filesystem::path path = std::filesystem::absolute(*request.caFile, error);
@@ -87,7 +137,54 @@ int setupCommand(const SetupRequest& request, Output& output) {
   }
   configuration.set("ClientGuid", Value(guid));
   configuration.set("ClientName", Value(name));
+  if (allowInsecure) configuration.set(kAllowInsecureKey, Value(true));
+  return configuration;
+}
+
+// Says what setup found; a new area where none was expected goes on only
+// when the user says so: --new, or yes at a terminal.
+void sayWhatWasFound(const SetupRequest& request, const SyncAreaFinding& found,
+                     const ServerAddress& server, const NubiloRemoteSession& session,
+                     Output& output) {
+  const std::string area = server.origin() + session.syncPath();
+  const std::string beside =
+      found.areaBeside ? server.origin() + server.shareRoot + *found.areaBeside : std::string();
+  if (output.verbosity > 0)
+    output.out << findingSentence(found, request.member, area, beside) << "\n" << std::flush;
+  if (!found.unexpected() || request.newArea) return;
+  const bool terminal = !request.passwordFromStdin && ::isatty(STDIN_FILENO);
+  if (terminal && confirm("Start a new, empty sync area at " + area + "? [y/N] ")) return;
+  throw SyncFailure(
+      FailureKind::Usage,
+      "There is no sync area at " + area +
+          (found.areaBeside ? " (the share has one at " + beside + ")" : std::string()) +
+          "; check the address, or say --new to start a new, empty one there.");
+}
+
+}  // namespace
+
+int setupCommand(const SetupRequest& request, Output& output) {
+  const ServerAddress server = ServerAddress::parse(request.url);
+  if (request.member.empty())
+    throw SyncFailure(FailureKind::Usage, "Give the member name with --user NAME.");
+  std::optional<std::string> push;
+  if (request.pushServer) push = checkedPushServer(*request.pushServer);
+  const bool allowInsecure = allowPlainPassword(request, server, push, output);
+  const std::string password = readSetupPassword(request, server);
+
+  VTCPrefsCenter& prefs = VTCPrefsCenter::defaultCenter();
+  // A computer set up before keeps its identity on the account.
+  const std::string guid = prefs.clientGuid().value_or(makeUUIDString());
+  const std::string name = prefs.clientName().value_or(hostName());
+  std::optional<std::string> caFile;
+  Dictionary configuration = setupConfiguration(request, server, guid, name, allowInsecure, caFile);
+
+  // Looking only: nothing on the share changes until every check passed.
+  checkShareRoot(request.member, password, configuration);
+  configuration.set("create_sync_paths", Value(false));
   auto session = openSession(request.member, password, configuration);
+  const SyncAreaFinding found = findSyncArea(*session, guid);
+  sayWhatWasFound(request, found, server, *session, output);
   // The second client of the checks: another computer as far as the share
   // can tell.
   Dictionary otherConfiguration = configuration;
@@ -95,9 +192,27 @@ int setupCommand(const SetupRequest& request, Output& output) {
   otherConfiguration.set("guid", Value(otherGuid));
   otherConfiguration.set("ClientGuid", Value(otherGuid));
   otherConfiguration.set("ClientName", Value(name + " (setup check)"));
+  // The probes go where the sync will write: the area, or before there is
+  // one, the share's root.
+  const std::string folder = found.kind == SyncAreaFinding::Kind::Missing
+                                 ? davpath::collection(session->shareRoot())
+                                 : session->syncPath();
   qualifyServer(
-      *session, [&] { return openSession(request.member, password, otherConfiguration); },
+      *session, [&] { return openSession(request.member, password, otherConfiguration); }, folder,
       server.url());
+
+  // Later sessions trust this certificate alone: one that changes is refused.
+  AccountSetup setup{server,
+                     request.member,
+                     request.passwordCommand,
+                     caFile,
+                     session->tesselSession().serverCertificateDigest(),
+                     allowInsecure};
+  storePassword(setup, password);
+
+  // Every check passed and the password is kept: the share changes now.
+  configuration.erase("create_sync_paths");
+  session = openSession(request.member, password, configuration);
   const Dictionary registered = registerComputer(*session, guid, name, server.url());
   // For the other computers' status: since when this one syncs, and which
   // report on the share is its own.
@@ -106,11 +221,8 @@ int setupCommand(const SetupRequest& request, Output& output) {
     record.set("firstsync", Value(textOf(Value(currentClock().now()))));
   if (auto machine = getHostUUIDString()) record.set("machineguid", Value(*machine));
   session->patchClientInfo(record);
-
-  // Later sessions trust this certificate alone: one that changes is refused.
-  AccountSetup setup{server, request.member, request.passwordCommand, caFile,
-                     session->tesselSession().serverCertificateDigest()};
-  storeAccount(setup, password, guid, name);
+  storeAccount(setup, guid, name);
+  if (push) storePushServer(*push);
   if (output.verbosity > 0)
     output.out << "Set up " << request.member << " at " << server.url() << " for this computer, "
                << name << ".\nAdd a folder with `nubilosyncclient add contacts FOLDER` or "

@@ -6,6 +6,7 @@
 #include <ostream>
 
 #include "client/cli/TerminalText.h"
+#include "client/items/ItemRecord.h"
 #include "common/Format.h"
 
 namespace vtc::client {
@@ -70,6 +71,17 @@ std::string localTime(const std::optional<Date>& date) {
   return buf;
 }
 
+std::string timeAgo(Date then, Date now) {
+  const auto minutes = std::chrono::duration_cast<std::chrono::minutes>(now - then).count();
+  auto count = [](long long n, const char* unit) {
+    return std::to_string(n) + " " + unit + (n == 1 ? "" : "s") + " ago";
+  };
+  if (minutes < 1) return "just now";
+  if (minutes < 60) return count(minutes, "minute");
+  if (minutes < 48 * 60) return count(minutes / 60, "hour");
+  return count(minutes / (24 * 60), "day");
+}
+
 void printStatus(const StatusReport& s, std::ostream& out) {
   if (!s.setUp) {
     out << "Syncing is not set up; run `nubilosyncclient setup URL --user NAME`.\n";
@@ -99,6 +111,7 @@ void printStatus(const StatusReport& s, std::ostream& out) {
           << "\n";
     else if (!s.serverError)
       out << "  on the share: nothing yet\n";
+    for (const std::string& line : d.leftOver) out << "  " << shownSafely(line) << "\n";
     if (d.serverStatus == std::optional<std::string>("needstruth"))
       out << "  this computer takes in the whole truth at its next sync (needstruth)\n";
   }
@@ -136,6 +149,7 @@ std::string statusAsJson(const StatusReport& s) {
                                   {"lastSuccess", optionalDate(d.lastSuccess)},
                                   {"failedCount", d.failedCount},
                                   {"lastError", optional(d.lastError)},
+                                  {"leftOver", d.leftOver},
                                   {"share",
                                    {{"minversion", optional(d.minversion)},
                                     {"maxversion", optional(d.maxversion)},
@@ -155,7 +169,10 @@ std::string statusAsJson(const StatusReport& s) {
     doc["conflicts"].push_back({{"id", c.id},
                                 {"dataclass", c.dataclass},
                                 {"record", c.record},
-                                {"field", c.field},
+                                {"file", c.file},
+                                {"name", c.name},
+                                {"field", std::string(nameOf(c.field))},
+                                {"key", c.field},
                                 {"kept", jsonOf(c.kept)},
                                 {"lost", jsonOf(c.lost)},
                                 {"keptComputer", c.keptComputer},

@@ -16,4 +16,8 @@ std::string statusAsJson(const StatusReport& status);
 // A date in local time, "2026-11-22 22:14:03", or "never".
 std::string localTime(const std::optional<Date>& date);
 
+// How long before now a date was, in words: "just now", "1 minute ago",
+// "2 hours ago", "3 days ago".
+std::string timeAgo(Date then, Date now);
+
 }  // namespace vtc::client

@@ -31,8 +31,15 @@ std::string describe(const DataclassOutcome& o, bool dryRun) {
   if (o.conflicts) line += ", kept " + counted(o.conflicts, "conflict", "conflicts");
   if (o.filesSkipped)
     line += ", " + counted(o.filesSkipped, "file", "files") + " changed meanwhile (next sync)";
-  if (o.invalidFiles)
-    line += ", " + counted(o.invalidFiles, "invalid file", "invalid files") + " skipped";
+  if (!o.invalidFiles.empty())
+    line += ", " + counted(o.invalidFiles.size(), "invalid file", "invalid files") + " skipped";
+  if (!o.setAside.empty())
+    line += ", " + counted(o.setAside.size(), "item", "items") + " set aside";
+  if (o.deletesUndone)
+    line += ", " + counted(o.deletesUndone, "delete", "deletes") + " undone by edits elsewhere";
+  if (o.confirmedDeletes)
+    line +=
+        ", " + counted(o.confirmedDeletes, "delete", "deletes") + " confirmed on another computer";
   if (o.compacted) line += ", history compacted";
   return line;
 }
@@ -81,6 +88,18 @@ int syncCommand(RunRequest request, Output& output) {
     if (!failed && perDataclass) output.out << describe(outcome, request.dryRun) << "\n";
   }
   if (!perDataclass && output.verbosity > 0) output.out << summary(result, request.dryRun) << "\n";
+  // What was left over is named every time, until the user has seen to it.
+  for (const DataclassOutcome& o : result.outcomes) {
+    for (const auto& [file, why] : o.invalidFiles)
+      output.err << "nubilosyncclient: " << o.dataclass << ": skipped " << file << ": " << why
+                 << "\n";
+    for (const SetAsideItem& item : o.setAside)
+      output.err << "nubilosyncclient: " << o.dataclass << ": set aside " << item.file
+                 << (item.origin.empty() ? "" : " (from " + item.origin + ")") << ": "
+                 << item.reason << "\n";
+    for (const std::string& failure : o.writeFailures)
+      output.err << "nubilosyncclient: " << o.dataclass << ": could not write " << failure << "\n";
+  }
   for (const DataclassFailure& failure : result.failures)
     output.err << "nubilosyncclient: " << shownSafely(failure.sentence) << "\n";
   return result.exitStatus();

@@ -30,4 +30,11 @@ std::optional<std::string> readPassword(const std::string& prompt) {
   return line;
 }
 
+bool confirm(const std::string& question) {
+  std::fprintf(stderr, "%s", question.c_str());
+  std::fflush(stderr);
+  std::string line;
+  return std::getline(std::cin, line) && !line.empty() && (line[0] == 'y' || line[0] == 'Y');
+}
+
 }  // namespace vtc::client

@@ -1,5 +1,6 @@
 // Reading a password: from the terminal without echo, or the first line of
-// standard input when it is not a terminal.
+// standard input when it is not a terminal; and asking a yes-or-no question
+// at a terminal.
 #pragma once
 
 #include <optional>
@@ -10,5 +11,9 @@ namespace vtc::client {
 // Prompts on standard error when standard input is a terminal. None when
 // nothing could be read.
 std::optional<std::string> readPassword(const std::string& prompt);
+
+// Asks on standard error and reads the answer from standard input (a
+// terminal): true for an answer that begins with "y" or "Y".
+bool confirm(const std::string& question);
 
 }  // namespace vtc::client

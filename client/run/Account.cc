@@ -44,18 +44,27 @@ ServerAddress ServerAddress::parse(const std::string& url) {
     throw SyncFailure(FailureKind::Usage,
                       "The port in \"" + url + "\" is not between 1 and 65535.");
   std::string path = m[4].matched ? std::string(m[4]) : std::string();
-  while (path.size() > 1 && path.back() == '/') path.pop_back();
-  if (path != "/") a.syncPath = path;
+  while (!path.empty() && path.back() == '/') path.pop_back();
+  const size_t last = path.rfind('/');
+  if (last != std::string::npos) {
+    a.shareRoot = path.substr(0, last);
+    a.syncPath = path.substr(last);
+  }
   return a;
 }
 
-std::string ServerAddress::url() const {
+std::string ServerAddress::origin() const {
   const bool usual = (scheme == "https" && port == 443) || (scheme == "http" && port == 80);
-  return scheme + "://" + host + (usual ? "" : ":" + std::to_string(port)) + syncPath;
+  return scheme + "://" + host + (usual ? "" : ":" + std::to_string(port));
+}
+
+std::string ServerAddress::url() const {
+  return origin() + shareRoot + syncPath;
 }
 
 Dictionary ServerAddress::configurationKeys() const {
   Dictionary keys{{"host_scheme", scheme}, {"host_name", host}, {"host_port", port}};
+  if (!shareRoot.empty()) keys.set("share_root", Value(shareRoot));
   if (!syncPath.empty()) keys.set("sync_path", Value(syncPath));
   return keys;
 }
@@ -65,6 +74,8 @@ ServerAddress ServerAddress::fromConfiguration(const Dictionary& configuration) 
   a.scheme = configuration.get("host_scheme").string();
   a.host = configuration.get("host_name").string();
   a.port = static_cast<int32_t>(configuration.get("host_port").integer());
+  a.shareRoot = configuration.get("share_root").string();
+  while (!a.shareRoot.empty() && a.shareRoot.back() == '/') a.shareRoot.pop_back();
   a.syncPath = configuration.get("sync_path").string();
   return a;
 }
@@ -123,14 +134,30 @@ SyncFailure certificateFailure(CertificateRefusal refusal, const ServerAddress& 
                          "name or badly chained; the server's certificate needs fixing.");
 }
 
+// "scheme://host:port", as failures name the server.
+std::string serverOf(const Dictionary& configuration) {
+  return configuration.get("host_scheme").string() + "://" +
+         configuration.get("host_name").string() + ":" +
+         std::to_string(configuration.get("host_port").integer());
+}
+
+SyncFailure passwordRefused(const std::string& where, const std::string& member) {
+  return SyncFailure(FailureKind::Login,
+                     "The server at " + where + " refused the password for " + member +
+                         "; store the right one with `nubilosyncclient setup`.");
+}
+
+SyncFailure unreachable(const std::string& where) {
+  return SyncFailure(FailureKind::Unreachable, "Cannot reach the server at " + where +
+                                                   "; check the address and the network.");
+}
+
 }  // namespace
 
 std::unique_ptr<NubiloRemoteSession> openSession(const std::string& member,
                                                  const std::string& password,
                                                  Dictionary configuration) {
-  const std::string where = configuration.get("host_scheme").string() + "://" +
-                            configuration.get("host_name").string() + ":" +
-                            std::to_string(configuration.get("host_port").integer());
+  const std::string where = serverOf(configuration);
   configuration.set("Name", Value(member));
   auto account =
       MemberAccount::accountWithName(member, password, configuration.get("user_agent").string());
@@ -141,26 +168,68 @@ std::unique_ptr<NubiloRemoteSession> openSession(const std::string& member,
       throw certificateFailure(*connection->certificateRefusal(),
                                ServerAddress::fromConfiguration(configuration), member,
                                connection->certificateDigest());
-    if (e.name() == NubiloLoginFailureException)
-      throw SyncFailure(FailureKind::Login,
-                        "The server at " + where + " refused the password for " + member +
-                            "; store the right one with `nubilosyncclient setup`.");
-    if (e.name() == NubiloNetworkFailureException)
-      throw SyncFailure(FailureKind::Unreachable, "Cannot reach the server at " + where +
-                                                      "; check the address and the network.");
+    if (e.name() == NubiloLoginFailureException) throw passwordRefused(where, member);
+    if (e.name() == NubiloNetworkFailureException) throw unreachable(where);
     throw SyncFailure(FailureKind::Other,
                       "The server at " + where + " did not accept the session: " + e.reason());
   }
 }
 
-void storeAccount(const AccountSetup& setup, const std::string& password,
-                  const std::string& clientGuid, const std::string& clientName) {
+void checkShareRoot(const std::string& member, const std::string& password,
+                    const Dictionary& configuration) {
+  const std::string where = serverOf(configuration);
+  const ServerAddress server = ServerAddress::fromConfiguration(configuration);
+  const std::string root = server.shareRoot + "/";
+  auto account =
+      MemberAccount::accountWithName(member, password, configuration.get("user_agent").string());
+  account->setCertificateTrust(configuration.get("tls_ca_file").string(),
+                               configuration.get("tls_pinned_certificate").string());
+  const int64_t timeout = configuration.get("sync_dav_timeout_seconds").integer();
+  account->setServer(server.scheme, server.host, server.port, root,
+                     static_cast<int32_t>(timeout > 0 ? timeout : 90));
+  const DavTransaction t = account->credentialsAreValid();
+  if (auto connection = account->connection(); connection && connection->certificateRefusal())
+    throw certificateFailure(*connection->certificateRefusal(), server, member,
+                             connection->certificateDigest());
+  const int status = t.httpStatusCode();
+  if (status == 401) throw passwordRefused(where, member);
+  if (t.transactionState() != kTransactionCompleted) throw unreachable(where);
+  if (status == 207) return;
+  std::string answer = "answered " + std::to_string(status) + " to PROPFIND at " + root;
+  if (const Value* to = t._responseHeaders() ? t._responseHeaders()->find("Location") : nullptr)
+    answer += " (a redirect to " + to->string() + ")";
+  const std::string example =
+      server.origin() + "/dav" + (server.syncPath.empty() ? "/sync" : server.syncPath);
+  throw SyncFailure(FailureKind::ServerUnsuitable,
+                    "The server at " + where + " " + answer +
+                        ", so no WebDAV share begins there; the path of the address up to the "
+                        "sync area must be where the share begins (for a share that Apache "
+                        "serves with `Alias /dav /srv/dav`: " +
+                        example + ").");
+}
+
+void storePassword(const AccountSetup& setup, const std::string& password) {
+  if (setup.passwordCommand) return;
+  std::string why;
+  if (!secrets::storeGenericPassword(kCredentialService, setup.member, "Nubilo", password, &why))
+    throw SyncFailure(FailureKind::Other,
+                      "The password could not be stored in the Secret Service (" + why +
+                          "); use --password-command on a computer without one.");
+}
+
+void storeAccount(const AccountSetup& setup, const std::string& clientGuid,
+                  const std::string& clientName) {
   auto& store = PreferenceStore::shared();
   store.setValue(kAccountNameKey, Value(setup.member), kVantorDefaultsKey, Scope::AnyHost);
   for (const auto& [key, value] : setup.server.configurationKeys())
     store.setValue(key, value, kVantorDefaultsKey, Scope::AnyHost);
+  // Keys an earlier setup may have left: the library's defaults apply.
+  if (setup.server.shareRoot.empty())
+    store.setValue("share_root", Value(), kVantorDefaultsKey, Scope::AnyHost);
   if (setup.server.syncPath.empty())
     store.setValue("sync_path", Value(), kVantorDefaultsKey, Scope::AnyHost);
+  store.setValue(kAllowInsecureKey, setup.allowInsecure ? Value(true) : Value(), kVantorDefaultsKey,
+                 Scope::AnyHost);
   // A self-hosted share: no configuration server to download from.
   store.setValue(config::kConfigurationHostKey, Value(""), kVantorDefaultsKey, Scope::AnyHost);
   store.setValue(kPasswordCommandKey,
@@ -172,13 +241,6 @@ void storeAccount(const AccountSetup& setup, const std::string& password,
                  setup.certificateDigest.empty() ? Value() : Value(setup.certificateDigest),
                  kVantorDefaultsKey, Scope::AnyHost);
   store.synchronize(kVantorDefaultsKey, Scope::AnyHost);
-  if (!setup.passwordCommand) {
-    std::string why;
-    if (!secrets::storeGenericPassword(kCredentialService, setup.member, "Nubilo", password, &why))
-      throw SyncFailure(FailureKind::Other,
-                        "The password could not be stored in the Secret Service (" + why +
-                            "); use --password-command on a computer without one.");
-  }
   VTCPrefsCenter& prefs = VTCPrefsCenter::defaultCenter();
   prefs.setClientGuid(clientGuid);
   prefs.setClientName(clientName);
@@ -210,6 +272,7 @@ std::string storedServerURL() {
   a.scheme = perUser("host_scheme").string();
   a.host = perUser("host_name").string();
   a.port = static_cast<int32_t>(perUser("host_port").integer());
+  a.shareRoot = perUser("share_root").string();
   a.syncPath = perUser("sync_path").string();
   if (a.scheme.empty() || a.host.empty()) return "URL";
   return a.url();

@@ -14,22 +14,35 @@
 
 namespace vtc::client {
 
-// http[s]://host[:port][/path]; the path, when given, is the sync area.
+// http[s]://host[:port][/path]. The path's last component is the sync
+// area; what comes before it is where the share begins on the server:
+// "/dav/sync" is the area /sync of the share at /dav. Without a path the
+// share is the server's root and the area the configuration's default.
 struct ServerAddress {
   std::string scheme;
   std::string host;
   int32_t port = 0;
-  std::string syncPath;
+  std::string shareRoot;  // "" for the server's root, else "/dav"
+  std::string syncPath;   // in the share ("/sync"); "" for the default
 
   // Raises SyncFailure (Usage) with a sentence saying what is wrong.
   static ServerAddress parse(const std::string& url);
-  std::string url() const;  // as the user would type it
-  // The configuration keys it sets (host_scheme, host_name, host_port, and
-  // sync_path when a path was given).
+  std::string url() const;     // as the user would type it
+  std::string origin() const;  // scheme://host[:port]
+  // Whether the password would cross the network in the clear.
+  bool plain() const { return scheme == "http"; }
+  // The configuration keys it sets (host_scheme, host_name, host_port,
+  // share_root when the share is not the server's root, and sync_path when
+  // a path was given).
   Dictionary configurationKeys() const;
   // The address that a configuration's server keys name.
   static ServerAddress fromConfiguration(const Dictionary& configuration);
 };
+
+// The per-user preference (and so configuration key) that says the user
+// let setup send the password over plain http:// or mqtt:// (true), for
+// the connections that send it later.
+inline constexpr const char* kAllowInsecureKey = "allow_insecure";
 
 struct AccountSetup {
   ServerAddress server;
@@ -39,6 +52,7 @@ struct AccountSetup {
   // accepted, which later sessions trust alone.
   std::optional<std::string> caFile;
   std::string certificateDigest;
+  bool allowInsecure = false;  // the password may cross plain connections
 };
 
 // The first line the command prints (run with /bin/sh -c); raises
@@ -52,12 +66,24 @@ std::unique_ptr<NubiloRemoteSession> openSession(const std::string& member,
                                                  const std::string& password,
                                                  Dictionary configuration);
 
-// Stores the account after setup checked it: member name, server keys,
-// certificate trust and the absence of a configuration server (per-user),
-// this computer's client identity (per-host), the password (Secret Service,
-// unless a command is given) and syncing on.
-void storeAccount(const AccountSetup& setup, const std::string& password,
-                  const std::string& clientGuid, const std::string& clientName);
+// Asks once, with no retries, whether the configuration's share root is a
+// WebDAV collection that takes the password. Raises SyncFailure: Login for
+// a refused password, Unreachable, UntrustedCertificate, and
+// ServerUnsuitable with a sentence about the share root for any other
+// answer (a server root that is no share answers 405 to PROPFIND).
+void checkShareRoot(const std::string& member, const std::string& password,
+                    const Dictionary& configuration);
+
+// Stores the password where later runs find it: the Secret Service, unless
+// a password command is given. Raises SyncFailure when it cannot.
+void storePassword(const AccountSetup& setup, const std::string& password);
+
+// Stores the account after setup checked it and stored the password:
+// member name, server keys, certificate trust, the insecure allowance and
+// the absence of a configuration server (per-user), this computer's client
+// identity (per-host) and syncing on.
+void storeAccount(const AccountSetup& setup, const std::string& clientGuid,
+                  const std::string& clientName);
 
 // The stored member name and password; raises SyncFailure (Login) with a
 // sentence saying how to set the account up.

@@ -4,7 +4,7 @@
 #include <filesystem>
 #include <stdexcept>
 
-#include "VantorSyncManager/VTCPrefsCenter.h"
+#include "client/run/SupportFolder.h"
 #include "common/Uuid.h"
 #include "platform/fs/LocalPaths.h"
 #include "platform/plist/PlistCodec.h"
@@ -14,10 +14,16 @@ namespace vtc::client {
 namespace {
 
 Value toValue(const KeptConflict& c) {
-  Dictionary d{
-      {"ID", c.id},           {"Dataclass", c.dataclass},       {"Record", c.record},
-      {"Field", c.field},     {"KeptComputer", c.keptComputer}, {"Computer", c.lostComputer},
-      {"Date", Value(c.date)}};
+  Dictionary d{{"ID", c.id},
+               {"Dataclass", c.dataclass},
+               {"Record", c.record},
+               {"File", c.file},
+               {"Name", c.name},
+               {"Field", c.field},
+               {"KeptComputer", c.keptComputer},
+               {"Computer", c.lostComputer},
+               {"Date", Value(c.date)},
+               {"Item", Value(c.item)}};
   if (!c.kept.isNone()) d.set("Kept", c.kept);
   if (!c.lost.isNone()) d.set("Lost", c.lost);
   return Value(d);
@@ -29,9 +35,12 @@ std::optional<KeptConflict> fromValue(const Value& v) {
   return KeptConflict{d.get("ID").string(),
                       d.get("Dataclass").string(),
                       d.get("Record").string(),
+                      d.get("File").string(),
+                      d.get("Name").string(),
                       d.get("Field").string(),
                       d.get("Kept"),
                       d.get("Lost"),
+                      d.get("Item").dictionary(),
                       d.get("KeptComputer").string(),
                       d.get("Computer").string(),
                       d.get("Date").date()};
@@ -39,23 +48,12 @@ std::optional<KeptConflict> fromValue(const Value& v) {
 
 }  // namespace
 
-ConflictStore::ConflictStore()
-    : ConflictStore(paths::join(VTCPrefsCenter::applicationSupportDirectory().value_or(paths::join(
-                                    paths::applicationSupportDirectory(), "NubiloSyncClient")),
-                                "Conflicts")) {}
+ConflictStore::ConflictStore() : ConflictStore(paths::join(supportFolder(), "Conflicts")) {}
 
 ConflictStore::ConflictStore(std::string folder) : folder_(std::move(folder)) {}
 
-KeptConflict ConflictStore::keep(const engine::Conflict& conflict) {
-  KeptConflict kept{makeUUIDString().substr(0, 8),
-                    conflict.dataclass,
-                    conflict.record,
-                    conflict.property,
-                    conflict.kept,
-                    conflict.lost,
-                    conflict.keptOrigin,
-                    conflict.lostOrigin,
-                    conflict.date};
+KeptConflict ConflictStore::keep(KeptConflict kept) {
+  kept.id = makeUUIDString().substr(0, 8);
   std::transform(kept.id.begin(), kept.id.end(), kept.id.begin(),
                  [](unsigned char c) { return static_cast<char>(std::tolower(c)); });
   paths::makeDirectories(folder_, 0700);

@@ -7,6 +7,7 @@
 #include "VantorSyncManager/NubiloException.h"
 #include "VantorSyncManager/PublicNames.h"
 #include "VantorSyncManager/VTCPrefsCenter.h"
+#include "client/items/ItemRecord.h"
 #include "client/run/FailureText.h"
 #include "client/run/SyncFailure.h"
 #include "common/Clock.h"
@@ -17,65 +18,22 @@ namespace vtc::client {
 
 namespace {
 
-Array setsOf(const Dictionary& fields) {
-  Array sets;
-  for (const auto& [name, value] : fields)
-    sets.push_back(Value(Dictionary{{"action", "set"}, {"name", name}, {"value", value}}));
-  return sets;
-}
-
-// The property changes that turn `from` into `to`, leaving out names in skip.
-Array differences(const Dictionary& from, const Dictionary& to,
-                  const std::set<std::string>& skip = {}) {
-  Array changes;
-  for (const auto& [name, value] : to) {
-    if (skip.count(name)) continue;
-    const Value* old = from.find(name);
-    if (!old || !(*old == value))
-      changes.push_back(Value(Dictionary{{"action", "set"}, {"name", name}, {"value", value}}));
-  }
-  for (const auto& [name, value] : from)
-    if (!to.contains(name) && !skip.count(name))
-      changes.push_back(Value(Dictionary{{"action", "clear"}, {"name", name}}));
-  return changes;
-}
-
-void apply(Dictionary& fields, const Array& changes) {
-  for (const Value& pc : changes) {
-    const Dictionary& d = pc.dictionary();
-    if (d.get("action").string() == "set")
-      fields.set(d.get("name").string(), d.get("value"));
-    else
-      fields.erase(d.get("name").string());
-  }
-}
-
-// What the engine keeps of the folder's files: their stamps, with the
-// fields of each left empty until they are needed.
-std::map<std::string, ItemState> knownFiles(engine::SyncEngine& engine, const std::string& client,
-                                            const std::string& dataclass) {
-  std::map<std::string, ItemState> known;
-  for (const auto& [name, stamp] : engine.itemStamps(client, dataclass)) {
-    ItemState state;
-    state.size = stamp.size;
-    state.modifiedNanoseconds = stamp.modified;
-    state.changedNanoseconds = stamp.changed;
-    state.inode = stamp.inode;
-    known.emplace_hint(known.end(), name, std::move(state));
-  }
-  return known;
-}
-
-engine::StoredItem stored(const ItemState& state) {
-  return {{state.size, state.modifiedNanoseconds, state.changedNanoseconds, state.inode},
-          Value(state.fields)};
-}
-
 // The delete guard looks at proportions only from this many deletes on.
 constexpr size_t kDeletesThatAlwaysPass = 2;
 
+// A delete the user confirmed with --max-delete carries this in its change
+// list, so that the other computers apply it without asking again.
+constexpr char kConfirmedDelete[] = "(confirmed)";
+
 std::string percentText(size_t part, size_t whole) {
   return std::to_string(whole ? part * 100 / whole : 0) + "%";
+}
+
+bool isConfirmedDelete(const SyncEngineChange& change) {
+  if (change.type() != SyncEngineChange::kDelete) return false;
+  for (const Value& pc : change.changes())
+    if (pc.isDictionary() && pc.dictionary().get("name") == Value(kConfirmedDelete)) return true;
+  return false;
 }
 
 }  // namespace
@@ -84,16 +42,38 @@ std::string folderClient(const std::string& dataclass) {
   return "vdir:" + dataclass;
 }
 
-struct DataclassSync::Remote {
+// The folder's side: the records its files changed, and this computer's
+// version of each (the truth with the folder's edits on top).
+struct DataclassSync::Local {
+  FolderRead folder;
+  std::map<std::string, Dictionary> truth;                   // of the records touched
+  std::map<std::string, std::optional<Dictionary>> fileNow;  // what each touched file holds
+  std::map<std::string, merge::Merged> versions;             // this computer's versions
+  std::set<std::string> changed;                             // differ from the truth
+  size_t localDeletes = 0;
+  int64_t truthCount = 0;
+};
+
+// The share's side: what its changelogs make of each record they touch
+// (fast), or of every record (slow), and the truth they are measured against.
+struct DataclassSync::Incoming {
   DataclassRecord record;
   NetworkState state;
   bool slow = false;
-  std::map<int64_t, std::unique_ptr<NubiloChangeLog>> changelogs;
-  std::map<std::string, Dictionary> truth;  // slow: the records the changelogs add up to
-  // Slow: records of the truth known only from modifies (deleted before the
-  // first changelog read): their other fields are this computer's.
-  std::set<std::string> partial;
-  std::map<std::string, std::string> origins;  // slow: the computer that last changed each record
+  bool fetched = false;
+  bool stateChanged = false;  // the state moved on without a fetch
+  std::map<std::string, merge::FoldState> folds;
+  std::map<std::string, Dictionary> base;
+  std::set<std::string> confirmedDeletes;
+};
+
+struct DataclassSync::Plan {
+  std::vector<SyncEngineChange> send;
+  std::vector<engine::SyncOutcome::Entry> truth;
+  std::vector<std::string> takes;
+  std::vector<KeptConflict> conflicts;
+  std::map<std::string, std::string> origins;
+  size_t incomingDeletes = 0;
 };
 
 DataclassSync::DataclassSync(NubiloRemoteSession& session, engine::SyncEngine& engine,
@@ -110,22 +90,39 @@ DataclassSync::DataclassSync(NubiloRemoteSession& session, engine::SyncEngine& e
   outcome_.dataclass = collection.dataclass;
 }
 
-engine::PushOptions DataclassSync::pushOptions(const std::string& origin,
-                                               engine::StateUpdate state) {
-  engine::PushOptions options;
-  options.origin = origin;
-  options.state = std::move(state);
-  options.onConflict = [this](const engine::Conflict& conflict) { noteConflict(conflict); };
-  return options;
-}
-
-void DataclassSync::noteConflict(const engine::Conflict& conflict) {
-  ++outcome_.conflicts;
-  if (!options_.dryRun) conflicts_.keep(conflict);
-}
-
 void DataclassSync::report(const char* what, size_t done, size_t total, int64_t bytes) {
   if (options_.progress) options_.progress->step(collection_.dataclass, what, done, total, bytes);
+}
+
+DataclassSync::Local DataclassSync::readLocal() {
+  const std::string& dataclass = collection_.dataclass;
+  Local local;
+  report("reading the folder", 0, 0);
+  local.folder = readFolder(folder_, engine_, folderClient_, dataclass);
+  outcome_.invalidFiles = local.folder.invalid;
+  std::vector<std::string> ids;
+  for (const auto& [id, record] : local.folder.records) ids.push_back(id);
+  local.truth = engine_.recordsWithIdentifiers(dataclass, ids);
+  for (const auto& [id, record] : local.folder.records) {
+    auto t = local.truth.find(id);
+    std::optional<Dictionary> truth;
+    if (t != local.truth.end()) truth = t->second;
+    std::optional<Dictionary> now;
+    if (record.now) {
+      // Instances keep the keys the file, or else the truth, gave them.
+      const Dictionary* previous = record.before ? &*record.before : truth ? &*truth : nullptr;
+      now = toRecord(record.now->text, record.file, previous);
+    }
+    merge::Merged version = merge::localVersion(collection_.kind, truth, record.before, now);
+    if (!merge::sameRecord(version.record, truth)) {
+      local.changed.insert(id);
+      if (truth && !version.record) ++local.localDeletes;
+    }
+    local.fileNow.emplace(id, std::move(now));
+    local.versions.emplace(id, std::move(version));
+  }
+  local.truthCount = engine_.recordCount(dataclass);
+  return local;
 }
 
 DataclassOutcome DataclassSync::run(const std::optional<DataclassRecord>& listed) {
@@ -137,71 +134,119 @@ DataclassOutcome DataclassSync::run(const std::optional<DataclassRecord>& listed
                           "remove " +
                           dataclass + "`.");
 
-  // The folder, read before anything is written anywhere. Only files whose
-  // stamps changed are read; their fields are then compared with the fields
-  // last seen, which are loaded for them alone.
-  std::map<std::string, ItemState> known = knownFiles(engine_, folderClient_, dataclass);
-  const size_t knownCount = known.size();
-  report("reading the folder", 0, knownCount);
-  const ScanResult scan = folder_.scan(std::move(known));
-  std::vector<std::string> reread;
-  for (const auto& [name, fields] : scan.changed) reread.push_back(name);
-  std::map<std::string, Dictionary> lastFields;
-  for (auto& [name, detail] : engine_.itemDetails(folderClient_, dataclass, reread))
-    lastFields.emplace(name, detail.dictionary());
-  outcome_.invalidFiles = scan.invalid.size();
-  checkLocalDeletes(scan, knownCount);
-  const std::vector<SyncEngineChange> local = folderChanges(scan, lastFields);
-  engine::StateUpdate scanned;
-  for (const auto* read : {&scan.added, &scan.changed})
-    for (const auto& [name, fields] : *read)
-      scanned.items.emplace_back(name, stored(scan.states.at(name)));
-  for (const std::string& name : scan.deleted) scanned.items.emplace_back(name, std::nullopt);
+  Local local = readLocal();
+  // The guard for what goes out, before anything is written anywhere.
+  const bool emptied = local.folder.scan.states.empty() && local.folder.invalid.empty() &&
+                       local.folder.knownFiles > 0;
+  const bool allowed = options_.maxDeletePercent >= 100;
+  if (emptied && !allowed)
+    throw SyncFailure(FailureKind::DeleteRefused,
+                      "The folder " + collection_.folder + " of " + dataclass +
+                          " is empty but held " + std::to_string(local.folder.knownFiles) +
+                          " items; if they are meant to go everywhere, run `nubilosyncclient "
+                          "sync " +
+                          dataclass + " --max-delete 100`.");
+  const size_t known = local.folder.knownFiles;
+  if (!allowed && local.localDeletes > kDeletesThatAlwaysPass &&
+      local.localDeletes * 100 > known * static_cast<size_t>(options_.maxDeletePercent))
+    throw SyncFailure(FailureKind::DeleteRefused,
+                      "Syncing " + dataclass + " would delete " +
+                          std::to_string(local.localDeletes) + " of its " + std::to_string(known) +
+                          " items on the other computers (" +
+                          percentText(local.localDeletes, known) + ", more than " +
+                          std::to_string(options_.maxDeletePercent) +
+                          "%); if that is meant, run `nubilosyncclient sync " + dataclass +
+                          " --max-delete 100`.");
 
   const NetworkState network =
       NetworkState::fromValue(engine_.clientState(kNetworkClient, dataclass));
-  const bool unsent = !local.empty() || !engine_.pull(kNetworkClient, dataclass).changes.empty();
+  const bool unsent = !local.changed.empty();
   const bool serverMoved =
       listed && (listed->maxversion != network.index || listed->minversion != network.minversion);
-  const bool serverLacksData =
-      (!listed || !listed->maxversion) && (unsent || engine_.recordCount(dataclass) > 0);
+  const bool serverLacksData = (!listed || !listed->maxversion) && (unsent || local.truthCount > 0);
 
   if (!unsent && !serverMoved && !serverLacksData && !options_.repair) {
-    if (!scanned.empty()) engine_.saveState(folderClient_, dataclass, scanned);
-    writeFolder();
+    if (!options_.dryRun) {
+      Plan plan;
+      Incoming none;
+      none.state = network;
+      for (auto& [id, version] : local.versions) {
+        const Dictionary item = version.record.value_or(Dictionary{});
+        for (const merge::LostValue& lost : version.lost)
+          plan.conflicts.push_back({"", dataclass, id, recordFile(item), displayName(item),
+                                    lost.key, lost.kept, lost.lost, item, options_.computerName,
+                                    options_.computerName, currentClock().now()});
+      }
+      keepConflicts(plan);
+      // An idle sync writes nothing: the engine hears only of files read again.
+      if (!local.folder.scan.read.empty() || !local.folder.scan.deleted.empty())
+        store(local, plan, none);
+      writeFolder(nullptr, &local.folder.scan.states);
+    }
     return outcome_;
   }
 
   outcome_.usedServer = true;
   if (!options_.dryRun) lock(listed.has_value());
+  std::map<std::string, std::string> origins;  // who last changed each record, for notes
   try {
-    Remote remote;
-    remote.state = network;
     // Read again under the lock: the listing may be older than the lock.
-    remote.record = options_.dryRun
-                        ? listed.value_or(DataclassRecord{})
+    DataclassRecord record =
+        options_.dryRun ? listed.value_or(DataclassRecord{})
                         : DataclassRecord::fromRecord(session_.getDataclassInfo(dataclass));
     bool needsTruth = false;
     if (!options_.dryRun) {
       const Value status = session_.getClientInfo().get(dataclass + ".status");
       needsTruth = status.isString() && status.string() == "needstruth";
     }
-    if (options_.repair && remote.record.maxversion && network.index != remote.record.maxversion)
-      throw SyncFailure(FailureKind::Other,
-                        "This computer has not taken in every change of " + dataclass +
-                            " yet, so its copy cannot repair the share's; repair on a "
-                            "computer whose last sync of it succeeded.");
-    const bool slow = !options_.repair && remote.record.maxversion &&
-                      (!network.index || remote.record.minversion != network.minversion ||
-                       *remote.record.maxversion < *network.index || needsTruth);
-    remote = fetch(slow, remote.record);
-
-    engine_.push(folderClient_, dataclass, local, pushOptions(options_.computerName, scanned));
-    applyRemote(remote, engine_.pull(kNetworkClient, dataclass), lastFields);
-    commit(remote);
-    compactIfLong(remote);
-    if (needsTruth && !options_.dryRun)
-      session_.setStatus("normal", session_.configuration().get("guid").string(), dataclass);
+    if (options_.repair) {
+      if (VTCPrefsCenter::defaultCenter().failedSyncCountForDataclass(dataclass) > 0)
+        throw SyncFailure(FailureKind::Other,
+                          "The last sync of " + dataclass +
+                              " on this computer did not succeed, so its copy cannot repair the "
+                              "share's; repair on a computer whose last sync of it succeeded.");
+      if (record.maxversion && network.index != record.maxversion)
+        throw SyncFailure(FailureKind::Other,
+                          "This computer has not taken in every change of " + dataclass +
+                              " yet, so its copy cannot repair the share's; repair on a "
+                              "computer whose last sync of it succeeded.");
+    }
+    // A compaction by another computer whose truth this computer holds
+    // already: the new history starts from what it has, so it goes on from
+    // there instead of reading the whole truth again.
+    NetworkState state = network;
+    bool resumed = false;
+    if (!options_.repair && record.truthIndex && record.minversion &&
+        *record.minversion == *record.truthIndex + 1 && network.index == record.truthIndex &&
+        network.minversion != record.minversion && record.truthDigest == truthDigestText()) {
+      VTC_LOG_INFO("%@ was compacted at changelog %d from a truth this computer holds", dataclass,
+                   *record.minversion);
+      state = NetworkState{record.minversion, record.minversion};
+      resumed = true;
+    }
+    const bool slow = !options_.repair && record.maxversion &&
+                      (!state.index || record.minversion != state.minversion ||
+                       *record.maxversion < *state.index || (needsTruth && !resumed));
+    Incoming incoming = fetch(slow, record, state, local);
+    incoming.stateChanged = resumed;
+    Plan plan = decide(local, incoming, record);
+    origins = plan.origins;
+    guardDeletes(local, plan);
+    outcome_.sentChanges = plan.send.size();
+    outcome_.filesWritten = plan.takes.size();
+    if (!options_.dryRun) {
+      // A long history is written again before this computer's changes go
+      // out, as the truth the share holds now: computers that took it in
+      // go on from it.
+      if (!plan.send.empty() && compactionDue(record)) compact(record, incoming);
+      commit(plan, record);
+      incoming.record = record;
+      keepConflicts(plan);
+      store(local, plan, incoming);
+      if (options_.repair) repair(record);
+      if (needsTruth)
+        session_.setStatus("normal", session_.configuration().get("guid").string(), dataclass);
+    }
   } catch (...) {
     if (locked_) {
       try {
@@ -214,46 +259,11 @@ DataclassOutcome DataclassSync::run(const std::optional<DataclassRecord>& listed
     throw;
   }
   if (locked_) unlock();
-  writeFolder();
-  return outcome_;
-}
-
-std::vector<SyncEngineChange> DataclassSync::folderChanges(
-    const ScanResult& scan, const std::map<std::string, Dictionary>& lastFields) {
-  std::vector<SyncEngineChange> changes;
-  for (const auto& [name, fields] : scan.added)
-    changes.emplace_back(SyncEngineChange::kAdd, name, setsOf(fields));
-  for (const auto& [name, fields] : scan.changed) {
-    auto old = lastFields.find(name);
-    Array diff = differences(old == lastFields.end() ? Dictionary{} : old->second, fields);
-    if (!diff.empty()) changes.emplace_back(SyncEngineChange::kModify, name, std::move(diff));
+  if (!options_.dryRun) {
+    outcome_.filesWritten = 0;
+    writeFolder(&origins, &local.folder.scan.states);
   }
-  for (const std::string& name : scan.deleted)
-    changes.emplace_back(SyncEngineChange::kDelete, name, Array{});
-  return changes;
-}
-
-void DataclassSync::checkLocalDeletes(const ScanResult& scan, size_t known) {
-  // A few deletes always pass: deleting one of two contacts is no accident.
-  if (known <= kDeletesThatAlwaysPass || options_.maxDeletePercent >= 100) return;
-  const std::string& dataclass = collection_.dataclass;
-  if (scan.states.empty() && scan.invalid.empty())
-    throw SyncFailure(FailureKind::DeleteRefused,
-                      "The folder " + collection_.folder + " of " + dataclass +
-                          " is empty but held " + std::to_string(known) +
-                          " items; if they are meant to go everywhere, run `nubilosyncclient "
-                          "sync " +
-                          dataclass + " --max-delete 100`.");
-  if (scan.deleted.size() > kDeletesThatAlwaysPass &&
-      scan.deleted.size() * 100 > known * static_cast<size_t>(options_.maxDeletePercent))
-    throw SyncFailure(FailureKind::DeleteRefused,
-                      "Syncing " + dataclass + " would delete " +
-                          std::to_string(scan.deleted.size()) + " of its " + std::to_string(known) +
-                          " items on the other computers (" +
-                          percentText(scan.deleted.size(), known) + ", more than " +
-                          std::to_string(options_.maxDeletePercent) +
-                          "%); if that is meant, run `nubilosyncclient sync " + dataclass +
-                          " --max-delete 100`.");
+  return outcome_;
 }
 
 // Runs a lock operation; when the share refuses it because of a lock that
@@ -317,17 +327,24 @@ void DataclassSync::unlock() {
   locks_.record();
 }
 
-DataclassSync::Remote DataclassSync::fetch(bool slow, const DataclassRecord& record) {
+DataclassSync::Incoming DataclassSync::fetch(bool slow, const DataclassRecord& record,
+                                             const NetworkState& state, const Local& local) {
   const std::string& dataclass = collection_.dataclass;
-  Remote remote;
-  remote.record = record;
-  remote.state = NetworkState::fromValue(engine_.clientState(kNetworkClient, dataclass));
-  remote.slow = slow;
-  if (!record.maxversion) return remote;
+  Incoming in;
+  in.record = record;
+  in.state = state;
+  in.slow = slow;
+  if (slow)
+    for (const SyncEngineChange& have : engine_.records(dataclass)) {
+      Dictionary fields;
+      merge::applyChanges(fields, have.changes());
+      in.base.emplace(have.recordIdentifier(), std::move(fields));
+    }
+  if (!record.maxversion) return in;
   outcome_.mode = slow ? "slow" : "fast";
-  const int64_t from = slow ? record.minversion.value_or(1) : remote.state.index.value_or(0) + 1;
+  const int64_t from = slow ? record.minversion.value_or(1) : in.state.index.value_or(0) + 1;
   const int64_t to = *record.maxversion;
-  if (from > to) return remote;
+  if (from > to) return in;
 
   VTCPrefsCenter& prefs = VTCPrefsCenter::defaultCenter();
   if (auto failed = prefs.failedETagForDataclass(dataclass); failed && *failed == record.etag)
@@ -371,171 +388,191 @@ DataclassSync::Remote DataclassSync::fetch(bool slow, const DataclassRecord& rec
       DataclassRecord repaired = DataclassRecord::fromRecord(session_.getDataclassInfo(dataclass));
       if (!slow || repaired.minversion != record.minversion ||
           repaired.maxversion != record.maxversion)
-        return fetch(true, repaired);
+        return fetch(true, repaired, state, local);
     }
     prefs.setFailedETag(record.etag, dataclass);
     throw;
   }
   outcome_.changelogsFetched = static_cast<int64_t>(fetched.changeLogs.size());
   outcome_.bytesFetched = fetched.StorageConsumed;
-  remote.changelogs = std::move(fetched.changeLogs);
+  in.fetched = true;
+  in.state = NetworkState{to, record.minversion};
+  if (fetched.changeLogs.empty()) return in;
 
-  // The delete guard for what comes in, before anything is written.
-  size_t deletes = 0;
-  const int64_t records = engine_.recordCount(dataclass);
-  if (slow) {
-    // A modify of a deleted record (its editor had not seen the delete)
-    // brings it back whole, as it was when deleted: the engine does the same
-    // with its tombstones when changes come one changelog at a time.
-    std::map<std::string, Dictionary> buried;
-    for (const auto& [index, log] : remote.changelogs) {
-      const std::string origin = log->headerValueForKey("CreatorClientName").string();
-      for (const SyncEngineChange& change : log->changes()) {
-        const std::string& id = change.recordIdentifier();
-        remote.origins[id] = origin;
-        auto it = remote.truth.find(id);
-        if (change.type() == SyncEngineChange::kDelete) {
-          // Only a whole record is kept aside: a partial one edited again
-          // is partial again.
-          if (it != remote.truth.end()) {
-            if (!remote.partial.erase(id)) buried[id] = std::move(it->second);
-            remote.truth.erase(it);
-          }
-          continue;
-        }
-        if (change.type() == SyncEngineChange::kAdd) {
-          remote.truth[id] = Dictionary{};
-          remote.partial.erase(id);
-        } else if (it == remote.truth.end()) {
-          if (auto b = buried.find(id); b != buried.end())
-            remote.truth[id] = std::move(b->second);
-          else
-            remote.partial.insert(id);
-        }
-        buried.erase(id);
-        apply(remote.truth[id], change.changes());
-      }
-    }
-    for (const SyncEngineChange& have : engine_.records(dataclass))
-      if (!remote.truth.count(have.recordIdentifier())) ++deletes;
-  } else {
-    std::set<std::string> deleted;
-    for (const auto& [index, log] : remote.changelogs)
+  // Fast: each record the changes touch starts from the truth, or from its
+  // tombstone when it was deleted here.
+  if (!slow) {
+    std::set<std::string> touched;
+    for (const auto& [index, log] : fetched.changeLogs)
       for (const SyncEngineChange& change : log->changes())
-        if (change.type() == SyncEngineChange::kDelete) deleted.insert(change.recordIdentifier());
-    deletes = deleted.size();
+        touched.insert(change.recordIdentifier());
+    const std::vector<std::string> ids(touched.begin(), touched.end());
+    in.base = engine_.recordsWithIdentifiers(dataclass, ids);
+    std::vector<std::string> gone;
+    for (const std::string& id : ids)
+      if (!in.base.count(id)) gone.push_back(id);
+    for (auto& [id, tomb] : engine_.tombstones(dataclass, gone)) {
+      merge::FoldState& state = in.folds[id];
+      state.buried = std::move(tomb.record);
+      state.deletedBy = tomb.origin;
+      state.deletedHere = tomb.here;
+    }
+    for (const auto& [id, fields] : in.base) in.folds[id].record = fields;
   }
-  if (deletes > kDeletesThatAlwaysPass &&
-      deletes * 100 > static_cast<size_t>(records) * static_cast<size_t>(options_.maxDeletePercent))
-    throw SyncFailure(FailureKind::DeleteRefused,
-                      "Syncing " + dataclass + " would delete " + std::to_string(deletes) +
-                          " of its " + std::to_string(records) + " items here (" +
-                          percentText(deletes, static_cast<size_t>(records)) + ", more than " +
-                          std::to_string(options_.maxDeletePercent) +
-                          "%); if that is meant, run `nubilosyncclient sync " + dataclass +
-                          " --max-delete 100`.");
-  return remote;
+  const std::string own = session_.configuration().get("guid").string();
+  size_t applied = 0;
+  for (const auto& [index, log] : fetched.changeLogs) {
+    report("taking in changes", applied++, fetched.changeLogs.size());
+    const std::string origin = log->headerValueForKey("CreatorClientName").string();
+    const bool here = !own.empty() && log->headerValueForKey("CreatorClientGuid").string() == own;
+    for (const SyncEngineChange& change : log->changes()) {
+      const std::string& id = change.recordIdentifier();
+      merge::foldChange(in.folds[id], change, origin, here);
+      if (isConfirmedDelete(change))
+        in.confirmedDeletes.insert(id);
+      else
+        in.confirmedDeletes.erase(id);
+    }
+  }
+  for (auto& [id, state] : in.folds)
+    if (state.changed) ++outcome_.receivedChanges;
+  return in;
 }
 
-void DataclassSync::applyRemote(Remote& remote, const engine::PullResult& pending,
-                                const std::map<std::string, Dictionary>& lastFields) {
+DataclassSync::Plan DataclassSync::decide(Local& local, Incoming& in,
+                                          const DataclassRecord& record) {
   const std::string& dataclass = collection_.dataclass;
-  if (remote.changelogs.empty()) return;
-  const int64_t last = remote.changelogs.rbegin()->first;
-  if (!remote.slow) {
-    size_t applied = 0;
-    for (const auto& [index, log] : remote.changelogs) {
-      report("taking in changes", applied++, remote.changelogs.size());
-      const std::vector<SyncEngineChange>& changes = log->changes();
-      std::string origin = log->headerValueForKey("CreatorClientName").string();
-      NetworkState after{index, remote.record.minversion};
-      engine::StateUpdate state;
-      state.clientState = after.toValue();
-      engine_.push(kNetworkClient, dataclass, changes, pushOptions(origin, state));
-      outcome_.receivedChanges += changes.size();
+  const bool firstCommit = !record.maxversion;
+  Plan plan;
+  // Every record either side touched; a slow sync and a first commit weigh
+  // every record there is.
+  std::set<std::string> ids;
+  for (const auto& [id, version] : local.versions) ids.insert(id);
+  for (const auto& [id, state] : in.folds)
+    if (state.changed || in.slow) ids.insert(id);
+  if (in.slow)
+    for (const auto& [id, fields] : in.base) ids.insert(id);
+  if (firstCommit && local.truthCount > 0)
+    for (const SyncEngineChange& have : engine_.records(dataclass)) {
+      Dictionary fields;
+      merge::applyChanges(fields, have.changes());
+      ids.insert(have.recordIdentifier());
+      in.base.emplace(have.recordIdentifier(), std::move(fields));
     }
-    remote.state = NetworkState{last, remote.record.minversion};
-    return;
-  }
 
-  // Slow: the engine takes the truth, except where an edit of this computer
-  // has not been sent yet: those records and fields keep the local value.
-  std::set<std::string> pendingRecords;
-  std::map<std::string, std::set<std::string>> pendingFields;
-  for (const SyncEngineChange& change : pending.changes) {
-    pendingRecords.insert(change.recordIdentifier());
-    for (const Value& pc : change.changes())
-      pendingFields[change.recordIdentifier()].insert(pc.dictionary().get("name").string());
-  }
-  std::map<std::string, Dictionary> current;
-  for (const SyncEngineChange& have : engine_.records(dataclass)) {
-    Dictionary fields;
-    apply(fields, have.changes());
-    current.emplace(have.recordIdentifier(), std::move(fields));
-  }
-  std::vector<SyncEngineChange> diff;
-  for (const auto& [id, fields] : remote.truth) {
-    auto here = current.find(id);
-    const bool partial = remote.partial.count(id);
-    if (here == current.end()) {
-      // Not deleted here since the last sync: added, or for a partial record
-      // modified, so that the engine brings back the rest from its tombstone.
-      if (!pendingRecords.count(id))
-        diff.emplace_back(partial ? SyncEngineChange::kModify : SyncEngineChange::kAdd, id,
-                          setsOf(fields));
-      continue;
+  auto find = [](const auto& map, const std::string& id) -> std::optional<Dictionary> {
+    auto it = map.find(id);
+    if (it == map.end()) return std::nullopt;
+    return it->second;
+  };
+  const Date now = currentClock().now();
+  for (const std::string& id : ids) {
+    merge::RecordSides sides;
+    sides.base = find(local.truth, id);
+    if (!sides.base) sides.base = find(in.base, id);
+    auto version = local.versions.find(id);
+    auto fold = in.folds.find(id);
+    const bool local_ = version != local.versions.end();
+    sides.ours = local_ ? version->second.record : sides.base;
+    sides.changedHere = local.changed.count(id) > 0;
+    if (firstCommit) {
+      sides.theirs = std::nullopt;  // an empty share: nothing there to weigh
+      sides.changedThere = false;
+    } else {
+      if (fold != in.folds.end())
+        sides.theirs = fold->second.record;
+      else if (!in.slow)
+        sides.theirs = sides.base;
+      sides.changedThere = !merge::sameRecord(sides.theirs, sides.base);
     }
-    // A field edited here that the share changed too since this computer
-    // last saw it: the value of here stays and is sent; the share's is kept
-    // as the loser, as when the changes come one changelog at a time.
-    if (auto seen = lastFields.find(id); seen != lastFields.end())
-      for (const std::string& name : pendingFields[id]) {
-        const Value &base = seen->second.get(name), &theirs = fields.get(name),
-                    &ours = here->second.get(name);
-        if (theirs == base || theirs == ours) continue;
-        VTC_LOG_INFO("Conflict on %@ of record %@ in %@: kept %@ from here, dropped %@ from %@",
-                     name, id, dataclass, ours, theirs, remote.origins[id]);
-        noteConflict({dataclass, id, name, ours, theirs, folderClient_, kNetworkClient,
-                      options_.computerName, remote.origins[id], currentClock().now()});
-      }
-    Dictionary from = here->second;
-    if (partial)  // only the fields the changelogs set; the rest stays as it is here
-      for (const std::string& name : here->second.keys())
-        if (!fields.contains(name)) from.erase(name);
-    Array changes = differences(from, fields, pendingFields[id]);
-    if (!changes.empty()) diff.emplace_back(SyncEngineChange::kModify, id, std::move(changes));
+    if (auto f = local.fileNow.find(id); f != local.fileNow.end())
+      sides.file = f->second;
+    else
+      sides.file = sides.base;
+
+    merge::RecordDecision d = merge::decideRecord(collection_.kind, id, sides);
+    const std::string origin = fold != in.folds.end() && fold->second.changed
+                                   ? fold->second.origin
+                                   : options_.computerName;
+    plan.origins[id] = origin;
+    const std::optional<Dictionary>& merged = d.merged.record;
+    if (d.send) {
+      if (d.send->type() == SyncEngineChange::kDelete && options_.deletesConfirmed)
+        d.send =
+            SyncEngineChange(SyncEngineChange::kDelete, id,
+                             Array{Value(Dictionary{{"action", "set"},
+                                                    {"name", kConfirmedDelete},
+                                                    {"value", Value(options_.computerName)}})});
+      plan.send.push_back(std::move(*d.send));
+    }
+    if (d.truthChanged) {
+      const bool deletedHere = !merged && sides.changedHere && !sides.ours;
+      plan.truth.push_back({id, merged, deletedHere ? options_.computerName : origin, deletedHere});
+    }
+    if (d.folderTakes) plan.takes.push_back(id);
+    if (sides.base && !merged && !(sides.changedHere && !sides.ours)) {
+      if (in.confirmedDeletes.count(id))
+        ++outcome_.confirmedDeletes;
+      else
+        ++plan.incomingDeletes;
+    }
+
+    // What this computer loses: values that lost to the share's, and its
+    // deletes undone by edits made elsewhere.
+    const Dictionary item = merged ? *merged : sides.base.value_or(Dictionary{});
+    const std::string file = recordFile(item);
+    const std::string name = displayName(item);
+    auto keep = [&](const merge::LostValue& lost, const std::string& keptBy) {
+      plan.conflicts.push_back({"", dataclass, id, file, name, lost.key, lost.kept, lost.lost, item,
+                                keptBy, options_.computerName, now});
+    };
+    if (local_)
+      for (const merge::LostValue& lost : version->second.lost) keep(lost, options_.computerName);
+    for (const merge::LostValue& lost : d.merged.lost) keep(lost, origin);
+    const bool undoneHere = (local_ && version->second.deleteUndone) ||
+                            (d.merged.deleteUndone && merged) ||
+                            (fold != in.folds.end() && fold->second.restored &&
+                             fold->second.restoredDeleteWasHere && merged);
+    if (undoneHere) {
+      ++outcome_.deletesUndone;
+      if (!d.merged.deleteUndone && !(local_ && version->second.deleteUndone))
+        keep({merge::kRecordField, Value(), Value()}, origin);
+    }
   }
-  for (const auto& [id, fields] : current)
-    if (!remote.truth.count(id) && !pendingRecords.count(id))
-      diff.emplace_back(SyncEngineChange::kDelete, id, Array{});
-  engine::StateUpdate state;
-  remote.state = NetworkState{last, remote.record.minversion};
-  state.clientState = remote.state.toValue();
-  engine_.push(kNetworkClient, dataclass, diff, pushOptions("", state));
-  outcome_.receivedChanges += diff.size();
+  outcome_.conflicts = plan.conflicts.size();
+  return plan;
 }
 
-void DataclassSync::commit(Remote& remote) {
+void DataclassSync::guardDeletes(const Local& local, const Plan& plan) {
+  if (options_.maxDeletePercent >= 100 || plan.incomingDeletes == 0) return;
   const std::string& dataclass = collection_.dataclass;
-  engine::PullResult pending = engine_.pull(kNetworkClient, dataclass);
-  const bool firstCommit = !remote.record.maxversion;
-  std::vector<SyncEngineChange> changes =
-      firstCommit ? engine_.records(dataclass) : std::move(pending.changes);
-  engine::StateUpdate state;
-  if (changes.empty()) {
-    state.clientState = remote.state.toValue();
-    if (!options_.dryRun) engine_.acknowledge(kNetworkClient, dataclass, pending.anchor, state);
+  const size_t records = static_cast<size_t>(local.truthCount);
+  const size_t deletes = plan.incomingDeletes;
+  // Emptying the folder is never taken silently, however small it is.
+  const bool empties = deletes >= records;
+  if (!empties && (deletes <= kDeletesThatAlwaysPass ||
+                   deletes * 100 <= records * static_cast<size_t>(options_.maxDeletePercent)))
     return;
-  }
-  outcome_.sentChanges = changes.size();
-  if (options_.dryRun) return;
-  report("sending", 0, changes.size());
-  const int64_t index = firstCommit ? 1 : *remote.record.maxversion + 1;
+  throw SyncFailure(
+      FailureKind::DeleteRefused,
+      "Syncing " + dataclass + " would delete " + std::to_string(deletes) + " of its " +
+          std::to_string(records) + " items here (" + percentText(deletes, records) +
+          (empties ? ", every one"
+                   : ", more than " + std::to_string(options_.maxDeletePercent) + "%") +
+          "); if that is meant, run `nubilosyncclient sync " + dataclass + " --max-delete 100`.");
+}
+
+void DataclassSync::commit(Plan& plan, DataclassRecord& record) {
+  if (plan.send.empty()) return;
+  const std::string& dataclass = collection_.dataclass;
+  report("sending", 0, plan.send.size());
+  const bool firstCommit = !record.maxversion;
+  const int64_t index = firstCommit ? 1 : *record.maxversion + 1;
   // The lock is renewed first: a lock that expired (this computer slept)
   // fails here, before anything is written.
   session_.relockDataclass(dataclass);
   try {
-    session_.commitChanges(changes, dataclass, index, firstCommit);
+    session_.commitChanges(plan.send, dataclass, index, firstCommit);
   } catch (const NubiloException& e) {
     // A changelog at this index with a record that does not name it: an
     // earlier commit whose record update was lost. The record is set right
@@ -546,13 +583,43 @@ void DataclassSync::commit(Remote& remote) {
   // The commit does not judge its record update: a lost one would hide this
   // changelog from every other computer, so it is looked at once.
   repairLaggingRecord(index);
-  remote.record.maxversion = index;
-  if (firstCommit) remote.record.minversion = index;
-  remote.state = NetworkState{index, remote.record.minversion};
-  state.clientState = remote.state.toValue();
-  engine_.acknowledge(kNetworkClient, dataclass, pending.anchor, state);
+  record.maxversion = index;
+  if (firstCommit) record.minversion = index;
   outcome_.committedIndex = index;
   if (firstCommit) markOthersNeedingTruth();
+}
+
+void DataclassSync::keepConflicts(const Plan& plan) {
+  for (const KeptConflict& c : plan.conflicts) {
+    VTC_LOG_INFO("Conflict on %@ of record %@ in %@: kept %@ from %@, lost %@ from here", c.field,
+                 c.record, c.dataclass, c.kept, c.keptComputer, c.lost);
+    conflicts_.keep(c);
+  }
+}
+
+void DataclassSync::store(Local& local, Plan& plan, const Incoming& incoming) {
+  engine::SyncOutcome o;
+  o.truth = std::move(plan.truth);
+  o.folderTakes = std::move(plan.takes);
+  o.networkClient = kNetworkClient;
+  o.folderClient = folderClient_;
+  NetworkState state = incoming.state;
+  if (outcome_.committedIndex)
+    state = NetworkState{outcome_.committedIndex, incoming.record.minversion};
+  if (incoming.fetched || incoming.stateChanged || outcome_.committedIndex)
+    o.network.clientState = state.toValue();
+  // The files read are taken in: their states and records go with the truth.
+  for (const auto& [name, file] : local.folder.scan.read) {
+    const ItemState& s = local.folder.scan.states.at(name);
+    auto now = local.fileNow.find(s.record);
+    if (now == local.fileNow.end() || !now->second) continue;
+    o.folder.items.emplace_back(name, engine::StoredItem{{s.size, s.modifiedNanoseconds,
+                                                          s.changedNanoseconds, s.inode, s.record},
+                                                         Value(*now->second)});
+  }
+  for (const std::string& name : local.folder.scan.deleted)
+    o.folder.items.emplace_back(name, std::nullopt);
+  engine_.storeSync(collection_.dataclass, o);
 }
 
 void DataclassSync::repairLaggingRecord(int64_t index) {
@@ -584,42 +651,100 @@ void DataclassSync::markOthersNeedingTruth() {
   locks_.record();
 }
 
-void DataclassSync::compactIfLong(Remote& remote) {
-  if (options_.dryRun || (!outcome_.committedIndex && !options_.repair)) return;
-  if (!remote.record.maxversion) return;  // the first commit was the whole truth
-  const std::string& dataclass = collection_.dataclass;
-  const Dictionary& configuration = session_.configuration();
-  const int64_t min = remote.record.minversion.value_or(1);
-  const int64_t max = *remote.record.maxversion;
-  const int64_t count = max - min + 1;
-  int64_t maxCount = configuration.get("compaction_max_changelogs").integer();
-  if (maxCount <= 0) maxCount = 64;
-  int64_t sizeFactor = configuration.get("compaction_size_factor").integer();
-  if (sizeFactor <= 0) sizeFactor = 4;
-  bool compact = options_.repair || count > maxCount;
-  if (!compact && count >= 8) {
-    // Bytes against the size of the data: the oldest changelog is the last
-    // whole truth that was written.
-    int64_t chain = 0, truth = 0;
-    DavTransaction listing =
-        session_.tesselSession().listCollectionAtPath(session_.schemasPath() + "/" + dataclass);
-    for (const Value& entry : listing.result().array()) {
-      const std::string& uri = entry.dictionary().get(kNBURI).string();
-      if (!uri.ends_with(".clog")) continue;
-      const int64_t size = entry.dictionary().get(kNBContentLength).integer();
-      chain += size;
-      if (uri == session_.changeLogPathForDataclass(dataclass, min)) truth = size;
-    }
-    compact = chain > sizeFactor * std::max<int64_t>(truth, 64 * 1024);
-  }
-  if (!compact) return;
+std::string DataclassSync::truthDigestText() {
+  const std::map<std::string, engine::SetAside> aside =
+      engine_.setAsideRecords(collection_.dataclass);
+  uint64_t digest = 0;
+  engine_.forEachRecord(collection_.dataclass, [&](const std::string& id, const Dictionary& r) {
+    if (!aside.count(id)) digest ^= recordDigest(id, r);
+  });
+  return format("%016llx", static_cast<unsigned long long>(digest));
+}
 
+bool DataclassSync::compactionDue(const DataclassRecord& record) {
+  if (!record.maxversion) return false;  // the first commit is the whole truth
+  const std::string& dataclass = collection_.dataclass;
+  const int64_t min = record.minversion.value_or(1);
+  const int64_t count = *record.maxversion - min + 1;
+  if (count <= 1) return false;
+  // A count bounds how many changelogs a computer that was away fetches.
+  int64_t maxCount = session_.configuration().get("compaction_max_changelogs").integer();
+  if (maxCount <= 0) maxCount = 1024;
+  if (count > maxCount) return true;
+  // By bytes: once the changes after the last whole truth outweigh it, it is
+  // written again, so the history never holds much more than twice the data
+  // (or a small history) and its cost follows the changes.
+  int64_t chain = 0, truth = 0;
+  DavTransaction listing =
+      session_.tesselSession().listCollectionAtPath(session_.schemasPath() + "/" + dataclass);
+  for (const Value& entry : listing.result().array()) {
+    const std::string& uri = entry.dictionary().get(kNBURI).string();
+    if (!uri.ends_with(".clog")) continue;
+    const int64_t size = entry.dictionary().get(kNBContentLength).integer();
+    if (uri == session_.changeLogPathForDataclass(dataclass, min))
+      truth = size;
+    else
+      chain += size;
+  }
+  constexpr int64_t kSmallHistory = 64 * 1024;
+  return truth > 0 && chain > std::max(truth, kSmallHistory);
+}
+
+void DataclassSync::compact(DataclassRecord& record, Incoming& incoming) {
+  // The truth at the share's last changelog: this computer's, with what the
+  // changelogs just taken in made of each record (a slow sync's truth is
+  // theirs alone), without the records set aside here (they make no item
+  // anywhere).
+  const std::string& dataclass = collection_.dataclass;
+  const std::map<std::string, engine::SetAside> aside = engine_.setAsideRecords(dataclass);
+  std::vector<SyncEngineChange> whole;
+  uint64_t digest = 0;
+  auto add = [&](const std::string& id, const Dictionary& r) {
+    if (aside.count(id)) return;
+    digest ^= recordDigest(id, r);
+    whole.emplace_back(SyncEngineChange::kAdd, id, merge::recordSets(r));
+  };
+  if (!incoming.slow)
+    engine_.forEachRecord(dataclass, [&](const std::string& id, const Dictionary& r) {
+      if (!incoming.folds.count(id)) add(id, r);
+    });
+  for (const auto& [id, fold] : incoming.folds)
+    if (fold.record) add(id, *fold.record);
+  const int64_t truthIndex = *record.maxversion;
+  writeTruth(record, whole);
+  session_.setInfoForDataclass(
+      Dictionary{{"truthdigest", Value(format("%d:%016llx", truthIndex,
+                                              static_cast<unsigned long long>(digest)))}},
+      dataclass);
+  incoming.state = NetworkState{record.minversion, record.minversion};
+  incoming.stateChanged = true;
+}
+
+void DataclassSync::repair(DataclassRecord& record) {
+  const std::map<std::string, engine::SetAside> aside =
+      engine_.setAsideRecords(collection_.dataclass);
+  std::vector<SyncEngineChange> whole = engine_.records(collection_.dataclass);
+  std::erase_if(whole,
+                [&](const SyncEngineChange& c) { return aside.count(c.recordIdentifier()) > 0; });
+  writeTruth(record, whole);
+  engine::StateUpdate state;
+  state.clientState = NetworkState{record.minversion, record.minversion}.toValue();
+  engine_.saveState(kNetworkClient, collection_.dataclass, state);
+  outcome_.committedIndex = record.maxversion;
+}
+
+void DataclassSync::writeTruth(DataclassRecord& record,
+                               const std::vector<SyncEngineChange>& whole) {
   // The whole truth as a reset commit; every other computer then takes it
-  // in once, and the changelogs before it go.
-  VTC_LOG_INFO("Compacting %@: %d changelogs from %d", dataclass, count, min);
+  // in once (or, holding it already, goes on from it), and the changelogs
+  // before it go.
+  const std::string& dataclass = collection_.dataclass;
+  const int64_t min = record.minversion.value_or(1);
+  const int64_t max = record.maxversion.value_or(0);
+  VTC_LOG_INFO("Compacting %@: %d changelogs from %d", dataclass, max - min + 1, min);
   const int64_t index = max + 1;
   session_.relockDataclass(dataclass);
-  session_.commitChanges(engine_.records(dataclass), dataclass, index, true);
+  session_.commitChanges(whole, dataclass, index, true);
   markOthersNeedingTruth();
   const auto halfLock = std::chrono::duration_cast<Date::duration>(
       std::chrono::duration<double>(session_.lockDuration() / 2.0));
@@ -630,109 +755,29 @@ void DataclassSync::compactIfLong(Remote& remote) {
       session_.relockClient();
       renewBy = currentClock().now() + halfLock;
     }
-    // Not tested: a leftover old changelog is outside the record's range
-    // and never read again.
+    // A leftover old changelog is outside the record's range; the next sync
+    // that finds one removes it.
     session_.tesselSession().deleteResourceAtPath(
         session_.changeLogPathForDataclass(dataclass, old));
   }
-  remote.record.minversion = index;
-  remote.record.maxversion = index;
-  remote.state = NetworkState{index, index};
-  engine::StateUpdate state;
-  state.clientState = remote.state.toValue();
-  engine_.saveState(kNetworkClient, dataclass, state);
+  record.minversion = index;
+  record.maxversion = index;
   outcome_.compacted = true;
-  outcome_.committedIndex = index;
 }
 
-void DataclassSync::writeFolder() {
-  const std::string& dataclass = collection_.dataclass;
-  engine::PullResult pulled = engine_.pull(folderClient_, dataclass);
-  if (pulled.changes.empty() && !pulled.isTruth) {
-    if (!options_.dryRun && pulled.anchor > 0)
-      engine_.acknowledge(folderClient_, dataclass, pulled.anchor);
-    return;
-  }
-  std::map<std::string, ItemState> known = knownFiles(engine_, folderClient_, dataclass);
-  const std::string extension = itemExtension(collection_.kind);
-  engine::StateUpdate states;
-  bool skipped = false;
-  std::set<std::string> named;
-  // Made durable together at the end, before the engine hears of them.
-  folder_.deferFlushes(true);
-  size_t handled = 0;
-  for (const SyncEngineChange& change : pulled.changes) {
-    if ((handled++ & 63) == 0) report("writing files", handled - 1, pulled.changes.size());
-    const std::string& name = change.recordIdentifier();
-    named.insert(name);
-    // A name from another computer becomes a file name here: only a plain
-    // name of this kind's files is taken.
-    if (name.empty() || name.front() == '.' || name.find('/') != std::string::npos ||
-        name.find('\0') != std::string::npos || !name.ends_with(extension) || name.size() > 255) {
-      VTC_LOG_WARNING("Skipping record %@ of %@: not a file name for this folder", name, dataclass);
-      continue;
-    }
-    ++outcome_.filesWritten;
-    if (options_.dryRun) continue;
-    auto have = known.find(name);
-    const std::optional<ItemState> expected =
-        have == known.end() ? std::nullopt : std::optional<ItemState>(have->second);
-    WriteOutcome result;
-    ItemState written;
-    if (change.type() == SyncEngineChange::kDelete) {
-      if (!expected) {
-        --outcome_.filesWritten;
-        continue;
-      }
-      result = folder_.remove(name, *expected);
-      if (result == WriteOutcome::Removed) states.items.emplace_back(name, std::nullopt);
-    } else {
-      std::optional<std::string> current;
-      if (change.type() == SyncEngineChange::kModify && expected) {
-        current = folder_.read(name);
-        if (!current) {
-          skipped = true;
-          ++outcome_.filesSkipped;
-          --outcome_.filesWritten;
-          continue;
-        }
-      }
-      const std::string bytes = applyFieldChanges(collection_.kind, current, change.changes());
-      result = folder_.write(name, bytes, expected, &written);
-      if (result == WriteOutcome::Written) states.items.emplace_back(name, stored(written));
-    }
-    if (result == WriteOutcome::SkippedChangedOnDisk || result == WriteOutcome::Failed) {
-      // Left for the next sync, which reads the file's new content first.
-      VTC_LOG_WARNING("%@ of %@ changed while syncing; it is left for the next sync", name,
-                      dataclass);
-      skipped = true;
-      ++outcome_.filesSkipped;
-      --outcome_.filesWritten;
-    }
-  }
-  if (pulled.isTruth) {
-    for (const auto& [name, state] : known) {
-      if (named.count(name)) continue;
-      ++outcome_.filesWritten;
-      if (options_.dryRun) continue;
-      if (folder_.remove(name, state) == WriteOutcome::Removed)
-        states.items.emplace_back(name, std::nullopt);
-      else
-        skipped = true;
-    }
-  }
-  if (options_.dryRun) return;
-  if (!folder_.flush()) {
-    // Nothing is recorded: the next sync writes these files again.
-    ++outcome_.filesSkipped;
-    return;
-  }
-  // Acknowledged only when every change reached its file: otherwise the
-  // next pull brings them again (rewriting a file with the same bytes).
-  if (skipped)
-    engine_.saveState(folderClient_, dataclass, states);
-  else
-    engine_.acknowledge(folderClient_, dataclass, pulled.anchor, states);
+void DataclassSync::writeFolder(const std::map<std::string, std::string>* origins,
+                                std::map<std::string, ItemState>* known) {
+  FolderWriter writer{folder_, engine_,           folderClient_, collection_.dataclass,
+                      origins, options_.progress, known};
+  FolderWriteResult written = writer.write();
+  outcome_.filesWritten += written.written;
+  outcome_.filesSkipped += written.skipped;
+  outcome_.writeFailures = std::move(written.failures);
+  // Every record still set aside is named, every sync, until a change to it
+  // makes it an item again.
+  outcome_.setAside.clear();
+  for (const auto& [id, item] : engine_.setAsideRecords(collection_.dataclass))
+    outcome_.setAside.push_back({item.file, item.reason, item.origin});
 }
 
 }  // namespace vtc::client

@@ -1,21 +1,31 @@
 // The sync of one dataclass between its vdir folder, this computer's
-// engine and the share: the folder's edits go into the engine; the
-// changelogs other computers committed come in (from where this computer
-// left off, or from minversion as a slow sync after a reset, for a new
-// computer or a damaged record, keeping every local edit not yet sent);
-// what this computer changed goes out as one new changelog; the engine's
-// changes for the folder go back into files. The delete guard runs before
-// anything is written anywhere; a dry run writes nothing at all.
+// engine and the share. The folder is read first (only files whose stamps
+// changed); the changelogs other computers committed come in (from where
+// this computer left off, or from minversion as a slow sync after a reset,
+// for a new computer or a damaged record); every record touched on either
+// side is decided by the merge rules (client/merge); what the share lacks
+// goes out as one changelog; then the engine stores the new truth with the
+// folder's states in one transaction, and the folder takes in what it
+// lacks. Nothing is stored before the commit succeeded, so a sync that
+// fails or is killed leaves the next one to find the same edits again.
+// The delete guard runs before anything is written anywhere; a dry run
+// writes nothing at all.
 #pragma once
 
 #include <cstdint>
 #include <functional>
+#include <map>
 #include <optional>
 #include <string>
+#include <vector>
 
 #include "VantorSyncManager/NubiloRemoteSession.h"
+#include "client/merge/IncomingFold.h"
+#include "client/merge/RecordDecision.h"
 #include "client/run/Collections.h"
 #include "client/run/ConflictStore.h"
+#include "client/run/FolderRead.h"
+#include "client/run/FolderWrite.h"
 #include "client/run/HeldLocks.h"
 #include "client/run/Progress.h"
 #include "client/run/ServerView.h"
@@ -27,10 +37,13 @@ namespace vtc::client {
 struct SyncOptions {
   bool dryRun = false;
   int maxDeletePercent = 50;
+  // The user gave --max-delete: deletes this run sends go out as confirmed,
+  // and the other computers apply them without asking again.
+  bool deletesConfirmed = false;
   std::string computerName;  // this computer, named in conflicts
   // Write this computer's whole truth as a reset commit (a damaged history
-  // is then never read again); only a computer that took in every
-  // changelog may.
+  // is then never read again); only a computer whose last sync of the
+  // dataclass succeeded and that took in every changelog may.
   bool repair = false;
   Progress* progress = nullptr;  // told how far the sync has come, when set
 };
@@ -39,16 +52,24 @@ struct DataclassOutcome {
   std::string dataclass;
   std::string mode = "none";   // "none", "fast" or "slow"
   size_t sentChanges = 0;      // committed (or, in a dry run, that would be)
-  size_t receivedChanges = 0;  // in changelogs of other computers
-  size_t filesWritten = 0;     // written or removed (or that would be)
+  size_t receivedChanges = 0;  // records the share's changes touched
+  size_t filesWritten = 0;     // written, renamed or removed (or that would be)
   size_t filesSkipped = 0;     // changed on disk meanwhile: left for the next sync
-  size_t invalidFiles = 0;
+  std::vector<std::pair<std::string, std::string>> invalidFiles;  // file, why
+  std::vector<SetAsideItem> setAside;
+  std::vector<std::string> writeFailures;  // files that could not be written, and why
   size_t conflicts = 0;
+  size_t deletesUndone = 0;     // deletes made here that an edit elsewhere undid
+  size_t confirmedDeletes = 0;  // deletes confirmed on another computer, applied here
   int64_t changelogsFetched = 0;
   int64_t bytesFetched = 0;
   bool usedServer = false;  // locked, fetched or committed
   bool compacted = false;
   std::optional<int64_t> committedIndex;
+  // Items were left over: skipped, set aside or not written.
+  bool leftOver() const {
+    return !invalidFiles.empty() || !setAside.empty() || !writeFailures.empty();
+  }
 };
 
 // The network side's client in the engine, and a folder's.
@@ -68,30 +89,42 @@ class DataclassSync {
   const DataclassOutcome& outcome() const { return outcome_; }
 
  private:
-  struct Remote;  // what the server side of one run found and decided
+  struct Local;     // the folder's side of one run
+  struct Incoming;  // the share's side
+  struct Plan;      // what the run decided
 
-  std::vector<SyncEngineChange> folderChanges(const ScanResult& scan,
-                                              const std::map<std::string, Dictionary>& lastFields);
-  void checkLocalDeletes(const ScanResult& scan, size_t known);
+  Local readLocal();
   // Locks this client and the dataclass (registering them where the share
   // lacks them); listed: whether the share's listing showed the dataclass.
   void lock(bool listed);
   void lockReleasingOwnLeftovers(const std::function<void()>& lockOperation);
   void unlock();
-  Remote fetch(bool slow, const DataclassRecord& record);
-  // lastFields: the fields of the files edited here as this computer last
-  // saw them, to tell the share's concurrent edits of the same fields.
-  void applyRemote(Remote& remote, const engine::PullResult& pending,
-                   const std::map<std::string, Dictionary>& lastFields);
-  void noteConflict(const engine::Conflict& conflict);
-  void commit(Remote& remote);
-  void compactIfLong(Remote& remote);
+  // state: what the network side has taken in.
+  Incoming fetch(bool slow, const DataclassRecord& record, const NetworkState& state,
+                 const Local& local);
+  // The digest of this computer's truth, without the records set aside:
+  // what a compaction of it writes to the share.
+  std::string truthDigestText();
+  Plan decide(Local& local, Incoming& incoming, const DataclassRecord& record);
+  void guardDeletes(const Local& local, const Plan& plan);
+  void commit(Plan& plan, DataclassRecord& record);
+  void store(Local& local, Plan& plan, const Incoming& incoming);
+  void keepConflicts(const Plan& plan);
+  // Whether the history has grown long enough to be written again whole.
+  bool compactionDue(const DataclassRecord& record);
+  // Writes the share's truth at its last changelog as a reset, with its
+  // digest in the record; incoming's state then starts from it.
+  void compact(DataclassRecord& record, Incoming& incoming);
+  // Writes this computer's whole truth as a reset (repair).
+  void repair(DataclassRecord& record);
+  void writeTruth(DataclassRecord& record, const std::vector<SyncEngineChange>& whole);
   // Sets the record right when it names a changelog below index.
   void repairLaggingRecord(int64_t index);
   // After a reset commit: every other computer takes the truth in once.
   void markOthersNeedingTruth();
-  void writeFolder();
-  engine::PushOptions pushOptions(const std::string& origin, engine::StateUpdate state = {});
+  // known: the folder's item states as stored (none: read them).
+  void writeFolder(const std::map<std::string, std::string>* origins,
+                   std::map<std::string, ItemState>* known);
   void report(const char* what, size_t done, size_t total, int64_t bytes = 0);
 
   NubiloRemoteSession& session_;

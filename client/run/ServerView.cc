@@ -1,5 +1,7 @@
 #include "client/run/ServerView.h"
 
+#include <cstdlib>
+
 #include "VantorSyncManager/NubiloException.h"
 #include "VantorSyncManager/PublicNames.h"
 #include "common/Format.h"
@@ -17,8 +19,22 @@ std::optional<int64_t> version(const Value* v) {
 }  // namespace
 
 DataclassRecord DataclassRecord::fromRecord(const Dictionary& record) {
-  DataclassRecord r{version(record.find("minversion")), version(record.find("maxversion")),
-                    record.get("status").string(), record.get("DAV:getetag").string()};
+  DataclassRecord r;
+  r.minversion = version(record.find("minversion"));
+  r.maxversion = version(record.find("maxversion"));
+  r.status = record.get("status").string();
+  r.etag = record.get("DAV:getetag").string();
+  // "<index>:<digest>"; anything else is no digest.
+  if (const Value* digest = record.find("truthdigest"); digest && digest->isString()) {
+    const std::string& text = digest->string();
+    const size_t colon = text.find(':');
+    char* end = nullptr;
+    const long long index = colon == std::string::npos ? 0 : std::strtoll(text.c_str(), &end, 10);
+    if (index > 0 && end == text.c_str() + colon) {
+      r.truthIndex = index;
+      r.truthDigest = text.substr(colon + 1);
+    }
+  }
   // A server whose collections carry no entity tag: the record's own values
   // change with every commit, reset and repair, so they stand in for one.
   if (r.etag.empty() || r.etag == kNoETag)
@@ -28,8 +44,9 @@ DataclassRecord DataclassRecord::fromRecord(const Dictionary& record) {
 }
 
 ServerView ServerView::read(NubiloRemoteSession& session) {
-  DavTransaction t = session._issuePropFindWithRetryAtPath(session.schemasPath(), kDAVOneDepth,
-                                                           session.dataclassRecordProperties());
+  DavTransaction t =
+      session._issuePropFindWithRetryAtPath(davpath::collection(session.schemasPath()),
+                                            kDAVOneDepth, session.dataclassRecordProperties());
   if (!t.isSuccessful())
     throw NubiloException(NubiloTransactionFailureException,
                           format("The dataclass records could not be read %@", t));

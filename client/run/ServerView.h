@@ -17,6 +17,10 @@ struct DataclassRecord {
   std::optional<int64_t> maxversion;
   std::string status;
   std::string etag;
+  // Written by a compaction: the changelog whose truth the reset at
+  // minversion holds, and a digest of that truth (see truthDigest).
+  std::optional<int64_t> truthIndex;
+  std::string truthDigest;
 
   static DataclassRecord fromRecord(const Dictionary& record);  // getDataclassInfo's form
 };

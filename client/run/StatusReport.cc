@@ -11,6 +11,7 @@
 #include "client/run/Collections.h"
 #include "client/run/DataclassSync.h"
 #include "client/run/ServerView.h"
+#include "client/run/SupportFolder.h"
 #include "platform/dav/DavPaths.h"
 #include "platform/dav/TesselSession.h"
 #include "platform/engine/SyncEngine.h"
@@ -83,6 +84,10 @@ std::string lastErrorKey(const std::string& dataclass) {
   return "LastError." + dataclass;
 }
 
+std::string leftOverKey(const std::string& dataclass) {
+  return "LeftOverItems." + dataclass;
+}
+
 StatusReport gatherStatus() {
   VTCPrefsCenter& prefs = VTCPrefsCenter::defaultCenter();
   StatusReport status;
@@ -119,6 +124,16 @@ StatusReport gatherStatus() {
     const Value error = prefs::PreferenceStore::shared().copyValue(
         lastErrorKey(c.dataclass), kVantorDefaultsKey, prefs::Scope::CurrentHost);
     if (error.isString()) d.lastError = error.string();
+    const Value leftOver = prefs::PreferenceStore::shared().copyValue(
+        leftOverKey(c.dataclass), kVantorDefaultsKey, prefs::Scope::CurrentHost);
+    for (const Value& line : leftOver.array())
+      if (line.isString()) d.leftOver.push_back(line.string());
+    if (engine)
+      for (const auto& [id, item] : engine->setAsideRecords(c.dataclass))
+        d.leftOver.push_back("set aside " + item.file +
+                             (item.origin.empty() ? "" : " (from " + item.origin + ")") + ": " +
+                             item.reason + "; its bytes are in " +
+                             paths::join(paths::join(supportFolder(), "SetAside"), c.dataclass));
     status.dataclasses.push_back(std::move(d));
   }
   if (!status.setUp) return status;

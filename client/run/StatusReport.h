@@ -26,6 +26,9 @@ struct DataclassStatus {
   // The share's view (when it could be asked).
   std::optional<int64_t> minversion, maxversion;
   std::optional<std::string> serverStatus;  // this computer's status there, "needstruth" say
+  // Items the last sync left over: files skipped, records set aside, files
+  // not written, each "name: why".
+  std::vector<std::string> leftOver;
 };
 
 struct ComputerStatus {
@@ -56,7 +59,9 @@ struct StatusReport {
 // Never raises for the share: a failure there is in serverError.
 StatusReport gatherStatus();
 
-// The per-host key of a dataclass's last failure sentence.
+// The per-host keys of a dataclass's last failure sentence, and of the
+// files its last sync skipped or could not write.
 std::string lastErrorKey(const std::string& dataclass);
+std::string leftOverKey(const std::string& dataclass);
 
 }  // namespace vtc::client

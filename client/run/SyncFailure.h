@@ -10,12 +10,13 @@ namespace vtc::client {
 enum class FailureKind {
   Other = 1,
   Usage = 2,
-  Login = 3,                // the server refused the member name or password
-  Unreachable = 4,          // no answer from the server
-  Busy = 5,                 // another sync of this user runs
-  DeleteRefused = 6,        // the delete guard stopped the sync
-  ServerUnsuitable = 7,     // the share lacks what syncing needs
-  UntrustedCertificate = 8  // the server's certificate is not one this computer trusts
+  Login = 3,                 // the server refused the member name or password
+  Unreachable = 4,           // no answer from the server
+  Busy = 5,                  // another sync of this user runs
+  DeleteRefused = 6,         // the delete guard stopped the sync
+  ServerUnsuitable = 7,      // the share lacks what syncing needs
+  UntrustedCertificate = 8,  // the server's certificate is not one this computer trusts
+  LeftOver = 9               // synced, but items were left over
 };
 
 class SyncFailure : public std::runtime_error {

@@ -37,17 +37,29 @@ Dictionary summaryEntry(const DataclassOutcome& o, Date start, Date end, const s
   return entry;
 }
 
-void rememberLastError(const std::string& dataclass, const std::string* sentence) {
+// For `status`: the last failure, and the files the last sync skipped or
+// could not write (records set aside are in the engine).
+void rememberOutcome(const DataclassOutcome& o, const std::string* sentence) {
   auto& store = prefs::PreferenceStore::shared();
-  store.setValue(lastErrorKey(dataclass), sentence ? Value(*sentence) : Value(), kVantorDefaultsKey,
-                 prefs::Scope::CurrentHost);
+  store.setValue(lastErrorKey(o.dataclass), sentence ? Value(*sentence) : Value(),
+                 kVantorDefaultsKey, prefs::Scope::CurrentHost);
+  Array leftOver;
+  for (const auto& [file, why] : o.invalidFiles)
+    leftOver.push_back(Value("skipped " + file + ": " + why));
+  for (const std::string& failure : o.writeFailures)
+    leftOver.push_back(Value("not written " + failure));
+  store.setValue(leftOverKey(o.dataclass), leftOver.empty() ? Value() : Value(leftOver),
+                 kVantorDefaultsKey, prefs::Scope::CurrentHost);
   store.synchronize(kVantorDefaultsKey, prefs::Scope::CurrentHost);
 }
 
 }  // namespace
 
 int RunResult::exitStatus() const {
-  return failures.empty() ? 0 : static_cast<int>(failures.front().kind);
+  if (!failures.empty()) return static_cast<int>(failures.front().kind);
+  for (const DataclassOutcome& o : outcomes)
+    if (o.leftOver()) return static_cast<int>(FailureKind::LeftOver);
+  return 0;
 }
 
 RunResult runSync(const RunRequest& request) {
@@ -99,6 +111,7 @@ RunResult runSync(const RunRequest& request) {
   SyncOptions options;
   options.dryRun = request.dryRun;
   options.maxDeletePercent = request.maxDeletePercent;
+  options.deletesConfirmed = request.deletesConfirmed;
   options.repair = request.repair;
   options.progress = request.progress;
   options.computerName = prefs.clientName().value_or("this computer");
@@ -141,7 +154,7 @@ RunResult runSync(const RunRequest& request) {
       usedServer = usedServer || outcome.usedServer;
       if (!request.dryRun) {
         prefs.setSyncSuccessful(!failure, collection.dataclass);
-        rememberLastError(collection.dataclass, failure ? &failure->sentence : nullptr);
+        rememberOutcome(outcome, failure ? &failure->sentence : nullptr);
       }
       summary.set(collection.dataclass,
                   Value(summaryEntry(outcome, start, currentClock().now(),

@@ -15,8 +15,9 @@ struct RunRequest {
   std::vector<std::string> dataclasses;  // empty: every configured one
   bool dryRun = false;
   int maxDeletePercent = 50;
-  bool periodic = false;  // started by the schedule
-  bool repair = false;    // see SyncOptions::repair
+  bool deletesConfirmed = false;  // see SyncOptions::deletesConfirmed
+  bool periodic = false;          // started by the schedule
+  bool repair = false;            // see SyncOptions::repair
   Progress* progress = nullptr;
 };
 
@@ -32,7 +33,8 @@ struct RunResult {
   // Sentences the user is told whatever the outcome (a password that went
   // unencrypted over the network).
   std::vector<std::string> warnings;
-  // 0, or the exit status of the first failure.
+  // 0, the exit status of the first failure, or 9 when every dataclass
+  // synced but items were left over (skipped, set aside, not written).
   int exitStatus() const;
 };
 

@@ -11,7 +11,6 @@
 #include <stdexcept>
 
 #include "client/stores/ItemFiles.h"
-#include "client/stores/ItemLayout.h"
 #include "common/Logging.h"
 #include "platform/fs/LocalPaths.h"
 
@@ -27,10 +26,6 @@ std::runtime_error unreadableFolder(const std::string& folder, int error) {
   if (error == ENOENT) return std::runtime_error(format("The folder %@ does not exist.", folder));
   if (error == ENOTDIR) return std::runtime_error(format("%@ is not a folder.", folder));
   return std::runtime_error(format("The folder %@ cannot be read: %s.", folder, strerror(error)));
-}
-
-const char* formatName(ItemKind kind) {
-  return kind == ItemKind::Contacts ? "vCard" : "iCalendar item";
 }
 
 // The names of the folder's item files, sorted. A listing cut short by an
@@ -50,11 +45,11 @@ std::vector<std::string> itemFileNames(DIR* dir, const std::string& folder, Item
   return names;
 }
 
-// One file of a scan, in name order: its new state goes to result.states,
-// its fields to added or changed when they are new. `known` is its state
-// from before, if any; keepsKnownState() is true when that state is to be
-// kept as it is (the file is unchanged, or unusable and so skipped), which
-// the caller moves into result.states.
+// One file of a scan, in name order: its state goes to result.states and,
+// when it was read, the file to result.read. `known` is its state from
+// before, if any; keepsKnownState() is true when that state is to be kept
+// as it is (the file is unchanged, or unusable and so skipped), which the
+// caller moves into result.states.
 class FileScan {
  public:
   FileScan(const std::string& folder, ItemKind kind, int dirFd, ScanResult& result)
@@ -70,22 +65,24 @@ class FileScan {
     if (known && known->sameFileAs(fileState(st))) return true;
 
     FileDescriptor file(::openat(dirFd_, name.c_str(), O_RDONLY | O_CLOEXEC));
-    std::optional<std::string> bytes;
+    auto item = std::make_unique<ItemFile>();
+    bool ok = false;
     // The state of what is read: a change after this fstat shows at the next scan.
-    if (file.valid() && ::fstat(file.get(), &st) == 0) bytes = readWhole(file.get());
-    if (!bytes) return errno != ENOENT && skip(name, known, strerror(errno));
+    if (file.valid() && ::fstat(file.get(), &st) == 0) {
+      if (auto bytes = readWhole(file.get())) {
+        item->bytes = std::move(*bytes);
+        ok = true;
+      }
+    }
+    if (!ok) return errno != ENOENT && skip(name, known, strerror(errno));
     ++result_.filesRead;
     std::string problem;
-    std::optional<ItemLayout> layout = readItemLayout(kind_, *bytes, &problem);
-    if (!layout)
-      return skip(name, known, format("it is not a valid %s (%@)", formatName(kind_), problem));
-    ItemState state = fileState(st);
-    state.fields = std::move(layout->fields);
-    if (!known)
-      result_.added.emplace_hint(result_.added.end(), name, state.fields);
-    else if (!(known->fields == state.fields))
-      result_.changed.emplace_hint(result_.changed.end(), name, state.fields);
-    result_.states.emplace_hint(result_.states.end(), name, std::move(state));
+    std::optional<ItemText> text = readItemText(kind_, item->bytes, &problem);
+    if (!text) return skip(name, known, problem);
+    item->text = std::move(*text);
+    item->state = fileState(st);
+    result_.states.emplace_hint(result_.states.end(), name, item->state);
+    result_.read.emplace_hint(result_.read.end(), name, std::move(item));
     return false;
   }
 
@@ -99,7 +96,7 @@ class FileScan {
   // it is neither deleted nor added again once it is fixed.
   bool skip(const std::string& name, const ItemState* known, const std::string& why) {
     VTC_LOG_WARNING("Skipping %@: %@", paths::join(folder_, name), why);
-    result_.invalid.push_back(name);
+    result_.invalid.emplace_back(name, why);
     return known != nullptr;
   }
 };
@@ -120,7 +117,7 @@ ScanResult VdirCollection::scan(std::map<std::string, ItemState> known) const {
   ScanResult result;
   FileScan files(folder_, kind_, ::dirfd(dir.get()), result);
   // Names and known states both in order: one walk matches them. A state
-  // that still holds moves over whole, without a copy of its fields.
+  // that still holds moves over whole.
   auto before = known.begin();
   for (const std::string& name : itemFileNames(dir.get(), folder_, kind_)) {
     while (before != known.end() && before->first < name) ++before;
@@ -141,6 +138,11 @@ std::optional<std::string> VdirCollection::read(const std::string& name) const {
   FileDescriptor file(::open(paths::join(folder_, name).c_str(), O_RDONLY | O_CLOEXEC));
   if (!file.valid()) return std::nullopt;
   return readWhole(file.get());
+}
+
+bool ItemState::sameFileAs(const ItemState& other) const {
+  return size == other.size && modifiedNanoseconds == other.modifiedNanoseconds &&
+         changedNanoseconds == other.changedNanoseconds && inode == other.inode;
 }
 
 std::optional<ItemState> VdirCollection::stat(const std::string& name) const {

@@ -1,13 +1,13 @@
 // A vdir collection: a folder whose items are one file each (".vcf" or
-// ".ics"), named by the item's identity; every other file in the folder
-// (such as "displayname" or "color") is the user's and is left alone.
+// ".ics"); every other file in the folder (such as "displayname" or
+// "color") is left alone.
 //
 // A scan stats every item file and reads only those whose size, change time
-// or inode differ from what was known; it reports the items added, changed
-// (their fields differ from the known ones) and deleted. A file rewritten
-// in place at the same size within one tick of the file system's clock
-// after it was read goes unseen until it changes again; programs that save
-// by renaming a new file into place always give it a new inode.
+// or inode differ from what was known, handing back their bytes cut into
+// units, and the known items whose files are gone. A file rewritten in
+// place at the same size within one tick of the file system's clock after
+// it was read goes unseen until it changes again; programs that save by
+// renaming a new file into place always give it a new inode.
 //
 // Writes are atomic (a temporary file in the folder, fsync, rename, fsync
 // of the folder) and never overwrite a file that changed since it was last
@@ -17,41 +17,47 @@
 
 #include <cstdint>
 #include <map>
+#include <memory>
 #include <optional>
 #include <string>
 #include <vector>
 
 #include "VantorSyncManager/Value.h"
+#include "client/items/ItemText.h"
 #include "client/stores/VdirItem.h"
 
 namespace vtc::client {
 
 // What the sync knows of one item file: how it looked on disk when last
-// read or written, and its fields then.
+// read or written, and the record it holds.
 struct ItemState {
   int64_t size = 0;
   int64_t modifiedNanoseconds = 0;  // st_mtim
   int64_t changedNanoseconds = 0;   // st_ctim
   uint64_t inode = 0;
-  Dictionary fields;
+  std::string record;  // the identity of the item it holds
 
-  // As a property-list value, for storage, and back (none for a bad value).
-  Value toValue() const;
-  static std::optional<ItemState> fromValue(const Value& value);
   bool sameFileAs(const ItemState& other) const;  // size, times and inode
   friend bool operator==(const ItemState&, const ItemState&) = default;
 };
 
+// A file the scan read: its bytes, cut into units (views into the bytes,
+// which stay where they are), and its state when read.
+struct ItemFile {
+  std::string bytes;
+  ItemText text;
+  ItemState state;
+};
+
 struct ScanResult {
-  // File name -> fields, for items new to the known set and items whose
-  // fields changed.
-  std::map<std::string, Dictionary> added;
-  std::map<std::string, Dictionary> changed;
+  // Files new to the known set, or whose stamps changed, that are items.
+  std::map<std::string, std::unique_ptr<ItemFile>> read;
   std::vector<std::string> deleted;  // known items whose files are gone
-  std::vector<std::string> invalid;  // files that are not valid items (skipped, Warning logged)
-  // The state of every valid item file now present (known ones included):
-  // what the sync stores once the scan's changes are safely in the engine.
-  // A known file that is now invalid or unreadable keeps its known state.
+  // Files that are not items (skipped, Warning logged): name and why.
+  std::vector<std::pair<std::string, std::string>> invalid;
+  // The state of every item file now present: the known one where the file
+  // is unchanged (or now unusable, so that it is neither deleted nor added
+  // again once it is fixed), else the state it was read in.
   std::map<std::string, ItemState> states;
   size_t filesRead = 0;  // how many item files had to be read
 };
@@ -70,15 +76,14 @@ class VdirCollection {
   // Compares the folder with the known states. Invalid files are reported,
   // never counted as deleted or changed. An unreadable folder raises
   // std::runtime_error (never "everything deleted"). Known states handed
-  // over with std::move are not copied: those that still hold move into
-  // the result.
+  // over with std::move are not copied.
   ScanResult scan(std::map<std::string, ItemState> known) const;
 
   // Writes an item's bytes atomically, if the file is still as `expected`
   // says (none: the file must not exist). On Written, *state is the new
-  // state (fields from the bytes written). Failed: the bytes are not a valid
-  // item, or a step failed (logged as an Error); the file may then already
-  // hold the new bytes, which the next scan will see. A new file is private
+  // state (its record left empty). Failed: the bytes are no item, or a step
+  // failed (logged as an Error, errno kept); the file may then already hold
+  // the new bytes, which the next scan will see. A new file is private
   // (mode 0600); a replaced one keeps its mode. A name that is not an item
   // file name of this kind raises std::invalid_argument.
   WriteOutcome write(const std::string& name, const std::string& bytes,

@@ -14,8 +14,8 @@
 #include <cstring>
 #include <stdexcept>
 
+#include "client/items/ItemText.h"
 #include "client/stores/ItemFiles.h"
-#include "client/stores/ItemLayout.h"
 #include "client/stores/VdirCollection.h"
 #include "common/Logging.h"
 #include "common/Uuid.h"
@@ -57,8 +57,7 @@ WriteOutcome VdirCollection::write(const std::string& name, const std::string& b
   requireItemName(name, kind_);
   std::string path = paths::join(folder_, name);
   std::string problem;
-  std::optional<ItemLayout> layout = readItemLayout(kind_, bytes, &problem);
-  if (!layout) {
+  if (!readItemText(kind_, bytes, &problem)) {
     VTC_LOG_ERROR("Not writing %@: the new bytes are not a valid item (%@)", path, problem);
     return WriteOutcome::Failed;
   }
@@ -116,10 +115,7 @@ WriteOutcome VdirCollection::write(const std::string& name, const std::string& b
   // Until the folder is flushed, a crash can bring back the old file; the
   // caller must then not take the new state as written.
   if (!deferFlushes_ && ::fsync(dir.get()) != 0) return failed("flushing the folder");
-  if (state) {
-    *state = fileState(st);
-    state->fields = std::move(layout->fields);
-  }
+  if (state) *state = fileState(st);
   return WriteOutcome::Written;
 }
 

@@ -49,7 +49,10 @@ class VSM_EXPORT NubiloRemoteSession {
       const vtc::Dictionary& configuration);
 
   // initWithVTMemberAccount:configuration: validates the credentials (with
-  // retries), opens the WebDAV session and finds or creates the sync area.
+  // retries), opens the WebDAV session and finds or creates the sync area
+  // (unless "create_sync_paths" is false: a caller that looks first). Every
+  // absolute path of the layout (the credential check, "sync_path", the
+  // reset's trash) lies under "share_root", the server's root by default.
   // Raises NubiloLoginFailureException, NubiloNetworkFailureException or
   // NubiloTransactionFailureException; std::invalid_argument when the
   // configuration lacks "sync_path" or "host_name". No partly initialised
@@ -217,6 +220,9 @@ class VSM_EXPORT NubiloRemoteSession {
   // Read access for callers and tests.
   TesselSession& tesselSession() { return *_TesselSession; }
   const vtc::Dictionary& configuration() const { return _configuration; }
+  // The path on the server where the share begins: "/", or one without a
+  // trailing "/" ("/dav").
+  const std::string& shareRoot() const { return _shareRoot; }
   const std::string& syncPath() const { return _syncPath; }
   const std::string& clientsPath() const { return _clientsPath; }
   const std::string& schemasPath() const { return _schemasPath; }
@@ -236,6 +242,9 @@ class VSM_EXPORT NubiloRemoteSession {
   std::string clientPath(const std::string& guid) const;
   std::string dataclassLockPath(const std::string& dataclass) const;
   std::string dataclassPath(const std::string& dataclass) const;
+  // An absolute path of the layout ("/Web/...") as a path on the server,
+  // under the share root.
+  std::string pathInShare(const std::string& absolute) const;
   vtc::Dictionary recordFromProperties(const vtc::Dictionary& properties) const;
   // Client records at path (depth 0: the record; depth 1: the clients
   // collection's members). Asked for with all properties; where that answer
@@ -249,6 +258,7 @@ class VSM_EXPORT NubiloRemoteSession {
   std::shared_ptr<MemberAccount> _vantorAccount;
   std::unique_ptr<TesselSession> _TesselSession;
   vtc::Dictionary _configuration;
+  std::string _shareRoot;
   std::string _syncPath;
   std::string _clientsPath;
   std::string _schemasPath;

@@ -159,7 +159,7 @@ vtc::Dictionary NubiloRemoteSession::getClientInfo() {
 }
 
 vtc::Array NubiloRemoteSession::getAllClientInfo() {
-  DavTransaction t = findClientRecords(_clientsPath, kDAVOneDepth);
+  DavTransaction t = findClientRecords(vtc::davpath::collection(_clientsPath), kDAVOneDepth);
   vtc::Array records;
   if (!t.isSuccessful()) return records;
   for (const auto& [href, props] : t.result().dictionary()) {

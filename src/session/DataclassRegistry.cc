@@ -25,17 +25,15 @@ vtc::Dictionary NubiloRemoteSession::recordFromProperties(const vtc::Dictionary&
 
 std::vector<std::string> NubiloRemoteSession::dataclassRecordProperties() const {
   std::vector<std::string> names;
-  for (const char* local :
-       {"displayname", "dataclassname", "minversion", "maxversion", "status", "lastsync"})
+  for (const char* local : {"displayname", "dataclassname", "minversion", "maxversion", "status",
+                            "lastsync", "truthdigest"})
     names.push_back(_syncNamespace + local);
   names.push_back("DAV:getetag");
   return names;
 }
 
 vtc::Dictionary NubiloRemoteSession::getDataclassInfo(const std::string& dataclass) {
-  std::string path = stringByAppendingTesselPathComponent(
-                         stringByAppendingTesselPathComponent(_syncPath, "Schemas"), dataclass) +
-                     "/";
+  const std::string path = vtc::davpath::collection(dataclassPath(dataclass));
   _dataclassesMet.insert(dataclass);
   const std::vector<std::string> properties = dataclassRecordProperties();
   DavTransaction t;
@@ -71,8 +69,8 @@ vtc::Dictionary NubiloRemoteSession::getDataclassInfo(const std::string& datacla
 }
 
 vtc::Array NubiloRemoteSession::getAllDataclassInfo() {
-  DavTransaction t =
-      _issuePropFindWithRetryAtPath(_schemasPath, kDAVOneDepth, dataclassRecordProperties(), false);
+  DavTransaction t = _issuePropFindWithRetryAtPath(
+      vtc::davpath::collection(_schemasPath), kDAVOneDepth, dataclassRecordProperties(), false);
   vtc::Array records;
   if (!t.isSuccessful()) return records;
   for (const auto& [href, props] : t.result().dictionary()) {
@@ -92,10 +90,8 @@ std::vector<std::string> NubiloRemoteSession::dataclassNames() {
 }
 
 void NubiloRemoteSession::dumpDataclasses() {
-  std::string path =
-      stringByAppendingTesselPathComponent(_configuration.get("sync_path").string(), "Schemas");
-  DavTransaction t =
-      _issuePropFindWithRetryAtPath(path, kDAVOneDepth, dataclassRecordProperties(), false);
+  DavTransaction t = _issuePropFindWithRetryAtPath(
+      vtc::davpath::collection(_schemasPath), kDAVOneDepth, dataclassRecordProperties(), false);
   if (!t.isSuccessful()) return;
   for (const auto& [href, props] : t.result().dictionary()) {
     std::fprintf(stderr, "%s\n", href.c_str());

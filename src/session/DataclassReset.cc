@@ -8,6 +8,7 @@
 #include "common/Clock.h"
 #include "common/Logging.h"
 #include "common/Uuid.h"
+#include "platform/dav/DavPaths.h"
 #include "platform/dav/TesselSession.h"
 
 namespace {
@@ -23,18 +24,21 @@ bool NubiloRemoteSession::unregisterDataclass(const std::string& dataclass) {
   setStatus("needstruth", _configuration.get("guid").string(), dataclass);
   unlockDataclass(dataclass);
   lockDataclasses();
-  DavTransaction removal = _TesselSession->deleteResourceAtPath(dataclassPath(dataclass));
+  DavTransaction removal =
+      _TesselSession->deleteResourceAtPath(vtc::davpath::collection(dataclassPath(dataclass)));
   unlockDataclasses();
   return removal.isSuccessful();
 }
 
 bool NubiloRemoteSession::resetDataclass(const std::string& dataclass) {
-  std::string path = dataclassPath(dataclass);
+  // Collections, named as such: with their trailing "/".
+  const std::string path = vtc::davpath::collection(dataclassPath(dataclass));
   relockDataclass(dataclass);
-  std::string trashTarget =
-      stringByAppendingTesselPathComponent(kTrash, dataclass + vtc::makeUUIDString());
-  if (!_issuePropFindWithRetryAtPath(kTrash, kDAVZeroDepth, {kNBLastModified}).isSuccessful())
-    _TesselSession->makeCollectionAtPath(kTrash, true);
+  const std::string trash = pathInShare(kTrash);
+  const std::string trashTarget = vtc::davpath::collection(stringByAppendingTesselPathComponent(
+      vtc::davpath::canonical(trash), dataclass + vtc::makeUUIDString()));
+  if (!_issuePropFindWithRetryAtPath(trash, kDAVZeroDepth, {kNBLastModified}).isSuccessful())
+    _TesselSession->makeCollectionAtPath(trash, true);
 
   lockClients();
   try {
@@ -78,10 +82,11 @@ bool NubiloRemoteSession::resetDataclass(const std::string& dataclass) {
       }
     }
     setOtherClientStatus("needstruth", dataclass);
-    if (_TesselSession->_issuePropFindAtPath(kObsoleteTrash, kDAVZeroDepth, {kNBLastModified})
+    const std::string obsolete = pathInShare(kObsoleteTrash);
+    if (_TesselSession->_issuePropFindAtPath(obsolete, kDAVZeroDepth, {kNBLastModified})
             .isSuccessful()) {
       VTC_LOG_INFO("Obsolete .TWR collection found while resetting dataclass, performing cleanup");
-      _TesselSession->deleteResourceAtPath(kObsoleteTrash);
+      _TesselSession->deleteResourceAtPath(obsolete);
     }
   } catch (const std::exception& e) {
     VTC_LOG_WARNING("exception %@ raised wile trying to reset dataclass %@", e.what(), dataclass);

@@ -1,8 +1,8 @@
 // Whether a dataclass changed on the server since the caller last looked.
 #include "VantorSyncManager/NubiloRemoteSession.h"
 #include "VantorSyncManager/PublicNames.h"
-#include "VantorSyncManager/StringAdditions.h"
 #include "common/Logging.h"
+#include "platform/dav/DavPaths.h"
 
 namespace {
 
@@ -16,9 +16,7 @@ std::string_view withoutWeakPrefix(std::string_view tag) {
 
 bool NubiloRemoteSession::eTagChangedForDataclass(const std::string& dataclass,
                                                   const std::string& previousETag) {
-  std::string path = stringByAppendingTesselPathComponent(
-                         stringByAppendingTesselPathComponent(_syncPath, "Schemas"), dataclass) +
-                     "/";
+  const std::string path = vtc::davpath::collection(dataclassPath(dataclass));
   DavTransaction t = _issuePropFindWithRetryAtPath(path, kDAVZeroDepth, {"DAV:getetag"});
   if (!t.isSuccessful()) return true;
   const vtc::Dictionary& result = t.result().dictionary();

@@ -10,6 +10,7 @@
 #include "common/Clock.h"
 #include "common/Logging.h"
 #include "common/Uuid.h"
+#include "platform/dav/DavPaths.h"
 #include "platform/dav/TesselSession.h"
 
 namespace {
@@ -24,6 +25,13 @@ const std::string& requiredString(const vtc::Dictionary& configuration, const ch
     throw std::invalid_argument(std::string("NubiloRemoteSession: the configuration has no \"") +
                                 key + "\"");
   return v.string();
+}
+
+// "share_root" as "/" or a path without a trailing "/".
+std::string shareRootOf(const vtc::Dictionary& configuration) {
+  std::string root = vtc::davpath::canonical(configuration.get("share_root").string());
+  if (root.empty()) return "/";
+  return root.front() == '/' ? root : "/" + root;
 }
 
 // A first-run configuration has no time-out yet; without one a dead server
@@ -81,9 +89,11 @@ NubiloRemoteSession::NubiloRemoteSession(std::shared_ptr<MemberAccount> account,
   // on the share that the configuration names, at its root, so that the
   // credentials then go with every request to the share (the trash of a
   // reset lies outside the sync area) instead of being asked for again.
+  _shareRoot = shareRootOf(_configuration);
   _vantorAccount->setCertificateTrust(_configuration.get("tls_ca_file").string(),
                                       _configuration.get("tls_pinned_certificate").string());
-  _vantorAccount->setServer(scheme, hostName, port, "/", readTimeout(_configuration));
+  _vantorAccount->setServer(scheme, hostName, port, vtc::davpath::collection(_shareRoot),
+                            readTimeout(_configuration));
   DavTransaction check = _vantorAccount->credentialsAreValid();
 
   _lockDuration = _configuration.get("lock_duration_seconds").integer();
@@ -123,7 +133,7 @@ NubiloRemoteSession::NubiloRemoteSession(std::shared_ptr<MemberAccount> account,
   _TesselSession->setIsSynchronous(true);
   _TesselSession->_setReadTimeOut(readTimeout(_configuration));
 
-  _syncPath = syncPath;
+  _syncPath = pathInShare(syncPath);
   _clientsPath = stringByAppendingTesselPathComponent(_syncPath, "Clients");
   _schemasPath = stringByAppendingTesselPathComponent(_syncPath, "Schemas");
   _syncNamespace = _configuration.get("sync_namespace").string();
@@ -138,7 +148,12 @@ NubiloRemoteSession::NubiloRemoteSession(std::shared_ptr<MemberAccount> account,
                   stringByXMLQuoting(vtc::textOf(_configuration.get("ClientName"))), "%@");
 
   // A failure here surfaces at the first request that needs the collections.
-  createSyncPaths();
+  const vtc::Value& create = _configuration.get("create_sync_paths");
+  if (create.isNone() || create.boolean()) createSyncPaths();
+}
+
+std::string NubiloRemoteSession::pathInShare(const std::string& absolute) const {
+  return _shareRoot == "/" ? absolute : _shareRoot + absolute;
 }
 
 NubiloRemoteSession::~NubiloRemoteSession() {

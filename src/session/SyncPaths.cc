@@ -3,6 +3,7 @@
 #include "VantorSyncManager/NubiloRemoteSession.h"
 #include "VantorSyncManager/PublicNames.h"
 #include "common/Logging.h"
+#include "platform/dav/DavPaths.h"
 #include "platform/dav/TesselSession.h"
 
 namespace {
@@ -36,12 +37,14 @@ bool NubiloRemoteSession::createSyncPaths() {
 }
 
 bool NubiloRemoteSession::removeSyncPaths() {
-  std::string parent = deletingLastPathComponent(_syncPath);
+  // Collections, named as such: with their trailing "/".
+  std::string parent = vtc::davpath::collection(deletingLastPathComponent(_syncPath));
   DavTransaction lock = _TesselSession->lockResourceAtPath(parent);
   if (!lock.isSuccessful())
     throw NubiloException(NubiloLockFailureException,
                           vtc::format("Resource is already locked, %@", parent));
-  DavTransaction removal = _TesselSession->deleteResourceAtPath(_syncPath);
+  DavTransaction removal =
+      _TesselSession->deleteResourceAtPath(vtc::davpath::collection(_syncPath));
   _TesselSession->unlockResourceAtPath(parent);  // whatever the deletion gave; result ignored
   return removal.isSuccessful();
 }

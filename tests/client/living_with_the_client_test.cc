@@ -127,8 +127,8 @@ TEST_F(Living, ARestoredConflictTakesEffectOnTheOtherComputerAndADroppedOneIsGon
 TEST_F(Living, EachFailureIsOnePlainSentenceWithAnExitStatusOfItsKind) {
   // A refused login says how to store the right password, once.
   Computer wrong{"Mac W"};
-  Computer::Result login =
-      wrong.run({"setup", url, "--user", ApacheShare::kUser, "--password-command", "printf nope"});
+  Computer::Result login = wrong.run({"setup", url, "--user", ApacheShare::kUser,
+                                      "--password-command", "printf nope", "--allow-insecure"});
   EXPECT_EQ(login.status, 3);
   EXPECT_THAT(login.err, HasSubstr("refused the password for alice; store the right one with "
                                    "`nubilosyncclient setup`"));
@@ -140,8 +140,9 @@ TEST_F(Living, EachFailureIsOnePlainSentenceWithAnExitStatusOfItsKind) {
   // An unreachable server names its address.
   Computer away{"Mac U"};
   const int closed = vtc::local::freeLoopbackPort();
-  Computer::Result unreachable = away.run({"setup", "http://127.0.0.1:" + std::to_string(closed),
-                                           "--user", "alice", "--password-command", "printf x"});
+  Computer::Result unreachable =
+      away.run({"setup", "http://127.0.0.1:" + std::to_string(closed), "--user", "alice",
+                "--password-command", "printf x", "--allow-insecure"});
   EXPECT_EQ(unreachable.status, 4);
   EXPECT_THAT(unreachable.err,
               HasSubstr("Cannot reach the server at http://127.0.0.1:" + std::to_string(closed)));
@@ -164,8 +165,9 @@ TEST_F(Living, APasswordFromStandardInputGoesToTheSecretServiceAndNowhereElse) {
   vtc::test::SessionBus bus;
   bus.startKeyring();
   Computer c{"Mac S"};
-  Computer::Result r = c.run({"setup", url, "--user", ApacheShare::kUser, "--password-stdin"},
-                             std::string(ApacheShare::kPassword) + "\n");
+  Computer::Result r =
+      c.run({"setup", url, "--user", ApacheShare::kUser, "--password-stdin", "--allow-insecure"},
+            std::string(ApacheShare::kPassword) + "\n");
   ASSERT_EQ(r.status, 0) << r.err;
   ASSERT_EQ(c.run({"add", "contacts", c.contacts()}).status, 0);
   Computer::write(c.contacts() + "/ann.vcf", card("ann", "Ann", "1"));

@@ -39,13 +39,24 @@ struct ScopedEnv {
 
 using SessionSetup = vtc::test::ShareTest;
 using SyncArea = vtc::test::OnEachServer<vtc::test::ShareTest>;
-INSTANTIATE_TEST_SUITE_P(Servers, SyncArea, vtc::test::kEachServer, vtc::test::serverName);
+INSTANTIATE_TEST_SUITE_P(Servers, SyncArea,
+                         testing::Values(vtc::local::ShareKind::Apache,
+                                         vtc::local::ShareKind::Sabre,
+                                         vtc::local::ShareKind::SabreUnderPath),
+                         vtc::test::serverName);
 
+// On a share that begins below the server's root, the whole layout lies
+// under that root.
 TEST_P(SyncArea, CreatesTheSyncAreaNotesTheRespondingServerAndRemovesTheArea) {
+  // A session that only looks changes nothing.
+  openSession(vtc::Dictionary{{"create_sync_paths", false}});
+  EXPECT_FALSE(std::filesystem::exists(share.diskPath("/Library")));
+
   auto session = openSession();
   std::string sync = ApacheShare::kSyncPath;
-  EXPECT_EQ(session->clientsPath(), sync + "/Clients");
-  EXPECT_EQ(session->schemasPath(), sync + "/Schemas");
+  EXPECT_EQ(session->shareRoot(), share.shareRoot().empty() ? "/" : share.shareRoot());
+  EXPECT_EQ(session->clientsPath(), share.shareRoot() + sync + "/Clients");
+  EXPECT_EQ(session->schemasPath(), share.shareRoot() + sync + "/Schemas");
   EXPECT_EQ(session->respondingServer(), share.respondingServer());
   EXPECT_EQ(logged.count("Info", std::string("Responding server: ") + share.respondingServer()),
             1u);

@@ -55,7 +55,8 @@ class Computer {
 
   // setup against the share with a password command that reads a file of
   // the home (the password is on no command line), then the two folders.
-  // More arguments go to setup.
+  // More arguments go to setup; --allow-insecure is added for a plain
+  // http:// share or mqtt:// push server.
   void join(const std::string& url, const std::string& user, const std::string& password,
             const std::vector<std::string>& moreSetup = {}) const;
 

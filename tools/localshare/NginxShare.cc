@@ -26,7 +26,7 @@ NginxShare::NginxShare() : Share("vsm-nginx") {
   if (::geteuid() == 0) c << "user www-data;\n";
   c << "events { worker_connections 64; }\n"
     << "http {\n"
-    << "  log_format share '$remote_port $request_method $status';\n"
+    << "  log_format share '$remote_port $request_method $status $uri';\n"
     << "  access_log " << root_ << "/logs/access.log share;\n";
   for (const char* temp : {"client_body", "proxy", "fastcgi", "uwsgi", "scgi"})
     c << "  " << temp << "_temp_path " << root_ << "/var/body;\n";

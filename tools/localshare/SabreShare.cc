@@ -20,6 +20,7 @@ std::string phpString(const std::string& text) {
 }  // namespace
 
 SabreShare::SabreShare(Options options) : Share("vsm-sabre") {
+  shareRoot_ = options.basePath;
   writeServer(options);
   // Several workers, as a real deployment answers requests side by side.
   start({"env", "PHP_CLI_SERVER_WORKERS=4", "php", "-d", "display_errors=stderr", "-d",
@@ -38,7 +39,8 @@ void SabreShare::writeServer(const Options& options) {
       << "$root = " << phpString(root_) << ";\n"
       << "register_shutdown_function(function () use ($root) {\n"
       << "  file_put_contents($root . '/logs/access.log', $_SERVER['REMOTE_PORT'] . ' ' .\n"
-      << "    $_SERVER['REQUEST_METHOD'] . ' ' . http_response_code() . \"\\n\",\n"
+      << "    $_SERVER['REQUEST_METHOD'] . ' ' . http_response_code() . ' ' .\n"
+      << "    rawurldecode(parse_url($_SERVER['REQUEST_URI'], PHP_URL_PATH)) . \"\\n\",\n"
       << "    FILE_APPEND | LOCK_EX);\n"
       << "});\n"
       << "class ShareUser extends Sabre\\DAV\\Auth\\Backend\\AbstractBasic {\n"
@@ -60,7 +62,7 @@ void SabreShare::writeServer(const Options& options) {
       << "  . 'timeout integer, created integer, token text, scope integer, depth integer, '\n"
       << "  . 'uri text)');\n"
       << "$server = new Sabre\\DAV\\Server(new Sabre\\DAV\\FSExt\\Directory($root . '/dav'));\n"
-      << "$server->setBaseUri('/');\n"
+      << "$server->setBaseUri(" << phpString(options.basePath + "/") << ");\n"
       << "$server->addPlugin(new Sabre\\DAV\\Auth\\Plugin(new ShareUser(), 'Tessel'));\n"
       << "$locks = new Sabre\\DAV\\Locks\\Backend\\PDO($pdo);\n"
       << "$server->addPlugin(new "

@@ -3,6 +3,8 @@
 // (".sabredav"), locks in an SQLite database; each answer says which worker
 // process gave it in the access log. With enforceLocks off it grants and
 // lists locks but lets anyone write and lock over them: a server to refuse.
+// With a base path the share begins there (its setBaseUri), as a hosted
+// account's WebDAV root does; the server's root is then no share at all.
 #pragma once
 
 #include "localshare/Share.h"
@@ -13,6 +15,7 @@ class SabreShare : public Share {
  public:
   struct Options {
     bool enforceLocks = true;
+    std::string basePath = "";  // or a path without a trailing "/"
   };
 
   SabreShare() : SabreShare(Options{}) {}

@@ -9,6 +9,7 @@
 #include <filesystem>
 #include <fstream>
 #include <iterator>
+#include <sstream>
 #include <stdexcept>
 #include <thread>
 #include <utility>
@@ -92,13 +93,18 @@ std::set<std::string> Share::members(const std::string& serverPath) const {
   return names;
 }
 
-std::string Share::url(const std::string& serverPath) const {
+std::string Share::url(const std::string& sharePath) const {
   return std::string(tls_ ? "https" : "http") + "://127.0.0.1:" + std::to_string(port_) +
-         serverPath;
+         shareRoot_ + sharePath;
+}
+
+std::vector<std::string> Share::setupArguments() const {
+  if (tls_) return {"--ca-file", caFile()};
+  return {"--allow-insecure"};
 }
 
 Dictionary Share::configuration() const {
-  return Dictionary{
+  Dictionary c{
       {"host_scheme", Value(tls_ ? "https" : "http")},
       {"host_name", Value("127.0.0.1")},
       {"host_port", Value(port_)},
@@ -114,6 +120,10 @@ Dictionary Share::configuration() const {
       {"ClientGuid", Value("11111111-2222-3333-4444-555555555555")},
       {"ClientName", Value("Test Machine")},
   };
+  if (!shareRoot_.empty()) c.set("share_root", Value(shareRoot_));
+  // Plain HTTP on loopback: the password crosses no network.
+  if (!tls_) c.set("allow_insecure", Value(true));
+  return c;
 }
 
 std::vector<AccessEntry> Share::accessEntries() const {
@@ -128,18 +138,51 @@ std::vector<AccessEntry> Share::accessEntries() const {
   }
   std::vector<AccessEntry> out;
   std::ifstream in(path);
-  // A line a request: client port, method, status ("54321 PUT 201").
-  for (AccessEntry e; in >> e.clientPort >> e.method >> e.status;) out.push_back(e);
+  // A line a request: client port, method, status and the path, which may
+  // hold blanks ("54321 PUT 201 /sync/a b.clog").
+  for (std::string line; std::getline(in, line);) {
+    std::istringstream fields(line);
+    AccessEntry e;
+    if (!(fields >> e.clientPort >> e.method >> e.status)) continue;
+    std::getline(fields >> std::ws, e.path);
+    if (!shareRoot_.empty() && e.path.starts_with(shareRoot_))
+      e.path = e.path.substr(shareRoot_.size());
+    out.push_back(e);
+  }
   return out;
 }
 
 std::unique_ptr<Share> startShare(ShareKind kind) {
-  if (kind == ShareKind::Sabre) return std::make_unique<SabreShare>();
+  switch (kind) {
+    case ShareKind::Apache:
+      break;
+    case ShareKind::Sabre:
+      return std::make_unique<SabreShare>();
+    case ShareKind::GuideApache:
+      return std::make_unique<ApacheShare>(ApacheShare::Options{.site = ApacheShare::Site::Guide});
+    case ShareKind::GuideApacheAlias:
+      return std::make_unique<ApacheShare>(
+          ApacheShare::Options{.site = ApacheShare::Site::GuideAlias});
+    case ShareKind::SabreUnderPath:
+      return std::make_unique<SabreShare>(SabreShare::Options{.basePath = kHostedBasePath});
+  }
   return std::make_unique<ApacheShare>();
 }
 
 const char* shareKindName(ShareKind kind) {
-  return kind == ShareKind::Sabre ? "SabreDAV" : "Apache";
+  switch (kind) {
+    case ShareKind::Apache:
+      break;
+    case ShareKind::Sabre:
+      return "SabreDAV";
+    case ShareKind::GuideApache:
+      return "DebianApache";
+    case ShareKind::GuideApacheAlias:
+      return "DebianApacheAlias";
+    case ShareKind::SabreUnderPath:
+      return "SabreDAVUnderAPath";
+  }
+  return "Apache";
 }
 
 }  // namespace vtc::local

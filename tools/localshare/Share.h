@@ -1,9 +1,11 @@
 // A private WebDAV share for one test (or the demo, or a benchmark): a real
 // server with its own configuration under a temporary folder, one Basic-auth
-// user, locks, and an access log that records the client port of each
-// request. Started in the foreground on a free 127.0.0.1 port, stopped by its
-// PID. ApacheShare and SabreShare are the two servers the sync runs on;
-// NginxShare is one it refuses.
+// user, locks, and an access log that records the client port, method,
+// status and path of each request. Started in the foreground on a free
+// 127.0.0.1 port, stopped by its PID. ApacheShare and SabreShare are the two
+// servers the sync runs on; NginxShare is one it refuses. A share may begin
+// below the server's root (shareRoot()); the paths a Share takes and gives
+// are relative to where it begins.
 #pragma once
 
 #include <sys/types.h>
@@ -22,6 +24,7 @@ struct AccessEntry {
   int clientPort = 0;
   std::string method;
   int status = 0;
+  std::string path;  // the server path, unescaped
 };
 
 class Share {
@@ -39,13 +42,23 @@ class Share {
   pid_t pid() const { return pid_; }
   // The folder on disk that the share serves.
   const std::string& documentRoot() const { return documentRoot_; }
-  // The disk path of a server path.
-  std::string diskPath(const std::string& serverPath) const { return documentRoot_ + serverPath; }
+  // Where the share begins on the server: "" at its root, else a path
+  // ("/dav").
+  const std::string& shareRoot() const { return shareRoot_; }
+  // The disk path of a path of the share.
+  std::string diskPath(const std::string& sharePath) const { return documentRoot_ + sharePath; }
   // The names of the members of a served folder, a folder's with a trailing
   // "/"; files the server keeps there for itself are left out.
   std::set<std::string> members(const std::string& serverPath) const;
-  // The address of a server path ("http://127.0.0.1:PORT/sync").
-  std::string url(const std::string& serverPath = "") const;
+  // The address of a path of the share ("http://127.0.0.1:PORT/dav/sync").
+  std::string url(const std::string& sharePath = "") const;
+  // The authority's certificate that an HTTPS share's certificate needs;
+  // empty for a plain one.
+  virtual std::string caFile() const { return ""; }
+  // What `setup` needs besides the address to trust this share: the
+  // authority of an HTTPS share, or leave to send the password over a
+  // plain one.
+  std::vector<std::string> setupArguments() const;
 
   // A session configuration for this share (the keys a session reads).
   Dictionary configuration() const;
@@ -80,15 +93,21 @@ class Share {
 
   std::string root_;
   std::string documentRoot_;
+  std::string shareRoot_;
   int port_ = 0;
   pid_t pid_ = -1;
   bool tls_ = false;
 };
 
-// The servers that the sync runs on.
-enum class ShareKind { Apache, Sabre };
+// The servers that the sync runs on: the tests' own Apache and SabreDAV at
+// the server's root; Apache as Debian ships it, set up by the guide's site
+// file (docs/apache-site.conf) over HTTPS, at the site's root and under
+// "Alias /dav"; SabreDAV with a base path, as hosted storage lives.
+enum class ShareKind { Apache, Sabre, GuideApache, GuideApacheAlias, SabreUnderPath };
 std::unique_ptr<Share> startShare(ShareKind kind);
 const char* shareKindName(ShareKind kind);
+// Where SabreUnderPath begins, as a hosted account's WebDAV root does.
+inline constexpr const char* kHostedBasePath = "/remote/files/alice";
 
 // A TCP port on 127.0.0.1 that nothing listens on right now.
 int freeLoopbackPort();

@@ -35,6 +35,11 @@ std::string canonical(std::string_view path) {
   return p;
 }
 
+std::string collection(std::string_view path) {
+  std::string p = canonical(path);
+  return p.ends_with('/') ? p : p + '/';
+}
+
 std::string parent(std::string_view path) {
   std::string p = canonical(path);
   size_t slash = p.find_last_of('/');

@@ -17,6 +17,9 @@ std::string fromHref(std::string_view href);
 // (except the root).
 std::string canonical(std::string_view path);
 
+// The path of a collection as servers name it: with one trailing "/".
+std::string collection(std::string_view path);
+
 // The parent folder path, with a trailing "/"; "/" for top-level paths.
 std::string parent(std::string_view path);
 

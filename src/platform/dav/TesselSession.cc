@@ -130,37 +130,41 @@ DavTransaction TesselSession::_makeCollectionsAtPaths(const std::vector<std::str
 }
 
 DavTransaction TesselSession::deleteResourceAtPath(const std::string& path) {
-  std::string escaped = vtc::davpath::escape(path);
-  return memberRequest("DELETE", {path}, [&](bool presentParent) {
-    ne_request* req = ne_request_create(connection_->session(), "DELETE", escaped.c_str());
-    ne_lock_using_resource(req, escaped.c_str(), NE_DEPTH_INFINITE);
-    if (presentParent) ne_lock_using_parent(req, escaped.c_str());
-    ne_add_depth_header(req, NE_DEPTH_INFINITE);
-    return ne_simple_request(connection_->session(), req);
+  return atCollectionPath(path, [&](const std::string& at) {
+    const std::string escaped = vtc::davpath::escape(at);
+    return memberRequest("DELETE", {at}, [&](bool presentParent) {
+      ne_request* req = ne_request_create(connection_->session(), "DELETE", escaped.c_str());
+      ne_lock_using_resource(req, escaped.c_str(), NE_DEPTH_INFINITE);
+      if (presentParent) ne_lock_using_parent(req, escaped.c_str());
+      ne_add_depth_header(req, NE_DEPTH_INFINITE);
+      return ne_simple_request(connection_->session(), req);
+    });
   });
 }
 
 DavTransaction TesselSession::moveResourceAtPath(const std::string& source,
                                                  const std::string& destination,
                                                  bool allowingOverwrite) {
-  std::string from = vtc::davpath::escape(source);
-  std::string to = vtc::davpath::escape(destination);
-  return memberRequest("MOVE", {source, destination}, [&](bool presentParents) {
-    ne_session* session = connection_->session();
-    ne_request* req = ne_request_create(session, "MOVE", from.c_str());
-    // A move takes the source out of its collection as well as adding the
-    // target to another: both parents' locks must be presented (neon's own
-    // MOVE presents only the target's).
-    ne_lock_using_resource(req, from.c_str(), NE_DEPTH_INFINITE);
-    ne_lock_using_resource(req, to.c_str(), NE_DEPTH_INFINITE);
-    if (presentParents) {
-      ne_lock_using_parent(req, from.c_str());
-      ne_lock_using_parent(req, to.c_str());
-    }
-    ne_print_request_header(req, "Destination", "%s://%s%s", ne_get_scheme(session),
-                            ne_get_server_hostport(session), to.c_str());
-    ne_add_request_header(req, "Overwrite", allowingOverwrite ? "T" : "F");
-    return ne_simple_request(session, req);
+  const std::string to = vtc::davpath::escape(destination);
+  return atCollectionPath(source, [&](const std::string& at) {
+    const std::string from = vtc::davpath::escape(at);
+    return memberRequest("MOVE", {at, destination}, [&](bool presentParents) {
+      ne_session* session = connection_->session();
+      ne_request* req = ne_request_create(session, "MOVE", from.c_str());
+      // A move takes the source out of its collection as well as adding the
+      // target to another: both parents' locks must be presented (neon's own
+      // MOVE presents only the target's).
+      ne_lock_using_resource(req, from.c_str(), NE_DEPTH_INFINITE);
+      ne_lock_using_resource(req, to.c_str(), NE_DEPTH_INFINITE);
+      if (presentParents) {
+        ne_lock_using_parent(req, from.c_str());
+        ne_lock_using_parent(req, to.c_str());
+      }
+      ne_print_request_header(req, "Destination", "%s://%s%s", ne_get_scheme(session),
+                              ne_get_server_hostport(session), to.c_str());
+      ne_add_request_header(req, "Overwrite", allowingOverwrite ? "T" : "F");
+      return ne_simple_request(session, req);
+    });
   });
 }
 

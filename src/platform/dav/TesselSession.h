@@ -1,6 +1,8 @@
 // The WebDAV session to the user's share: every remote request of the library
 // goes through one of these operations, all synchronous, each returning a
-// DavTransaction. Paths are unescaped server paths. Held locks live in neon's
+// DavTransaction. Paths are unescaped server paths; PROPFIND, PROPPATCH,
+// DELETE and MOVE of a collection named without its trailing "/" follow the
+// server's redirect to it (atCollectionPath). Held locks live in neon's
 // lock store, so later requests under a locked resource carry its token.
 // Not thread-safe: callers that share a session serialise on monitor().
 #pragma once
@@ -115,7 +117,7 @@ class TesselSession {
   DavTransaction basicAttributesAtPath(const std::string& path);
   DavTransaction extendedAttributesAtPath(const std::string& path);
   // The members of a collection (not the collection itself), as an array of
-  // attribute dictionaries.
+  // attribute dictionaries. The collection is asked for with its trailing "/".
   DavTransaction listCollectionAtPath(const std::string& path);
 
   // Stores a flattened sync report as "<reportsPath>/<MachineGUID>.plist"
@@ -139,6 +141,14 @@ class TesselSession {
                           const std::vector<std::string>& props, bool includingParent);
   DavTransaction attributes(const std::string& path, int32_t depth, bool withLocks);
   DavTransaction mkcol(const std::string& path);
+  // Sends a request for path through send, which takes the path to use. A
+  // server that names a collection only with its trailing "/" (Apache's
+  // mod_dir as Debian ships it) answers a request without it with a redirect
+  // to the same path with the "/": the request is sent once more there, and
+  // the path noted, so that later requests go there at once. Any other
+  // redirect is returned as it was answered.
+  DavTransaction atCollectionPath(const std::string& path,
+                                  const std::function<DavTransaction(const std::string&)>& send);
   // Sends a request that adds or removes members of the parents of paths;
   // run builds and dispatches it, presenting the parents' locks when its
   // argument says so. They are presented, as servers that guard a locked
@@ -171,4 +181,5 @@ class TesselSession {
   bool synchronous_ = true;
   std::recursive_mutex monitor_;
   std::set<std::string> recordedLocks_;  // paths whose lock has a lock record
+  std::set<std::string> slashedPaths_;   // collections met without their "/" (canonical)
 };

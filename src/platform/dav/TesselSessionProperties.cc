@@ -115,13 +115,15 @@ DavTransaction TesselSession::propfind(const std::string& path, int32_t depth,
                                        const std::vector<std::string>& props,
                                        bool includingParent) {
   const std::string self = vtc::davpath::canonical(path);
-  return runPropfind(*connection_, path, depth, props, [&](DavTransaction& t, auto& entries) {
-    vtc::Dictionary result;
-    for (auto& entry : entries) {
-      if (!includingParent && depth > 0 && vtc::davpath::canonical(entry.path) == self) continue;
-      result.set(entry.href, vtc::Value(std::move(entry.properties)));
-    }
-    t.setResult(vtc::Value(std::move(result)));
+  return atCollectionPath(path, [&](const std::string& at) {
+    return runPropfind(*connection_, at, depth, props, [&](DavTransaction& t, auto& entries) {
+      vtc::Dictionary result;
+      for (auto& entry : entries) {
+        if (!includingParent && depth > 0 && vtc::davpath::canonical(entry.path) == self) continue;
+        result.set(entry.href, vtc::Value(std::move(entry.properties)));
+      }
+      t.setResult(vtc::Value(std::move(result)));
+    });
   });
 }
 
@@ -139,7 +141,6 @@ DavTransaction TesselSession::_issuePropFindAtPath(const std::string& path, int3
 DavTransaction TesselSession::_issuePropPatchAtPath(const std::string& path,
                                                     const vtc::Dictionary& props,
                                                     const std::string& nameSpace) {
-  std::string escaped = vtc::davpath::escape(path);
   std::vector<ne_propname> names;
   std::vector<std::string> values;
   names.reserve(props.size());
@@ -158,8 +159,11 @@ DavTransaction TesselSession::_issuePropPatchAtPath(const std::string& path,
     ++i;
   }
   ops.push_back({nullptr, ne_propset, nullptr});
-  return connection_->perform("PROPPATCH", path, [&] {
-    return ne_proppatch(connection_->session(), escaped.c_str(), ops.data());
+  return atCollectionPath(path, [&](const std::string& at) {
+    const std::string escaped = vtc::davpath::escape(at);
+    return connection_->perform("PROPPATCH", at, [&] {
+      return ne_proppatch(connection_->session(), escaped.c_str(), ops.data());
+    });
   });
 }
 
@@ -167,27 +171,31 @@ DavTransaction TesselSession::attributes(const std::string& path, int32_t depth,
   std::vector<std::string> props = kBasicProperties;
   if (withLocks) props.insert(props.end(), {vtc::kDavLockDiscovery, vtc::kLockRecordProperty});
   const std::string self = vtc::davpath::canonical(path);
-  return runPropfind(*connection_, path, depth, props, [&](DavTransaction& t, auto& entries) {
-    if (depth == 0) {
-      vtc::Dictionary a;
-      if (!entries.empty()) {
-        a = attributesOf(entries.front());
-        if (withLocks && entries.front().lockDiscovery)
-          a.set(vtc::kDavLockDiscovery,
-                vtc::Value(withLockRecord(vtc::readActiveLocks(*entries.front().lockDiscovery),
-                                          entries.front().properties)));
-        if (const vtc::Value* record = entries.front().properties.find(vtc::kLockRecordProperty))
-          a.set(vtc::kLockRecordProperty, *record);
+  // A listing is of a collection: asked for as one.
+  const std::string asked = depth > 0 ? vtc::davpath::collection(path) : path;
+  return atCollectionPath(asked, [&](const std::string& at) {
+    return runPropfind(*connection_, at, depth, props, [&](DavTransaction& t, auto& entries) {
+      if (depth == 0) {
+        vtc::Dictionary a;
+        if (!entries.empty()) {
+          a = attributesOf(entries.front());
+          if (withLocks && entries.front().lockDiscovery)
+            a.set(vtc::kDavLockDiscovery,
+                  vtc::Value(withLockRecord(vtc::readActiveLocks(*entries.front().lockDiscovery),
+                                            entries.front().properties)));
+          if (const vtc::Value* record = entries.front().properties.find(vtc::kLockRecordProperty))
+            a.set(vtc::kLockRecordProperty, *record);
+        }
+        t.setResult(vtc::Value(std::move(a)));
+        return;
       }
-      t.setResult(vtc::Value(std::move(a)));
-      return;
-    }
-    vtc::Array members;
-    for (const auto& entry : entries) {
-      if (vtc::davpath::canonical(entry.path) == self) continue;
-      members.push_back(vtc::Value(attributesOf(entry)));
-    }
-    t.setResult(vtc::Value(std::move(members)));
+      vtc::Array members;
+      for (const auto& entry : entries) {
+        if (vtc::davpath::canonical(entry.path) == self) continue;
+        members.push_back(vtc::Value(attributesOf(entry)));
+      }
+      t.setResult(vtc::Value(std::move(members)));
+    });
   });
 }
 

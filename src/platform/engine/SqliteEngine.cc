@@ -14,7 +14,7 @@ namespace vtc::engine {
 
 namespace {
 
-constexpr int kSchemaVersion = 3;
+constexpr int kSchemaVersion = 4;
 constexpr const char* kEngineVersion = "1.0";
 
 // Each step moves the database from version (index) to (index + 1).
@@ -44,6 +44,18 @@ const char* const kMigrations[] = {
     R"(CREATE TABLE tombstones (dataclass TEXT NOT NULL, id TEXT NOT NULL,
                               properties BLOB NOT NULL, deleted REAL NOT NULL,
                               PRIMARY KEY (dataclass, id));)",
+    // Items are known by their identity, not their file name: what earlier
+    // versions kept is read again from the folders and the share.
+    R"(DELETE FROM item_states; DELETE FROM client_states; DELETE FROM records;
+       DELETE FROM tombstones; DELETE FROM journal; DELETE FROM anchors;
+       ALTER TABLE item_states ADD COLUMN record TEXT NOT NULL DEFAULT '';
+       ALTER TABLE tombstones ADD COLUMN origin TEXT NOT NULL DEFAULT '';
+       ALTER TABLE tombstones ADD COLUMN here INTEGER NOT NULL DEFAULT 0;
+       CREATE TABLE folder_takes (client TEXT NOT NULL, dataclass TEXT NOT NULL,
+                                  record TEXT NOT NULL, PRIMARY KEY (client, dataclass, record));
+       CREATE TABLE set_aside (dataclass TEXT NOT NULL, record TEXT NOT NULL, file TEXT NOT NULL,
+                               reason TEXT NOT NULL, origin TEXT NOT NULL, date REAL NOT NULL,
+                               PRIMARY KEY (dataclass, record));)",
 };
 
 double seconds(Date d) {
@@ -90,7 +102,9 @@ SqliteEngine::SqliteEngine(const std::string& path, bool inMemoryCopy)
     if (inMemoryCopy)
       db_.copyFrom(path);
     else
-      db_.exec("PRAGMA journal_mode=WAL; PRAGMA synchronous=NORMAL; PRAGMA foreign_keys=ON;");
+      // FULL: a transaction that returned is on disk, so that a power cut
+      // never takes back a record of files written or changes sent.
+      db_.exec("PRAGMA journal_mode=WAL; PRAGMA synchronous=FULL; PRAGMA foreign_keys=ON;");
     migrate();
   } catch (const EngineError& e) {
     // A damaged file is reported and left where it is for inspection.
@@ -267,14 +281,14 @@ Value SqliteEngine::clientState(const std::string& client, const std::string& da
 std::map<std::string, ItemStamp> SqliteEngine::itemStamps(const std::string& client,
                                                           const std::string& dataclass) {
   Statement s(db_.handle(),
-              "SELECT item, size, modified, changed, inode FROM item_states WHERE client = ?1 AND "
-              "dataclass = ?2");
+              "SELECT item, size, modified, changed, inode, record FROM item_states WHERE "
+              "client = ?1 AND dataclass = ?2");
   s.bind(1, client).bind(2, dataclass);
   std::map<std::string, ItemStamp> stamps;
   while (s.step())
-    stamps.emplace_hint(
-        stamps.end(), s.text(0),
-        ItemStamp{s.integer(1), s.integer(2), s.integer(3), static_cast<uint64_t>(s.integer(4))});
+    stamps.emplace_hint(stamps.end(), s.text(0),
+                        ItemStamp{s.integer(1), s.integer(2), s.integer(3),
+                                  static_cast<uint64_t>(s.integer(4)), s.text(5)});
   return stamps;
 }
 
@@ -310,14 +324,15 @@ void SqliteEngine::writeState(const std::string& client, const std::string& data
   if (state.items.empty()) return;
   Statement put(db_.handle(),
                 "INSERT OR REPLACE INTO item_states (client, dataclass, item, size, modified, "
-                "changed, inode, detail) VALUES (?1, ?2, ?3, ?4, ?5, ?6, ?7, ?8)");
+                "changed, inode, detail, record) VALUES (?1, ?2, ?3, ?4, ?5, ?6, ?7, ?8, ?9)");
   Statement drop(db_.handle(),
                  "DELETE FROM item_states WHERE client = ?1 AND dataclass = ?2 AND item = ?3");
   for (const auto& [item, stored] : state.items) {
     if (stored) {
       put.bind(1, client).bind(2, dataclass).bind(3, item).bind(4, stored->stamp.size);
       put.bind(5, stored->stamp.modified).bind(6, stored->stamp.changed);
-      put.bind(7, static_cast<int64_t>(stored->stamp.inode)).bind(8, encode(stored->detail)).run();
+      put.bind(7, static_cast<int64_t>(stored->stamp.inode)).bind(8, encode(stored->detail));
+      put.bind(9, stored->stamp.record).run();
     } else {
       drop.bind(1, client).bind(2, dataclass).bind(3, item).run();
     }

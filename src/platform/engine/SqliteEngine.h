@@ -42,6 +42,19 @@ class SqliteEngine final : public SyncEngine {
   void saveState(const std::string& client, const std::string& dataclass,
                  const StateUpdate& state) override;
   void resetClient(const std::string& client, const std::string& dataclass) override;
+  std::map<std::string, Dictionary> recordsWithIdentifiers(
+      const std::string& dataclass, const std::vector<std::string>& ids) override;
+  std::map<std::string, Tombstone> tombstones(const std::string& dataclass,
+                                              const std::vector<std::string>& ids) override;
+  void forEachRecord(
+      const std::string& dataclass,
+      const std::function<void(const std::string& id, const Dictionary& record)>& visit) override;
+  void storeSync(const std::string& dataclass, const SyncOutcome& outcome) override;
+  std::vector<std::string> folderTakes(const std::string& client,
+                                       const std::string& dataclass) override;
+  void storeFolderUpdate(const std::string& client, const std::string& dataclass,
+                         const FolderUpdate& update) override;
+  std::map<std::string, SetAside> setAsideRecords(const std::string& dataclass) override;
   int64_t beginSyncPlan(const std::vector<std::string>& participants) override;
   void setSyncPlanStatus(int64_t plan, int32_t status) override;
   void endSyncPlan(int64_t plan) override;

@@ -57,6 +57,7 @@ struct ItemStamp {
   int64_t modified = 0;  // nanoseconds
   int64_t changed = 0;   // nanoseconds
   uint64_t inode = 0;
+  std::string record;  // the record the item holds
   friend bool operator==(const ItemStamp&, const ItemStamp&) = default;
 };
 struct StoredItem {
@@ -79,6 +80,47 @@ struct PushOptions {
   // here undoes the whole push.
   std::function<void(const Conflict&)> onConflict;
   StateUpdate state;
+};
+
+// A deleted record, kept so that an edit made elsewhere before the delete
+// was seen brings it back whole.
+struct Tombstone {
+  Dictionary record;
+  std::string origin;  // the computer that deleted it
+  bool here = false;   // whether that was this computer
+};
+
+// A record that could not be written where it goes (it makes no valid
+// item): kept in the truth, named to the user, tried again when it changes.
+struct SetAside {
+  std::string file;
+  std::string reason;
+  std::string origin;  // the computer that sent it last
+  Date date;
+};
+
+// What one sync decided, stored in one transaction so that a crash never
+// separates the truth from the states that say what was taken in.
+struct SyncOutcome {
+  struct Entry {
+    std::string id;
+    std::optional<Dictionary> record;  // none: deleted (and buried)
+    std::string origin;                // who changed or deleted it
+    bool here = false;                 // whether that was this computer
+  };
+  std::vector<Entry> truth;
+  // Records whose files the folder client must write or remove.
+  std::vector<std::string> folderTakes;
+  std::string networkClient, folderClient;
+  StateUpdate network;  // the network client's state
+  StateUpdate folder;   // the folder client's item states
+};
+
+// What the folder client wrote, stored in one transaction.
+struct FolderUpdate {
+  std::vector<std::string> taken;  // records now written where they go
+  StateUpdate state;
+  std::vector<std::pair<std::string, std::optional<SetAside>>> setAside;  // none: no longer
 };
 
 struct SyncPlan {
@@ -147,6 +189,23 @@ class SyncEngine {
                          const StateUpdate& state) = 0;
   // The client's next pull is the whole truth, as adds.
   virtual void resetClient(const std::string& client, const std::string& dataclass) = 0;
+
+  // The sync client's truth: records, tombstones, what a folder still has
+  // to take in, and records set aside.
+  virtual std::map<std::string, Dictionary> recordsWithIdentifiers(
+      const std::string& dataclass, const std::vector<std::string>& ids) = 0;
+  virtual std::map<std::string, Tombstone> tombstones(const std::string& dataclass,
+                                                      const std::vector<std::string>& ids) = 0;
+  // Every record of the truth, one at a time, without holding them all.
+  virtual void forEachRecord(
+      const std::string& dataclass,
+      const std::function<void(const std::string& id, const Dictionary& record)>& visit) = 0;
+  virtual void storeSync(const std::string& dataclass, const SyncOutcome& outcome) = 0;
+  virtual std::vector<std::string> folderTakes(const std::string& client,
+                                               const std::string& dataclass) = 0;
+  virtual void storeFolderUpdate(const std::string& client, const std::string& dataclass,
+                                 const FolderUpdate& update) = 0;
+  virtual std::map<std::string, SetAside> setAsideRecords(const std::string& dataclass) = 0;
 
   // Sync plans, recorded while a sync runs so that other processes can see it.
   virtual int64_t beginSyncPlan(const std::vector<std::string>& participants) = 0;

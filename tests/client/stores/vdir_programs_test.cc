@@ -7,22 +7,20 @@
 #include <filesystem>
 #include <fstream>
 
-#include "FieldChanges.h"
+#include "client/items/ItemRecord.h"
+#include "client/merge/RecordMerge.h"
 #include "client/stores/VdirCollection.h"
 #include "support/TestHome.h"
 
 namespace {
 
-using vtc::Array;
 using vtc::Dictionary;
-using vtc::client::applyFieldChanges;
+using vtc::Value;
 using vtc::client::ItemKind;
-using vtc::client::ItemState;
-using vtc::client::ScanResult;
-using vtc::client::splitItem;
+using vtc::client::recordOfBytes;
+using vtc::client::renderRecord;
 using vtc::client::VdirCollection;
 using vtc::client::WriteOutcome;
-using vtc::test::setField;
 
 class VdirPrograms : public ::testing::Test {
  protected:
@@ -51,25 +49,35 @@ class VdirPrograms : public ::testing::Test {
     return out;
   }
 
-  // Writes an item new to the folder, the way the sync adds one from the
-  // other computer's fields.
-  ItemState addItem(VdirCollection& store, const std::string& name, const std::string& example) {
-    std::optional<Dictionary> fields = splitItem(store.kind(), example);
-    EXPECT_TRUE(fields);
-    std::string bytes = applyFieldChanges(store.kind(), std::nullopt,
-                                          vtc::test::setsOf(fields.value_or(Dictionary{})));
-    ItemState state;
-    EXPECT_EQ(store.write(name, bytes, std::nullopt, &state), WriteOutcome::Written);
-    return state;
+  // An item new to the folder, as the sync writes one from another
+  // computer's record; the record it was synced as.
+  Dictionary addItem(VdirCollection& store, const std::string& name, const std::string& bytes) {
+    std::optional<Dictionary> record = recordOfBytes(store.kind(), bytes, name);
+    EXPECT_TRUE(record);
+    std::optional<std::string> rendered = renderRecord(record.value_or(Dictionary{}));
+    EXPECT_EQ(rendered, bytes);
+    EXPECT_EQ(store.write(name, bytes, std::nullopt, nullptr), WriteOutcome::Written);
+    return record.value_or(Dictionary{});
   }
 
-  // Applies another computer's changes over a local edit the scan found.
-  void applyRemoteChanges(VdirCollection& store, const std::string& name, const ItemState& known,
-                          const Array& changes) {
-    ScanResult scan = store.scan({{name, known}});
-    ASSERT_EQ(scan.changed.size(), 1u) << "the program's edit is not seen";
-    std::string bytes = applyFieldChanges(store.kind(), store.read(name), changes);
-    EXPECT_EQ(store.write(name, bytes, scan.states.at(name), nullptr), WriteOutcome::Written);
+  // The program's edit here merged with another computer's version of the
+  // item, written over the file as the sync writes it.
+  void mergeTheirs(VdirCollection& store, const std::string& name, const Dictionary& base,
+                   const Dictionary& theirs) {
+    std::optional<std::string> now = store.read(name);
+    ASSERT_TRUE(now);
+    std::optional<Dictionary> ours = recordOfBytes(store.kind(), *now, name, &base);
+    ASSERT_TRUE(ours) << *now;
+    ASSERT_FALSE(*ours == base) << "the program's edit is not seen";
+    vtc::client::merge::Merged merged =
+        vtc::client::merge::mergeRecord(store.kind(), base, ours, theirs);
+    ASSERT_TRUE(merged.record);
+    for (const auto& lost : merged.lost)
+      ADD_FAILURE() << "lost " << lost.key << ": " << lost.lost.description() << " for "
+                    << lost.kept.description() << "\nours: " << *now;
+    std::optional<std::string> bytes = renderRecord(*merged.record, &*ours);
+    ASSERT_TRUE(bytes);
+    EXPECT_EQ(store.write(name, *bytes, store.stat(name), nullptr), WriteOutcome::Written);
   }
 };
 
@@ -78,23 +86,27 @@ TEST_F(VdirPrograms, KhardReadsAContactWithItsOwnEditAndOneFromAnotherComputer) 
             "[addressbooks]\n[[friends]]\npath = " + folder +
                 "\n[general]\neditor = /bin/true\nmerge_editor = /bin/true\n");
   VdirCollection store(folder, ItemKind::Contacts);
-  ItemState known = addItem(store, "ada.vcf",
-                            "BEGIN:VCARD\r\nVERSION:3.0\r\nUID:ada\r\nFN:Ada Lovelace\r\n"
-                            "N:Lovelace;Ada;;;\r\nEMAIL;TYPE=home:ada@example.org\r\n"
-                            "X-PLANNER;X-ROLE=\"a:b\":kept by everyone\r\nEND:VCARD\r\n");
+  const Dictionary base = addItem(store, "ada.vcf",
+                                  "BEGIN:VCARD\r\nVERSION:3.0\r\nUID:ada\r\nFN:Ada Lovelace\r\n"
+                                  "N:Lovelace;Ada;;;\r\nEMAIL;TYPE=home:ada@example.org\r\n"
+                                  "X-PLANNER;X-ROLE=\"a:b\":kept by everyone\r\nEND:VCARD\r\n");
 
   // Here: the e-mail address, edited with khard.
   writeFile(home.path() + "/edit.yaml",
             "First name : Ada\nLast name : Lovelace\nEmail :\n    work : ada@work.example\n");
   run("echo y | khard edit -i '" + home.path() + "/edit.yaml' uid:ada");
 
-  // Elsewhere: a phone number, and a note whose 75th octet falls inside a
-  // character, which khard cannot read if the fold goes there.
+  // Elsewhere: a phone number, and a long note folded the way its writer
+  // folded it.
   std::string note = "Zürich–Genève über Brücken!!!!";
   for (int i = 0; i < 4; ++i) note += " – Ärger über Öl für Ölgemälde 🎨";
-  applyRemoteChanges(store, "ada.vcf", known,
-                     Array{setField("NOTE", "NOTE:" + note + "\r\n"),
-                           setField("TEL", "TEL;TYPE=cell:+44 7700 900123\r\n")});
+  size_t cut = 68;
+  while ((static_cast<unsigned char>(note[cut]) & 0xC0) == 0x80) --cut;
+  const std::string folded = "NOTE:" + note.substr(0, cut) + "\r\n " + note.substr(cut) + "\r\n";
+  Dictionary theirs = base;
+  theirs.set("NOTE", Value(folded));
+  theirs.set("TEL#00000001", Value("TEL;TYPE=cell:+44 7700 900123\r\n"));
+  mergeTheirs(store, "ada.vcf", base, theirs);
 
   std::string shown = run("khard show uid:ada");
   EXPECT_NE(shown.find("ada@work.example"), std::string::npos) << shown;
@@ -121,7 +133,7 @@ TEST_F(VdirPrograms, KhalListsAnEventWithItsOwnEditAndOnesFromAnotherComputer) {
       "BEGIN:VEVENT\r\nUID:standup@example.org\r\nRECURRENCE-ID:20250311T090000Z\r\n"
       "DTSTAMP:20250101T000000Z\r\nDTSTART:20250311T130000Z\r\nDTEND:20250311T131500Z\r\n"
       "SUMMARY:Stand-up after lunch\r\nEND:VEVENT\r\nEND:VCALENDAR\r\n";
-  ItemState known = addItem(store, "standup@example.org.ics", event);
+  const Dictionary base = addItem(store, "standup@example.org.ics", event);
 
   // Here: the series renamed, by importing it again into khal.
   std::string renamed = event;
@@ -130,11 +142,12 @@ TEST_F(VdirPrograms, KhalListsAnEventWithItsOwnEditAndOnesFromAnotherComputer) {
   run("khal import --batch -a work '" + home.path() + "/renamed.ics'");
 
   // Elsewhere: a room for the series, and the moved occurrence's title.
-  const std::string master = "VEVENT/standup@example.org/";
-  applyRemoteChanges(
-      store, "standup@example.org.ics", known,
-      Array{setField(master + "LOCATION", "LOCATION:Room Süd\r\n"),
-            setField(master + "20250311T090000Z/SUMMARY", "SUMMARY:Stand-up in the garden\r\n")});
+  const std::string master = "VEVENT//standup@example.org/";
+  const std::string moved = "VEVENT/20250311T090000Z/standup@example.org/";
+  Dictionary theirs = base;
+  theirs.set(master + "LOCATION", Value("LOCATION:Room Süd\r\n"));
+  theirs.set(moved + "SUMMARY", Value("SUMMARY:Stand-up in the garden\r\n"));
+  mergeTheirs(store, "standup@example.org.ics", base, theirs);
 
   EXPECT_EQ(run("khal list -f '{start-time} {title} @{location}' 2025-03-10 3d"),
             "Monday, 2025-03-10\n09:00 Daily stand-up @Room Süd\n"

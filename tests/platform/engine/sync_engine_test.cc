@@ -201,7 +201,7 @@ TEST_F(Engine, ADeleteAndAnEditOfOneRecordSettleWholeAndKeepTheLoser) {
 }
 
 TEST_F(Engine, StatesTravelWithPushesAndAcknowledgementsAndADryRunForgetsEverything) {
-  vtc::engine::StoredItem item{{400, 1, 2, 3}, Value("A")};
+  vtc::engine::StoredItem item{{400, 1, 2, 3, "a"}, Value("A")};
   vtc::engine::StateUpdate state{Value(Dictionary{{"index", 4}}), {{"a.vcf", item}}};
   engine->push("vdir", "Contacts", {SyncEngineChange(1, "a.vcf", Array{set("FN", Value("A"))})},
                {"", {}, state});
