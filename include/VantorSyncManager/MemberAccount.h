@@ -1,8 +1,8 @@
 // A member account: the user's name and password for the share, and the
-// check of those credentials against the server. While an account holds a
-// password the process is not dumpable; the password is overwritten when
-// the account goes. Requests of the account and
-// of every TesselSession made from it share one connection.
+// check of those credentials against the server. Requests of the account and
+// of every TesselSession made from it share one connection. While an account
+// holds a password the process is not dumpable; the password is overwritten
+// when the account goes.
 #pragma once
 
 #include <cstdint>
