@@ -10,6 +10,7 @@
 
 #include "VantorSyncManager/NubiloException.h"
 #include "client/cli/Commands.h"
+#include "client/cli/TerminalText.h"
 #include "client/run/Automation.h"
 #include "client/run/SyncFailure.h"
 #include "common/Clock.h"
@@ -201,13 +202,17 @@ int runCommandLine(int argc, char** argv) {
     std::cout << app.help();
     return static_cast<int>(FailureKind::Usage);
   } catch (const SyncFailure& e) {
-    std::cerr << "nubilosyncclient: " << e.what() << "\n";
+    std::cerr << "nubilosyncclient: " << shownSafely(e.what()) << "\n";
     return e.exitStatus();
   } catch (const NubiloException& e) {
-    std::cerr << "nubilosyncclient: " << e.reason() << "\n";
+    std::cerr << "nubilosyncclient: " << shownSafely(e.reason()) << "\n";
+    return static_cast<int>(FailureKind::Other);
+  } catch (const std::bad_alloc&) {
+    std::cerr << "nubilosyncclient: this computer could not give the command the memory it "
+                 "needed; nothing more was done.\n";
     return static_cast<int>(FailureKind::Other);
   } catch (const std::exception& e) {
-    std::cerr << "nubilosyncclient: " << e.what() << "\n";
+    std::cerr << "nubilosyncclient: " << shownSafely(e.what()) << "\n";
     return static_cast<int>(FailureKind::Other);
   }
 }

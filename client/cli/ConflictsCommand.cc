@@ -4,6 +4,7 @@
 
 #include "client/cli/Commands.h"
 #include "client/cli/StatusText.h"
+#include "client/cli/TerminalText.h"
 #include "client/items/ItemRecord.h"
 #include "client/items/Meaning.h"
 #include "client/merge/RecordMerge.h"
@@ -36,7 +37,7 @@ std::string shown(const Value& value) {
     }
     out += text[i];
   }
-  return out;
+  return shownSafely(out);
 }
 
 // What the conflict is about: a property, an occurrence, or the item.
@@ -111,8 +112,9 @@ int conflictsCommand(const std::string& action, const std::string& id, Output& o
     if (action == "restore") restore(c);
     store.drop(id);
     if (output.verbosity > 0)
-      output.out << (action == "restore" ? "Restored " : "Dropped ") << subject(c) << " of "
-                 << c.file << (c.name.empty() || c.name == c.file ? "" : " (" + c.name + ")")
+      output.out << (action == "restore" ? "Restored " : "Dropped ") << shownSafely(subject(c))
+                 << " of " << shownSafely(c.file)
+                 << (c.name.empty() || c.name == c.file ? "" : " (" + shownSafely(c.name) + ")")
                  << (action == "restore" ? "; the next sync sends it." : ".") << "\n";
     return 0;
   }
@@ -122,16 +124,19 @@ int conflictsCommand(const std::string& action, const std::string& id, Output& o
     return 0;
   }
   for (const KeptConflict& c : conflicts) {
-    output.out << c.id << "  " << c.dataclass << "  " << c.file << "  " << subject(c)
-               << (c.name.empty() || c.name == c.file ? "" : "  (" + c.name + ")") << "\n";
+    output.out << c.id << "  " << c.dataclass << "  " << shownSafely(c.file) << "  "
+               << shownSafely(subject(c))
+               << (c.name.empty() || c.name == c.file ? "" : "  (" + shownSafely(c.name) + ")")
+               << "\n";
     if (c.field == merge::kRecordField && c.lost.isNone())
-      output.out << "    deleted here, and kept because " << c.keptComputer
+      output.out << "    deleted here, and kept because " << shownSafely(c.keptComputer)
                  << " edited it; `nubilosyncclient conflicts restore " << c.id
                  << "` deletes it again\n";
     else
-      output.out << "    kept: " << shown(c.kept) << "  (from " << c.keptComputer << ")\n"
-                 << "    lost: " << shown(c.lost) << "  (from " << c.lostComputer << ", "
-                 << localTime(c.date) << ")\n";
+      output.out << "    kept: " << shown(c.kept) << "  (from " << shownSafely(c.keptComputer)
+                 << ")\n"
+                 << "    lost: " << shown(c.lost) << "  (from " << shownSafely(c.lostComputer)
+                 << ", " << localTime(c.date) << ")\n";
   }
   return 0;
 }

@@ -5,6 +5,7 @@
 #include <ctime>
 #include <ostream>
 
+#include "client/cli/TerminalText.h"
 #include "client/items/ItemRecord.h"
 #include "common/Format.h"
 
@@ -29,7 +30,7 @@ std::string reportLine(const Dictionary& report) {
     const std::string dataclass = key.substr(0, key.size() - 5);
     line += ", " + dataclass + (value.string() == "0" ? " ok" : " failed");
   }
-  return line;
+  return shownSafely(line);
 }
 
 nlohmann::json optionalDate(const std::optional<Date>& date) {
@@ -104,21 +105,21 @@ void printStatus(const StatusReport& s, std::ostream& out) {
         << "; last attempt " << localTime(d.lastAttempt) << "\n";
     if (d.failedCount > 0)
       out << "  " << plural(d.failedCount, "failed sync", "failed syncs")
-          << " since: " << d.lastError.value_or("(no reason kept)") << "\n";
+          << " since: " << shownSafely(d.lastError.value_or("(no reason kept)")) << "\n";
     if (d.maxversion)
       out << "  on the share: changelogs " << d.minversion.value_or(1) << " to " << *d.maxversion
           << "\n";
     else if (!s.serverError)
       out << "  on the share: nothing yet\n";
-    for (const std::string& line : d.leftOver) out << "  " << line << "\n";
+    for (const std::string& line : d.leftOver) out << "  " << shownSafely(line) << "\n";
     if (d.serverStatus == std::optional<std::string>("needstruth"))
       out << "  this computer takes in the whole truth at its next sync (needstruth)\n";
   }
   if (!s.computers.empty()) {
     out << "\nComputers of the account:\n";
     for (const ComputerStatus& c : s.computers) {
-      out << "  " << c.name << (c.thisComputer ? " (this computer)" : "") << ": last sync "
-          << c.lastSync.value_or("never");
+      out << "  " << shownSafely(c.name) << (c.thisComputer ? " (this computer)" : "")
+          << ": last sync " << shownSafely(c.lastSync.value_or("never"));
       if (!c.report.empty()) out << "; " << reportLine(c.report);
       out << "\n";
     }
@@ -178,7 +179,8 @@ std::string statusAsJson(const StatusReport& s) {
                                 {"lostComputer", c.lostComputer},
                                 {"date", textOf(Value(c.date))}});
   doc["serverError"] = optional(s.serverError);
-  return doc.dump(2);
+  // Text from the share is not always UTF-8: such bytes become U+FFFD.
+  return doc.dump(2, ' ', false, nlohmann::json::error_handler_t::replace);
 }
 
 }  // namespace vtc::client

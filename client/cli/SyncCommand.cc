@@ -6,6 +6,7 @@
 
 #include "client/cli/Commands.h"
 #include "client/cli/ProgressLine.h"
+#include "client/cli/TerminalText.h"
 
 namespace vtc::client {
 
@@ -77,6 +78,8 @@ int syncCommand(RunRequest request, Output& output) {
   }
   RunResult result = runSync(request);
   progress.reset();
+  for (const std::string& warning : result.warnings)
+    output.err << "nubilosyncclient: warning: " << warning << "\n";
   const bool perDataclass = output.verbosity > 1 || (output.terminal && output.verbosity > 0);
   for (const DataclassOutcome& outcome : result.outcomes) {
     bool failed = false;
@@ -98,7 +101,7 @@ int syncCommand(RunRequest request, Output& output) {
       output.err << "nubilosyncclient: " << o.dataclass << ": could not write " << failure << "\n";
   }
   for (const DataclassFailure& failure : result.failures)
-    output.err << "nubilosyncclient: " << failure.sentence << "\n";
+    output.err << "nubilosyncclient: " << shownSafely(failure.sentence) << "\n";
   return result.exitStatus();
 }
 

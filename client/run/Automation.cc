@@ -15,6 +15,7 @@
 #include "platform/jobs/UserManager.h"
 #include "platform/plist/PlistCodec.h"
 #include "platform/prefs/PreferenceStore.h"
+#include "platform/push/PushMessage.h"
 #include "platform/push/PushService.h"
 #include "platform/secrets/StoredAccount.h"
 #include "prefs/AutoSyncJobs.h"
@@ -158,8 +159,8 @@ bool userManagerHas(const std::string& unit) {
 void announceCommits(const std::string& member, const std::string& password,
                      const std::vector<std::string>& dataclasses) {
   if (dataclasses.empty() || !push::configuredBroker()) return;
-  const Value payload(
-      Dictionary{{"guid", Value(VTCPrefsCenter::defaultCenter().clientGuid().value_or(""))}});
+  const Value payload =
+      push::commitAnnouncement(VTCPrefsCenter::defaultCenter().clientGuid().value_or(""));
   NotifyHelper& helper = NotifyHelper::notificationSessionForAccount(member, password);
   for (const std::string& dataclass : dataclasses) helper.addDataclassToNotify(dataclass, payload);
   helper.sendNotifications();

@@ -3,6 +3,7 @@
 #include <regex>
 
 #include "VantorSyncManager/PublicNames.h"
+#include "common/Limits.h"
 
 namespace vtc::client {
 
@@ -15,6 +16,8 @@ std::optional<int> httpStatusIn(const NubiloException& e) {
 }
 
 bool showsDamage(const NubiloException& e) {
+  // Too large for this computer is no damage: a repair would write the same.
+  if (overLimitIn(e.reason())) return false;
   if (e.name() == NubiloCorruptChangelogException) return true;
   if (e.name() != NubiloFailedToDownloadChangelogException) return false;
   const auto status = httpStatusIn(e);
@@ -24,6 +27,25 @@ bool showsDamage(const NubiloException& e) {
 std::string failureSentence(const std::string& dataclass, const NubiloException& e) {
   const auto status = httpStatusIn(e);
   const std::string answered = status ? " (HTTP " + std::to_string(*status) + ")" : "";
+  const std::string& reason = e.reason();
+  if (auto over = overLimitIn(reason))
+    return "Syncing " + dataclass + " stopped: the share sent more than this computer accepts (" +
+           (over->allowed.empty() ? "" : over->allowed + ", ") + "the limit " + over->key +
+           "). If the share is trusted, raise " + over->key +
+           " in ~/Library/Preferences/com.korvo.VantorSync.plist and sync again.";
+  static const std::regex notWebDAV("was not WebDAV: ([^\">]*)");
+  std::smatch m;
+  if (std::regex_search(reason, m, notWebDAV))
+    return "The server's answer while syncing " + dataclass +
+           " was not WebDAV: " + std::string(m[1]) +
+           "; check that the address is that of a WebDAV share.";
+  if (reason.find("kNBTimeoutError") != std::string::npos) {
+    static const std::regex within("within ([0-9]+) seconds");
+    const std::string seconds =
+        std::regex_search(reason, m, within) ? std::string(m[1]) + " seconds" : "its time-out";
+    return "The server gave no complete answer within " + seconds + " while syncing " + dataclass +
+           " (sync_dav_timeout_seconds); the next sync tries again.";
+  }
   if (e.name() == NubiloNetworkFailureException)
     return "The server stopped answering while syncing " + dataclass +
            "; the next sync carries on from where this one stopped.";

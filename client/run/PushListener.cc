@@ -9,9 +9,10 @@
 #include "client/run/SyncFailure.h"
 #include "common/Clock.h"
 #include "common/Logging.h"
-#include "platform/plist/PlistCodec.h"
+#include "platform/network/PlainConnection.h"
 #include "platform/process/Command.h"
 #include "platform/push/MqttConnection.h"
+#include "platform/push/PushMessage.h"
 #include "platform/push/PushService.h"
 
 namespace vtc::client {
@@ -40,8 +41,13 @@ PushListener::PushListener(Options options) : options_(std::move(options)) {
                       "No push server is set up; add one with `nubilosyncclient setup URL --user "
                       "NAME --push mqtt[s]://HOST[:PORT]`.");
   std::tie(member_, password_) = storedCredentials();
+  hold_.emplace();
   guid_ = VTCPrefsCenter::defaultCenter().clientGuid().value_or("");
   if (!options_.say) options_.say = [](const std::string&) {};
+}
+
+PushListener::~PushListener() {
+  wipe(password_);
 }
 
 void PushListener::refreshRegistrations() {
@@ -63,8 +69,13 @@ void PushListener::queue(const std::string& topic) {
 }
 
 void PushListener::handle(const std::string& topic, ByteView payload) {
-  const std::optional<Value> body = plist::parse(payload);
-  const std::string from = body ? body->dictionary().get("guid").string() : std::string();
+  const std::optional<push::PushMessage> message = push::decodePushMessage(payload);
+  if (!message) {
+    VTC_LOG_WARNING("A message of %d bytes on %@ is no announcement of a computer; ignored",
+                    payload.size(), topic);
+    return;
+  }
+  const std::string& from = message->guid;
   if (!guid_.empty() && from == guid_) return;  // this computer's own announcement
   VTC_LOG_INFO("Push on %@ from %@", topic,
                from.empty() ? std::string("an unknown computer") : from);
@@ -117,6 +128,7 @@ void PushListener::run(const std::atomic<bool>& stop) {
   connection.username = member_;
   connection.password = password_;
   connection.cleanSession = false;
+  connection.trust = push::configuredBrokerTrust();
   push::MqttConnection mqtt(connection);
   mqtt.setMessageHandler([this](const push::MqttConnection::Message& m) {
     if (std::ranges::find(launchables_, m.topic, &push::Launchable::topic) != launchables_.end())
@@ -140,6 +152,10 @@ void PushListener::run(const std::atomic<bool>& stop) {
         continue;
       }
       pauseLength = Seconds(kFirstPause);
+      if (!broker.tls)
+        if (auto warning =
+                network::passwordInClearWarning(member_, broker.host, broker.url(), "MQTT"))
+          options_.say("Warning: " + *warning);
       if (connectedBefore) {
         // Whatever was announced while the connection was down may be lost.
         for (const push::Launchable& l : launchables_) queue(l.topic);

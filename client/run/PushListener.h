@@ -2,7 +2,8 @@
 // login): it stays connected to the push server with this computer's own
 // persistent session, subscribed to the topics registered for launch, and
 // for a message from another computer runs the registered command
-// (nubilosyncclient --sync --dataclasses NAME).
+// (nubilosyncclient --sync --dataclasses NAME). A message that is no
+// computer's announcement is ignored.
 //
 // One command runs at a time. A push that comes alone (the one before it is
 // at least a quiet interval old) and finds nothing running starts its
@@ -26,6 +27,7 @@
 #include <vector>
 
 #include "VantorSyncManager/Value.h"
+#include "common/SecretMemory.h"
 #include "platform/push/PushRegistry.h"
 
 namespace vtc::client {
@@ -41,6 +43,7 @@ class PushListener {
 
   // Raises SyncFailure when no account or no push server is set up.
   explicit PushListener(Options options);
+  ~PushListener();
   // Runs until stop becomes true; waits for a command still running.
   void run(const std::atomic<bool>& stop);
 
@@ -53,6 +56,7 @@ class PushListener {
 
   Options options_;
   std::string member_, password_, guid_;
+  std::optional<SecretHold> hold_;  // while the password is held
   std::vector<push::Launchable> launchables_;
   std::vector<std::string> subscribed_;
   std::optional<int64_t> registrationsStamp_;

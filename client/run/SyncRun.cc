@@ -18,7 +18,10 @@
 #include "common/Clock.h"
 #include "common/Format.h"
 #include "common/Logging.h"
+#include "common/SecretMemory.h"
+#include "platform/network/PlainConnection.h"
 #include "platform/prefs/PreferenceStore.h"
+#include "platform/push/PushService.h"
 
 namespace vtc::client {
 
@@ -86,7 +89,13 @@ RunResult runSync(const RunRequest& request) {
 
   auto owner = SyncOwner::acquire();
   const Date runStart = currentClock().now();
+  const SecretHold holdingPassword;
   const auto [member, password] = storedCredentials();
+  RunResult result;
+  const ServerAddress server = ServerAddress::fromConfiguration(prefs.configuration());
+  if (server.scheme != "https")
+    if (auto warning = network::passwordInClearWarning(member, server.host, server.url(), "HTTP"))
+      result.warnings.push_back(*warning);
   auto session = openSession(member, password, prefs.configuration());
   HeldLocks locks(*session);
   if (!request.dryRun) locks.releaseLeftovers();
@@ -108,7 +117,6 @@ RunResult runSync(const RunRequest& request) {
   options.computerName = prefs.clientName().value_or("this computer");
   ConflictStore conflicts;
 
-  RunResult result;
   Dictionary summary{{"SyncType", request.periodic ? "periodic" : "manual"}};
   bool usedServer = false;
   try {
@@ -128,6 +136,14 @@ RunResult runSync(const RunRequest& request) {
         failure = DataclassFailure{collection.dataclass, failureSentence(collection.dataclass, e),
                                    failureKind(e)};
         VTC_LOG_ERROR("Sync of %@ failed: %@", collection.dataclass, e);
+      } catch (const std::bad_alloc&) {
+        failure = DataclassFailure{collection.dataclass,
+                                   "Syncing " + collection.dataclass +
+                                       " needed more memory than this computer could give; the "
+                                       "other folders were synced, and the next sync tries "
+                                       "again.",
+                                   FailureKind::Other};
+        VTC_LOG_ERROR("Sync of %@ ran out of memory", collection.dataclass);
       } catch (const std::exception& e) {
         failure = DataclassFailure{collection.dataclass,
                                    "Syncing " + collection.dataclass + " failed: " + e.what(),
@@ -182,6 +198,10 @@ RunResult runSync(const RunRequest& request) {
     std::vector<std::string> committed;
     for (const DataclassOutcome& o : result.outcomes)
       if (o.committedIndex) committed.push_back(o.dataclass);
+    if (auto broker = push::configuredBroker(); broker && !broker->tls && !committed.empty())
+      if (auto warning =
+              network::passwordInClearWarning(member, broker->host, broker->url(), "MQTT"))
+        result.warnings.push_back(*warning);
     announceCommits(member, password, committed);
   }
   return result;

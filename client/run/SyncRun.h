@@ -30,6 +30,9 @@ struct DataclassFailure {
 struct RunResult {
   std::vector<DataclassOutcome> outcomes;
   std::vector<DataclassFailure> failures;
+  // Sentences the user is told whatever the outcome (a password that went
+  // unencrypted over the network).
+  std::vector<std::string> warnings;
   // 0, the exit status of the first failure, or 9 when every dataclass
   // synced but items were left over (skipped, set aside, not written).
   int exitStatus() const;

@@ -6,7 +6,8 @@
 
 #include "VantorSyncManager/Export.h"
 
-// The host's hardware UUID as upper-case 8-4-4-4-12 text (the machine id
-// stands in where the firmware's is unreadable), kept for the life of the
-// process once found; none, with a Warning line, when it cannot be found.
+// This computer's UUID for the share as upper-case 8-4-4-4-12 text: derived
+// from the machine id with a key of this application's own, never the id
+// itself; kept for the life of the process once found; none, with a Warning
+// line, when it cannot be found.
 VSM_EXPORT std::optional<std::string> getHostUUIDString();

@@ -1,6 +1,8 @@
 // A member account: the user's name and password for the share, and the
 // check of those credentials against the server. Requests of the account and
-// of every TesselSession made from it share one connection.
+// of every TesselSession made from it share one connection. While an account
+// holds a password the process is not dumpable; the password is overwritten
+// when the account goes.
 #pragma once
 
 #include <cstdint>
@@ -12,7 +14,8 @@
 
 namespace vtc {
 class DavConnection;
-}
+class SecretHold;
+}  // namespace vtc
 
 // Told of every transaction an account completes.
 class DavTransactionDelegate {
@@ -80,4 +83,5 @@ class VSM_EXPORT MemberAccount {
   int32_t readTimeout_ = 0;
   std::string caFile_, pinnedDigest_;
   std::shared_ptr<vtc::DavConnection> connection_;
+  std::unique_ptr<vtc::SecretHold> hold_;
 };

@@ -14,9 +14,12 @@
 #include "VantorSyncManager/Export.h"
 #include "VantorSyncManager/Value.h"
 
-namespace vtc::push {
+namespace vtc {
+class SecretHold;
+namespace push {
 class Session;
 }
+}  // namespace vtc
 
 class VSM_EXPORT NotifyHelper {
  public:
@@ -25,7 +28,8 @@ class VSM_EXPORT NotifyHelper {
   // session; later calls return it unchanged whatever they are given.
   static NotifyHelper& notificationSessionForAccount(const std::string& account,
                                                      const std::string& password);
-  // A helper with no account and no session (registrations only).
+  // A helper with no session, for registrations: its topics are those of
+  // the account stored in the preferences.
   explicit NotifyHelper(std::string clientID);
   virtual ~NotifyHelper();
   NotifyHelper(const NotifyHelper&) = delete;
@@ -63,10 +67,13 @@ class VSM_EXPORT NotifyHelper {
   void _setPassword(const std::string& password);
   void _createSession();
   void _destroySession();
+  // The account whose topics the helper uses.
+  std::string topicAccount() const;
 
   std::string _clientID;
   std::string _account;
   std::string _password;
   std::unique_ptr<vtc::push::Session> _beaconSession;
+  std::unique_ptr<vtc::SecretHold> _passwordHold;  // the process is not dumpable meanwhile
   std::optional<vtc::Dictionary> _notificationsToSend;
 };

@@ -3,6 +3,14 @@
 // integer unsigned 32-bit big-endian. Reading failures raise
 // NubiloCorruptChangelogException; writing refuses, with
 // std::invalid_argument, what every reader would refuse. Not thread-safe.
+//
+// Reading works within a budget proportional to the bytes given (vtc::Limits
+// holds the caps): the body may inflate to a bounded multiple of its size,
+// and the decoded changes may take a bounded multiple in memory. A record
+// whose own archive cannot be decoded, or would go over its budget, is
+// passed over and listed in refusedChanges(); a damaged frame (index,
+// headers, a body that does not inflate, a cut record) refuses the whole
+// changelog.
 #pragma once
 
 #include <cstdint>
@@ -14,6 +22,16 @@
 #include "VantorSyncManager/Export.h"
 #include "VantorSyncManager/SyncEngineChange.h"
 #include "VantorSyncManager/Value.h"
+
+namespace vtc {
+// A record of a changelog that was read past: its place in the changelog
+// (from 0), its identifier, and why its changes could not be taken.
+struct RefusedChange {
+  size_t position;
+  std::string recordIdentifier;
+  std::string reason;
+};
+}  // namespace vtc
 
 class VSM_EXPORT NubiloChangeLog {
  public:
@@ -41,6 +59,9 @@ class VSM_EXPORT NubiloChangeLog {
   virtual vtc::Value headerValueForKey(const std::string& key);
   virtual const vtc::Dictionary& headers();
   virtual const std::vector<SyncEngineChange>& changes();
+  // The records read past, in file order; empty when every record decoded.
+  // A mapped changelog knows them once changes() has decoded it.
+  const std::vector<vtc::RefusedChange>& refusedChanges() const { return _refusedChanges; }
   // One "<Name>.Version" header per schema with "Name", "MajorVersion" and
   // "MinorVersion"; getSchemaVersions gives them back, or nothing.
   virtual void setSchemaVersions(const vtc::Array& versions);
@@ -63,6 +84,7 @@ class VSM_EXPORT NubiloChangeLog {
   virtual void inputConsumed(const uint8_t* begin, const uint8_t* end);
 
   std::vector<SyncEngineChange> _changes;
+  std::vector<vtc::RefusedChange> _refusedChanges;
   uint32_t _version = 0;
   std::optional<vtc::Dictionary> _headers;
 };

@@ -96,6 +96,9 @@ class VSM_EXPORT NubiloRemoteSession {
                                         int64_t rangeStart, int64_t rangeEnd,
                                         const std::optional<std::string>& localDestination);
   DavTransaction getDataWithRetryAtPath(const std::string& path);
+  // The same, the body written to a file instead of memory.
+  DavTransaction getDataWithRetryAtPath(const std::string& path,
+                                        const std::string& localDestination);
   DavTransaction putDataWithRetry(const vtc::Bytes& data, const std::string& path);
   DavTransaction moveResourceWithRetryAtPath(const std::string& source,
                                              const std::string& destination,

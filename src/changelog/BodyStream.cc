@@ -5,6 +5,8 @@
 
 #include "VantorSyncManager/NubiloDataAdditions.h"
 #include "changelog/ChangeLogFormat.h"
+#include "common/Format.h"
+#include "common/Limits.h"
 
 namespace vtc::clog {
 
@@ -14,8 +16,11 @@ namespace {
 constexpr size_t kLargestStep = 16 << 20;
 }  // namespace
 
-BodyStream::BodyStream(ByteView compressed, Consumed consumed, size_t step)
-    : consumed_(std::move(consumed)), step_(step) {
+BodyStream::BodyStream(ByteView compressed, Consumed consumed, InflateBudget budget, size_t step)
+    : consumed_(std::move(consumed)),
+      budget_(budget),
+      compressedSize_(compressed.size()),
+      step_(step) {
   if (compressed.size() <= 9 || inflateInit2(&z_, -15) != Z_OK)
     corrupt("Failed to unzip changes from clog");
   z_.next_in = const_cast<Bytef*>(compressed.data() + 10);
@@ -27,8 +32,19 @@ BodyStream::~BodyStream() {
 }
 
 void BodyStream::inflateMore(size_t wanted) {
-  if (filled_ == window_.size())
-    window_.resize(window_.size() + std::clamp(wanted, step_, std::max(step_, kLargestStep)));
+  const uint64_t inflated = dropped_ + filled_;
+  if (inflated > budget_.bytes)
+    corrupt(overLimitText(
+        format("The inflated body of a changelog of %@", byteCountText(compressedSize_)),
+        budget_.bytes, budget_.key));
+  if (filled_ == window_.size()) {
+    // Never more room than the budget leaves: a length read from a hostile
+    // file makes the window grow only as far as the body may inflate.
+    const uint64_t left = budget_.bytes - inflated;
+    const size_t grow = std::clamp(wanted, step_, std::max(step_, kLargestStep));
+    // One byte past the budget at most, to tell that the body goes over it.
+    window_.resize(window_.size() + (left < grow ? static_cast<size_t>(left) + 1 : grow));
+  }
   z_.next_out = window_.data() + filled_;
   z_.avail_out = static_cast<uInt>(window_.size() - filled_);
   const uint8_t* before = z_.next_in;

@@ -1,8 +1,9 @@
 // A changelog's compressed body read as a stream of records: the reduced gzip
 // envelope's first ten bytes are skipped and the raw deflate stream inflated
 // on demand into one window that is reused, so memory follows the record
-// being read, not the body. Every failure raises
-// NubiloCorruptChangelogException. Not thread-safe.
+// being read, not the body. The body may inflate to a budget of bytes, no
+// more. Every failure raises NubiloCorruptChangelogException. Not
+// thread-safe.
 #pragma once
 
 #include <zlib.h>
@@ -15,6 +16,12 @@
 
 namespace vtc::clog {
 
+// What a body may inflate to, and the configuration key that sets it.
+struct InflateBudget {
+  uint64_t bytes = UINT64_MAX;
+  const char* key = "";
+};
+
 class BodyStream {
  public:
   // Told which compressed bytes each inflate step used up.
@@ -24,7 +31,8 @@ class BodyStream {
   static constexpr size_t kStep = 64 << 10;
 
   // step: how much the window grows at a time.
-  BodyStream(ByteView compressed, Consumed consumed, size_t step = kStep);
+  BodyStream(ByteView compressed, Consumed consumed, InflateBudget budget = {},
+             size_t step = kStep);
   ~BodyStream();
   BodyStream(const BodyStream&) = delete;
   BodyStream& operator=(const BodyStream&) = delete;
@@ -47,6 +55,8 @@ class BodyStream {
   void inflateMore(size_t wanted);
 
   Consumed consumed_;
+  const InflateBudget budget_;
+  const uint64_t compressedSize_;
   const size_t step_;
   z_stream z_{};
   bool ended_ = false;  // the deflate stream reached its end

@@ -1,4 +1,5 @@
 // The changelog writer: index, headers, then the compressed body.
+#include <cstring>
 #include <ctime>
 #include <stdexcept>
 #include <string>
@@ -9,6 +10,7 @@
 #include "changelog/ChangeLogFormat.h"
 #include "common/Clock.h"
 #include "common/Format.h"
+#include "common/Limits.h"
 #include "platform/plist/BinaryPlistWriter.h"
 
 namespace {
@@ -77,6 +79,18 @@ void NubiloChangeLog::writeToData(vtc::Bytes& output) {
   _headers->set("CreationTimestamp", vtc::Value(creationTimestamp()));
   const std::vector<std::string> lines = vtc::clog::headerLines(*_headers);
 
+  // A body that inflates beyond what readers of a file this size take
+  // would be refused by every other computer.
+  std::optional<vtc::Bytes> zipped = NubiloGzip(body);
+  size_t fileSize =
+      12 + 4 * n + std::strlen(vtc::clog::kHeaderEnd) + 1 + (zipped ? zipped->size() : 0);
+  for (const std::string& line : lines) fileSize += line.size() + 1;
+  if (body.size() > vtc::limits().inflateBudget(fileSize))
+    throw std::invalid_argument(vtc::format(
+        "Cannot write a changelog whose records inflate from %@ to %@: readers refuse more than "
+        "%d times a changelog's size",
+        vtc::byteCountText(fileSize), vtc::byteCountText(body.size()), vtc::limits().inflateRatio));
+
   // The index is written in place: format number, header offset, one entry
   // per record, then the end marker.
   const size_t indexSize = 12 + 4 * n;
@@ -89,6 +103,5 @@ void NubiloChangeLog::writeToData(vtc::Bytes& output) {
   for (size_t i = 0; i < n; ++i)
     putUInt32At(output, 8 + 4 * i, static_cast<uint32_t>(bodyStart + recordAt[i]));
   putUInt32At(output, 8 + 4 * n, vtc::clog::kIndexEnd);
-  if (std::optional<vtc::Bytes> zipped = NubiloGzip(body))
-    output.insert(output.end(), zipped->begin(), zipped->end());
+  if (zipped) output.insert(output.end(), zipped->begin(), zipped->end());
 }

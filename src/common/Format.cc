@@ -158,10 +158,12 @@ std::string formatArgs(std::string_view fmt, std::span<const FormatArg> args) {
     std::string directive = "%";
     size_t j = i + 1;
     while (j < fmt.size() && std::strchr("-+ #0'", fmt[j])) directive += fmt[j++];
-    while (j < fmt.size() && std::isdigit(static_cast<unsigned char>(fmt[j]))) directive += fmt[j++];
+    while (j < fmt.size() && std::isdigit(static_cast<unsigned char>(fmt[j])))
+      directive += fmt[j++];
     if (j < fmt.size() && fmt[j] == '.') {
       directive += fmt[j++];
-      while (j < fmt.size() && std::isdigit(static_cast<unsigned char>(fmt[j]))) directive += fmt[j++];
+      while (j < fmt.size() && std::isdigit(static_cast<unsigned char>(fmt[j])))
+        directive += fmt[j++];
     }
     // length modifiers are dropped: the argument's own type decides
     while (j < fmt.size() && std::strchr("hlLqjzt", fmt[j])) ++j;
@@ -179,6 +181,15 @@ std::string formatArgs(std::string_view fmt, std::span<const FormatArg> args) {
     i = j;
   }
   return out;
+}
+
+std::string clipped(std::string_view text, size_t most) {
+  if (text.size() <= most) return std::string(text);
+  size_t cut = most;
+  // Back to the start of a UTF-8 sequence.
+  while (cut > 0 && (static_cast<unsigned char>(text[cut]) & 0xC0) == 0x80) --cut;
+  return std::string(text.substr(0, cut)) +
+         format("... (%zu bytes more)", static_cast<size_t>(text.size() - cut));
 }
 
 }  // namespace vtc

@@ -88,6 +88,11 @@ FormatArg makeFormatArg(const T& a) {
 
 std::string formatArgs(std::string_view format, std::span<const FormatArg> args);
 
+// The text whole when it is at most `most` bytes; otherwise its start, cut at
+// a character boundary, and how many bytes were left out: for quoting input
+// from outside in log lines and reasons.
+std::string clipped(std::string_view text, size_t most);
+
 template <typename... A>
 std::string format(std::string_view fmt, const A&... args) {
   const FormatArg list[] = {makeFormatArg(args)..., FormatArg{int64_t{0}}};

@@ -4,8 +4,10 @@
 
 #include "VantorSyncManager/VTCPrefsCenter.h"
 #include "common/Logging.h"
+#include "common/SecretMemory.h"
 #include "platform/bundle/BundleResources.h"
 #include "platform/push/PushService.h"
+#include "platform/secrets/StoredAccount.h"
 
 namespace {
 
@@ -57,6 +59,7 @@ NotifyHelper::NotifyHelper(std::string clientID) : _clientID(std::move(clientID)
 NotifyHelper::~NotifyHelper() {
   _destroySession();
   _notificationsToSend.reset();
+  vtc::wipe(_password);
 }
 
 void NotifyHelper::_setAccount(const std::string& account) {
@@ -64,7 +67,14 @@ void NotifyHelper::_setAccount(const std::string& account) {
 }
 
 void NotifyHelper::_setPassword(const std::string& password) {
+  if (!password.empty() && !_passwordHold) _passwordHold = std::make_unique<vtc::SecretHold>();
+  vtc::wipe(_password);
   _password = password;
+}
+
+std::string NotifyHelper::topicAccount() const {
+  // A helper made without an account registers for the stored one.
+  return _account.empty() ? vtc::storedMemberName().value_or("") : _account;
 }
 
 void NotifyHelper::_createSession() {
@@ -88,7 +98,7 @@ void NotifyHelper::sendNotifications() {
     for (const auto& [dataclass, payload] : *_notificationsToSend) {
       std::optional<vtc::Dictionary> topic;
       // A dataclass whose topic cannot be made has nobody listening to it.
-      if (vtc::push::createTopic(_account, kOrganisation, kService, kSubService, dataclass,
+      if (vtc::push::createTopic(topicAccount(), kOrganisation, kService, kSubService, dataclass,
                                  topic) != 0 ||
           !topic)
         continue;
@@ -101,8 +111,8 @@ void NotifyHelper::sendNotifications() {
 
 void NotifyHelper::enableDataclassForNotifications(const std::string& dataclass) {
   std::optional<vtc::Dictionary> topic;
-  if (vtc::push::createTopic(_account, kOrganisation, kService, kSubService, dataclass, topic) ==
-          0 &&
+  if (vtc::push::createTopic(topicAccount(), kOrganisation, kService, kSubService, dataclass,
+                             topic) == 0 &&
       topic) {
     const int32_t status = vtc::push::enableLaunchable(launchableTool(), *topic,
                                                        {"--sync", "--dataclasses", dataclass});
@@ -117,7 +127,8 @@ void NotifyHelper::enableDataclassForNotifications(const std::string& dataclass)
 
 void NotifyHelper::disableDataclassForNotifications(const std::string& dataclass) {
   std::optional<vtc::Dictionary> topic;
-  if (vtc::push::createTopic(_account, kOrganisation, kService, kSubService, dataclass, topic) != 0)
+  if (vtc::push::createTopic(topicAccount(), kOrganisation, kService, kSubService, dataclass,
+                             topic) != 0)
     return;
   if (topic) VTC_LOG_INFO("Removing subscription for topic = %@", topic->get(vtc::push::kTopicKey));
   const int32_t status = vtc::push::disableLaunchable(launchableTool(), topic);

@@ -10,6 +10,7 @@
 #include "VantorSyncManager/VTCPrefsCenter.h"
 #include "common/Clock.h"
 #include "common/Format.h"
+#include "common/Limits.h"
 #include "common/Logging.h"
 #include "platform/dav/HttpFetch.h"
 #include "platform/fs/LocalPaths.h"
@@ -107,34 +108,42 @@ vtc::Dictionary VTCPrefsCenter::defaultConfiguration() {
   std::string url =
       config::configurationURL(host, vtc::os::productVersion(), vtc::os::buildVersion());
 
-  std::optional<vtc::Bytes> data;
+  // What the layers so far allow decides how large a download may be.
+  vtc::setLimits(vtc::Limits::fromConfiguration(configuration));
+  const uint64_t most = vtc::limits().configurationBytes;
+
+  std::optional<vtc::Dictionary> signedLayer;
   bool fresh = false;
   std::string caches = vtc::paths::cachesDirectory();
   std::string cacheFile = caches.empty() ? "" : vtc::paths::join(caches, config::kCacheFileName);
   std::optional<vtc::Date> ttl = configTTLDate();
   if (!cacheFile.empty() && ttl && *ttl > vtc::currentClock().now()) {
-    std::ifstream in(cacheFile, std::ios::binary);
-    if (in) {
+    std::ifstream in(cacheFile, std::ios::binary | std::ios::ate);
+    // Only verified documents are cached; one changed since is not used.
+    if (in && static_cast<uint64_t>(in.tellg()) <= most) {
+      in.seekg(0);
       VTC_LOG_INFO("Using cached Nubilo Client configuration");
-      data = vtc::Bytes((std::istreambuf_iterator<char>(in)), std::istreambuf_iterator<char>());
+      signedLayer = config::verifiedConfiguration(
+          vtc::Bytes((std::istreambuf_iterator<char>(in)), std::istreambuf_iterator<char>()));
     }
   }
   const bool syncing = syncTurnedOn();
   // A self-hosted share has no configuration server: an empty host says so,
   // and nothing is downloaded or waited for.
   const bool noServer = hostOverride.isString() && hostOverride.string().empty();
-  if (!data && syncing && noServer) {
+  if (!signedLayer && syncing && noServer) {
     VTC_LOG_INFO("No configuration server is set, using the default configuration");
-  } else if (!data && syncing) {
+  } else if (!signedLayer && syncing) {
     VTC_LOG_INFO("Downloading new Nubilo Client configuration: %@", url);
     std::string error;
-    data = vtc::fetchURL(url, &error);
+    std::optional<vtc::Bytes> data =
+        vtc::fetchURL(url, &error, most, vtc::Limits::kConfigurationKey);
     if (!data) {
       VTC_LOG_ERROR(
           "failed to download Nubilo configuration file from %@ with error: %@ using default "
           "configuration ",
           url, error);
-    } else if (!cacheFile.empty()) {
+    } else if ((signedLayer = config::verifiedConfiguration(*data)) && !cacheFile.empty()) {
       VTC_LOG_INFO("Cacheing Nubilo Client configuration");
       vtc::paths::makeDirectories(caches);
       std::ofstream(cacheFile, std::ios::binary | std::ios::trunc)
@@ -148,8 +157,6 @@ vtc::Dictionary VTCPrefsCenter::defaultConfiguration() {
     }
   }
 
-  std::optional<vtc::Dictionary> signedLayer;
-  if (data) signedLayer = config::verifiedConfiguration(*data);
   if (signedLayer) {
     configuration.merge(*signedLayer);
   } else if (syncing && !noServer) {
@@ -168,6 +175,7 @@ vtc::Dictionary VTCPrefsCenter::defaultConfiguration() {
   if (!overridden.empty())
     VTC_LOG_INFO("Overriding configuration keys with byHost keys for %@", overridden);
   configuration.merge(perHost);
+  vtc::setLimits(vtc::Limits::fromConfiguration(configuration));
 
   if (fresh) {
     const vtc::Value& coalesce =

@@ -1,15 +1,25 @@
-// Downloading changelogs: ranges in growing batches, and single ones. Only
-// one batch of unparsed bytes is held at a time, and the WebDAV session's
-// monitor is held for a batch's downloads only, never while parsing.
+// Downloading changelogs: ranges in growing batches, and single ones. Each
+// changelog is downloaded into a file of the temporary folder (so a large
+// one never sits whole in memory, and one larger than the limits allow is
+// given up while it arrives); only one batch of downloads is held at a time,
+// and the WebDAV session's monitor is held for a batch's downloads only,
+// never while parsing.
+#include <sys/stat.h>
+#include <unistd.h>
+
 #include <algorithm>
+#include <fstream>
+#include <iterator>
 #include <mutex>
 
 #include "VantorSyncManager/NubiloException.h"
 #include "VantorSyncManager/NubiloRemoteSession.h"
 #include "VantorSyncManager/PublicNames.h"
 #include "common/Logging.h"
+#include "common/Uuid.h"
 #include "platform/bus/DistributedNotifications.h"
 #include "platform/dav/TesselSession.h"
+#include "platform/fs/LocalPaths.h"
 
 namespace {
 
@@ -20,6 +30,37 @@ constexpr size_t kMappingThreshold = 32768;
 
 constexpr const char* kDownloadFailure =
     "Failed to download changelog for dataclass %@ with index %d transaction %@";
+constexpr const char* kEmptyChangelog =
+    "Empty changelog found for dataclass %@ with index %d transaction %@";
+
+// A downloaded changelog's file, removed unless a mapped changelog adopts it.
+struct Download {
+  int64_t index;
+  std::string file;
+  Download(int64_t i, std::string f) : index(i), file(std::move(f)) {}
+  Download(Download&& other) noexcept : index(other.index), file(std::move(other.file)) {
+    other.file.clear();
+  }
+  Download(const Download&) = delete;
+  ~Download() {
+    if (!file.empty()) ::unlink(file.c_str());
+  }
+  std::string release() { return std::exchange(file, std::string()); }
+};
+
+std::string downloadFile() {
+  return vtc::paths::join(vtc::paths::temporaryDirectory(), vtc::makeUUIDString() + ".clog");
+}
+
+uint64_t fileSize(const std::string& path) {
+  struct stat st {};
+  return ::stat(path.c_str(), &st) == 0 ? static_cast<uint64_t>(st.st_size) : 0;
+}
+
+vtc::Bytes readWhole(const std::string& path) {
+  std::ifstream in(path, std::ios::binary);
+  return vtc::Bytes(std::istreambuf_iterator<char>(in), std::istreambuf_iterator<char>());
+}
 
 }  // namespace
 
@@ -33,18 +74,24 @@ vtc::ChangeLogFetchResult NubiloRemoteSession::fetchChangeLogsForDataclass(
   int64_t size = kFirstBatchSize;
   for (int64_t start = from; start <= to;) {
     const int64_t end = std::min(start + size, to);
-    std::vector<std::pair<int64_t, vtc::Value>> batch;  // bodies, as data values
+    std::vector<Download> batch;
     {
       std::lock_guard<std::recursive_mutex> monitor(_TesselSession->monitor());
       for (int64_t index = start; index <= end; ++index) {
         if (_isCancelled) break;
-        DavTransaction t = getDataWithRetryAtPath(changeLogPathForDataclass(dataclass, index));
+        Download download(index, downloadFile());
+        DavTransaction t =
+            getDataWithRetryAtPath(changeLogPathForDataclass(dataclass, index), download.file);
         if (t.isSuccessful()) {
-          const vtc::Bytes& bytes = t.result().data();
-          VTC_LOG_INFO("Downloaded changelog %d (%d bytes) of %d for dataclass %@", index,
-                       bytes.size(), to, dataclass);
-          result.StorageConsumed += static_cast<int64_t>(bytes.size());
-          batch.emplace_back(index, t.takeResult());
+          const uint64_t bytes = fileSize(download.file);
+          // Taken for a changelog, no bytes would decode as no changes.
+          if (bytes == 0)
+            throw NubiloException(NubiloCorruptChangelogException,
+                                  vtc::format(kEmptyChangelog, dataclass, index, t));
+          VTC_LOG_INFO("Downloaded changelog %d (%d bytes) of %d for dataclass %@", index, bytes,
+                       to, dataclass);
+          result.StorageConsumed += static_cast<int64_t>(bytes);
+          batch.push_back(std::move(download));
           continue;
         }
         messageTraceTransactionFailure(t, true, 0, "Failed to get attributes on changelog");
@@ -59,20 +106,20 @@ vtc::ChangeLogFetchResult NubiloRemoteSession::fetchChangeLogsForDataclass(
               _TesselSession->basicAttributesAtPath(changeLogPathForDataclass(dataclass, index));
           if (attributes.isSuccessful() &&
               attributes.result().dictionary().get(kNBContentLength).integer() == 0)
-            throw NubiloException(
-                NubiloCorruptChangelogException,
-                vtc::format("Empty changelog found for dataclass %@ with index %d transaction %@",
-                            dataclass, index, t));
+            throw NubiloException(NubiloCorruptChangelogException,
+                                  vtc::format(kEmptyChangelog, dataclass, index, t));
         }
         throw NubiloException(NubiloFailedToDownloadChangelogException,
                               vtc::format(kDownloadFailure, dataclass, index, t));
       }
     }
     VTC_LOG_INFO("Processing batched clogs from %i to %i for %@", start, end, dataclass);
-    for (auto& [index, body] : batch) {
-      result.changeLogs[index] =
-          NubiloChangeLog::createChangeLogWithData(body.data(), kMappingThreshold);
-      body = vtc::Value();  // each body goes as soon as it is parsed
+    for (Download& download : batch) {
+      if (fileSize(download.file) < kMappingThreshold)
+        result.changeLogs[download.index] = std::make_unique<NubiloChangeLog>(
+            readWhole(download.file));  // the file goes with the download
+      else
+        result.changeLogs[download.index] = NubiloMappedChangelog::adoptingFile(download.release());
     }
     size = size < kLargestBatchSize ? size * 2 : kLargestBatchSize;
     start = end + 1;
@@ -82,11 +129,17 @@ vtc::ChangeLogFetchResult NubiloRemoteSession::fetchChangeLogsForDataclass(
 
 vtc::Bytes NubiloRemoteSession::fetchChangeLogForDataclass(const std::string& dataclass,
                                                            int64_t index) {
-  DavTransaction t = getDataWithRetryAtPath(changeLogPathForDataclass(dataclass, index));
+  Download download(index, downloadFile());
+  DavTransaction t =
+      getDataWithRetryAtPath(changeLogPathForDataclass(dataclass, index), download.file);
   if (!t.isSuccessful()) {
     messageTraceTransactionFailure(t, true, 0, "Failed download changelog");
     throw NubiloException(NubiloFailedToDownloadChangelogException,
                           vtc::format(kDownloadFailure, dataclass, index, t));
   }
-  return t.result().data();
+  vtc::Bytes bytes = readWhole(download.file);
+  if (bytes.empty())
+    throw NubiloException(NubiloCorruptChangelogException,
+                          vtc::format(kEmptyChangelog, dataclass, index, t));
+  return bytes;
 }

@@ -137,6 +137,13 @@ DavTransaction NubiloRemoteSession::getDataWithRetryAtPath(const std::string& pa
   return retrying(kGetPath, path, [&] { return _TesselSession->getDataAtPath(path); });
 }
 
+DavTransaction NubiloRemoteSession::getDataWithRetryAtPath(const std::string& path,
+                                                           const std::string& localDestination) {
+  return retrying(kGetPath, path, [&] {
+    return _TesselSession->getDataAtPath(path, std::nullopt, 0, 0, localDestination);
+  });
+}
+
 DavTransaction NubiloRemoteSession::putDataWithRetry(const vtc::Bytes& data,
                                                      const std::string& path) {
   return retrying(kPut, path, [&] { return _TesselSession->putData(data, path); });

@@ -18,7 +18,7 @@ TEST(BodyStream, AnUnterminatedIdentifierIsScannedOnce) {
   // step would take 2^16 scans of up to 4 MiB each.
   const Bytes zipped = *NubiloGzip(Bytes(4 << 20, 'x'));
   vtc::clog::BodyStream body(
-      zipped, [](const uint8_t*, const uint8_t*) {}, 64);
+      zipped, [](const uint8_t*, const uint8_t*) {}, {}, 64);
   const auto start = std::chrono::steady_clock::now();
   EXPECT_THAT([&] { body.readCString(); },
               testing::ThrowsMessage<NubiloException>(
@@ -34,7 +34,7 @@ TEST(BodyStream, RecordsAcrossManySmallStepsReadWhole) {
   NubiloAppendString(plain, "b");
   const Bytes zipped = *NubiloGzip(plain);
   vtc::clog::BodyStream body(
-      zipped, [](const uint8_t*, const uint8_t*) {}, 16);
+      zipped, [](const uint8_t*, const uint8_t*) {}, {}, 16);
   EXPECT_EQ(body.readCString(), std::string(300, 'a'));
   EXPECT_EQ(body.readUInt32(), 7u);
   const vtc::ByteView run = body.read(200);

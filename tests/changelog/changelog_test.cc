@@ -22,6 +22,7 @@
 #include "platform/engine/SyncEngine.h"
 #include "platform/plist/PlistCodec.h"
 #include "platform/prefs/PreferenceStore.h"
+#include "support/LogCapture.h"
 #include "support/TestHome.h"
 
 using testing::HasSubstr;
@@ -387,6 +388,46 @@ TEST_F(ChangeLog, TruncatedRecordsAndBadIndexesAreRefusedWithTheirReason) {
   }
 }
 
+TEST_F(ChangeLog, ARecordWhoseArchiveCannotBeDecodedIsPassedOverAndTheOthersRead) {
+  vtc::test::LogCapture logged;
+  auto record = [](Bytes& body, const std::string& identifier, const Bytes& archive) {
+    NubiloAppendString(body, identifier);
+    NubiloAppendUInt32(body, 2);
+    NubiloAppendUInt32(body, static_cast<uint32_t>(archive.size()));
+    body.insert(body.end(), archive.begin(), archive.end());
+  };
+  const Array changes{Value(setting("first", "Ann"))};
+  std::string deep = "<plist version=\"1.0\">";
+  for (int i = 0; i < 200; ++i) deep += "<array>";
+  for (int i = 0; i < 200; ++i) deep += "</array>";
+  deep += "</plist>";
+  Bytes body;
+  record(body, "first", vtc::plist::toBinary(changes));
+  record(body, "garbled", Bytes{'b', 'p', 'l', 'i', 's', 't', '0', '0', 1, 2, 3});
+  record(body, "too deep", Bytes(deep.begin(), deep.end()));
+  record(body, "no list", vtc::plist::toBinary(Value("text")));
+  record(body, "last", vtc::plist::toBinary(changes));
+  NubiloChangeLog log(changelogWithBody(5, body));
+  ASSERT_EQ(log.changes().size(), 2u);
+  EXPECT_EQ(log.changes()[1], SyncEngineChange(2, "last", changes));
+  ASSERT_EQ(log.refusedChanges().size(), 3u);
+  EXPECT_EQ(log.refusedChanges()[0].position, 1u);
+  EXPECT_EQ(log.refusedChanges()[1].recordIdentifier, "too deep");
+  EXPECT_EQ(log.refusedChanges()[1].reason,
+            "its archive is not a property list that can be read within its size");
+  EXPECT_EQ(log.refusedChanges()[2].reason, "its archive is not a list of changes");
+  EXPECT_THAT(logged.messages("Warning"),
+              testing::Contains("Record 3 (no list) of a changelog was passed over: its archive is "
+                                "not a list of changes"));
+  // The frame around the records is still whole or refused whole.
+  body.resize(body.size() - 1);
+  EXPECT_THAT(refusal(changelogWithBody(5, body)),
+              HasSubstr("record archive beyond the end of changelog data"));
+  EXPECT_TRUE(NubiloChangeLog(written(*std::make_unique<NubiloChangeLog>(sampleChanges())))
+                  .refusedChanges()
+                  .empty());
+}
+
 TEST_F(ChangeLog, TheErrorLineShowsOnlyTheHeadersReadFromTheseBytes) {
   EXPECT_THAT(refusal(Bytes{0, 0, 0}), StartsWith("Exception trying to decode changelog "));
   EXPECT_THAT(logText(),
@@ -513,9 +554,17 @@ TEST_F(ChangeLog, EverythingTheWriterAcceptsIsReadBack) {
   }
   // A long text repeated many times in one record is written out each time,
   // not shared: sharing it would ask the reader for more than it allows.
-  Array repeated(400, Value(std::string(20000, 'n')));
+  Array repeated(40, Value(std::string(20000, 'n')));
   NubiloChangeLog log(std::vector<SyncEngineChange>{SyncEngineChange(2, "notes", repeated)});
   EXPECT_EQ(NubiloChangeLog(written(log)).changes().at(0).changes(), repeated);
+  // Ten times as much inflates beyond what readers take from so few bytes.
+  NubiloChangeLog bomb(std::vector<SyncEngineChange>{
+      SyncEngineChange(2, "notes", Array(400, Value(std::string(20000, 'n'))))});
+  Bytes untouched{1, 2, 3};
+  EXPECT_THAT([&] { bomb.writeToData(untouched); },
+              testing::ThrowsMessage<std::invalid_argument>(
+                  testing::HasSubstr("readers refuse more than 256 times a changelog's size")));
+  EXPECT_EQ(untouched, (Bytes{1, 2, 3}));
 }
 
 }  // namespace

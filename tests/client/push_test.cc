@@ -161,6 +161,31 @@ TEST_F(Push, ABurstOfTenPushesGivesAtMostTwoRunsAndBsOwnAnnouncementsNone) {
   ASSERT_TRUE(vtc::local::waitUntil([&] { return runsOfB() >= 1; }));
   std::this_thread::sleep_for(std::chrono::milliseconds(1500));  // room for a third run
   EXPECT_LE(runsOfB(), 2u) << logOf(b);
+
+  // A message of 20 MB (the server keeps it back: B told it the largest it
+  // takes) and one nested four thousand deep (no announcement: ignored):
+  // neither starts a run, and the listener stays small.
+  const size_t runs = runsOfB();
+  const std::string topicText = topic->get(vtc::push::kTopicKey).string();
+  ASSERT_TRUE(other.publish(topicText, vtc::Bytes(20 << 20, 'x'), error)) << error;
+  std::string deep = "<plist version=\"1.0\">";
+  for (int i = 0; i < 4000; ++i) deep = deep + "<array>";
+  for (int i = 0; i < 4000; ++i) deep += "</array>";
+  deep += "</plist>";
+  ASSERT_LT(deep.size(), 64u << 10);
+  ASSERT_TRUE(other.publish(topicText, vtc::Bytes(deep.begin(), deep.end()), error)) << error;
+  std::this_thread::sleep_for(std::chrono::milliseconds(1000));
+  EXPECT_EQ(runsOfB(), runs);
+  EXPECT_THAT(logOf(b), HasSubstr("is no announcement of a computer; ignored"));
+  const std::string status = Computer::read("/proc/" + std::to_string(listener) + "/status");
+  const size_t peak = status.find("VmHWM:");
+  ASSERT_NE(peak, std::string::npos);
+#if defined(__SANITIZE_ADDRESS__)
+  const long most = 160L << 10;  // the sanitizer's own memory
+#else
+  const long most = 40L << 10;
+#endif
+  EXPECT_LT(std::stol(status.substr(peak + 6)), most) << "kB at most";
 }
 
 TEST_F(Push, TheListenerSurvivesARestartOfThePushServerAndCatchesUpOnWhatItMissed) {

@@ -20,6 +20,7 @@
 #include "platform/push/MqttConnection.h"
 #include "platform/push/PushRegistry.h"
 #include "platform/push/PushService.h"
+#include "platform/secrets/StoredAccount.h"
 #include "support/LogCapture.h"
 #include "support/MqttBroker.h"
 #include "support/TestHome.h"
@@ -54,17 +55,26 @@ class Notify : public ::testing::Test {
     PreferenceStore::shared().setValue(vtc::push::kPushServerKey, Value(broker->url()),
                                        kVantorDefaultsKey, Scope::AnyHost);
   }
-  // A subscriber to every sync topic, as another computer of the account.
-  std::unique_ptr<vtc::push::MqttConnection> subscriber() {
+  // A connection of an account of the push server, as another computer.
+  std::unique_ptr<vtc::push::MqttConnection> connection(const std::string& user,
+                                                        const std::string& password,
+                                                        vtc::CertificateTrust trust = {}) {
     vtc::push::MqttConnection::Options options;
     options.broker = *vtc::push::BrokerAddress::parse(broker->url());
-    options.clientId = "test-subscriber";
-    options.username = kAccount;
-    options.password = kPassword;
+    options.clientId = "test-" + user;
+    options.username = user;
+    options.password = password;
+    options.trust = std::move(trust);
     auto c = std::make_unique<vtc::push::MqttConnection>(options);
     std::string error;
     EXPECT_TRUE(c->connect(error)) << error;
-    EXPECT_TRUE(c->subscribe({"korvo/nubilo/syncdav/#"}, error)) << error;
+    return c;
+  }
+  // A subscriber to every sync topic of the account, as another computer.
+  std::unique_ptr<vtc::push::MqttConnection> subscriber(vtc::CertificateTrust trust = {}) {
+    auto c = connection(kAccount, kPassword, std::move(trust));
+    std::string error;
+    EXPECT_TRUE(c->subscribe({"korvo/nubilo/syncdav/" + kAccount + "/#"}, error)) << error;
     return c;
   }
   // The messages that reach the subscriber until one arrives on the marker
@@ -87,7 +97,7 @@ class Notify : public ::testing::Test {
     return received;
   }
   std::string topic(const std::string& dataclass) const {
-    return "korvo/nubilo/syncdav/" + vtc::push::accountDigest(kAccount) + "/" + dataclass;
+    return "korvo/nubilo/syncdav/" + kAccount + "/" + dataclass;
   }
   std::vector<vtc::push::Launchable> launchables() const {
     return vtc::push::readRegistrations().value_or(vtc::push::Registrations{}).launchables;
@@ -111,7 +121,6 @@ TEST_F(Notify, TwoPayloadsQueuedForADataclassArePublishedOnceWithTheSecond) {
   std::multimap<std::string, Value> received = until(*other, "marker");
   EXPECT_THAT(received, ElementsAre(std::pair(topic("com.korvo.Calendars"), Value("calendars")),
                                     std::pair(topic("com.korvo.Contacts"), Value("second"))));
-  EXPECT_THAT(topic("x"), testing::Not(HasSubstr(kAccount)));  // the account travels as a digest
   EXPECT_THAT(logged.messages("Info"),
               Contains("Publishing to topic = " + topic("com.korvo.Contacts")));
 }
@@ -141,15 +150,17 @@ TEST_F(Notify, EnablingQueuesTheDataclassEvenWhenTheTopicOrTheRegistrationFails)
   EXPECT_THAT(launchables()[0].arguments,
               ElementsAre("--sync", "--dataclasses", "com.korvo.Contacts"));
 
-  helper.enableDataclassForNotifications("com.korvo+odd");  // no topic can name it
-  EXPECT_EQ(launchables().size(), 1u);
+  helper.enableDataclassForNotifications("com.korvo+odd");  // a wildcard, escaped as a level
+  ASSERT_EQ(launchables().size(), 2u);
+  EXPECT_EQ(launchables()[1].topic, topic("com.korvo%2Bodd"));
+  helper.disableDataclassForNotifications("com.korvo+odd");
   const std::string file = *vtc::push::registrationsFile();
   std::filesystem::rename(file, file + ".kept");
   std::filesystem::create_directories(file);  // the registrations cannot be read
   helper.enableDataclassForNotifications("com.korvo.Calendars");
   EXPECT_THAT(logged.messages("Warning"),
-              ElementsAre("Cannot enable notification launch for dataclass com.korvo.Calendars - "
-                          "error code 5 returned."));
+              Contains("Cannot enable notification launch for dataclass com.korvo.Calendars - "
+                       "error code 5 returned."));
   auto queued = prefs.getQueuedDataclasses(true).value_or(std::vector<std::string>{});
   std::ranges::sort(queued);
   EXPECT_THAT(queued, ElementsAre("com.korvo+odd", "com.korvo.Calendars", "com.korvo.Contacts"));
@@ -169,6 +180,17 @@ TEST_F(Notify, EnablingQueuesTheDataclassEvenWhenTheTopicOrTheRegistrationFails)
               "Cannot disable notification launch for dataclass com.korvo.Contacts - error code 2 "
               "returned.");
   EXPECT_TRUE(prefs.getQueuedDataclasses(true).value_or(std::vector<std::string>{}).empty());
+
+  // A helper made bare registers for the account stored in the
+  // preferences, one whose name holds a wildcard and a separator too.
+  const std::string plus = "alice+sync/home@example.org";
+  PreferenceStore::shared().setValue(vtc::kAccountNameKey, Value(plus), kVantorDefaultsKey,
+                                     Scope::AnyHost);
+  NotifyHelper bare("com.korvo.NubiloPrefs");
+  bare.enableDataclassForNotifications("com.korvo.Contacts");
+  ASSERT_EQ(launchables().size(), 1u);
+  EXPECT_EQ(launchables()[0].topic,
+            "korvo/nubilo/syncdav/alice%2Bsync%2Fhome@example.org/com.korvo.Contacts");
 }
 
 TEST_F(Notify, TheLoginSessionIsAddedOnlyWhenNoneIsAndNothingMovesWhileItsStateIsUnknown) {
@@ -219,36 +241,88 @@ TEST_F(Notify, AMissingOrRefusingServerLeavesNoSessionPublishingIsTriedAndNoPass
   EXPECT_THAT(logged.messages("Warning"),
               Contains(StartsWith("Could not open a push session: the push server at " +
                                   broker->url() + " refused the connection")));
+
   for (const auto& line : logged.lines()) {
     EXPECT_THAT(line.message, testing::Not(HasSubstr("wrong password")));
     EXPECT_THAT(line.message, testing::Not(HasSubstr(kPassword)));
   }
 }
 
-TEST_F(Notify, OverTlsTheSessionTrustsTheAuthorityItIsPointedAtAndNoOther) {
+TEST_F(Notify, OverTlsTheSessionTrustsTheAuthorityItIsGivenOrThePinnedCertificateAlone) {
   startBroker(true);
-  const char* previous = std::getenv("SSL_CERT_FILE");
-  const std::string kept = previous ? previous : "";
-  setenv("SSL_CERT_FILE", broker->certificateFile().c_str(), 1);
-  auto other = subscriber();
+  auto set = [](const char* key, const std::string& value) {
+    PreferenceStore::shared().setValue(key, value.empty() ? Value() : Value(value),
+                                       kVantorDefaultsKey, Scope::AnyHost);
+  };
+  auto sessionWarning = [&] {
+    NotifyHelper::resetSharedHelperForTesting();
+    NotifyHelper::notificationSessionForAccount(kAccount, kPassword);
+    const auto warnings = logged.messages("Warning");
+    return warnings.empty() ? std::string() : warnings.back();
+  };
+  set(vtc::push::kPushCaFileKey, broker->certificateFile());
+  auto other = subscriber({broker->certificateFile(), ""});
+  const std::string digest = other->certificateDigest();
+  EXPECT_THAT(digest, testing::MatchesRegex("([0-9a-f]{2}:){31}[0-9a-f]{2}"));
   NotifyHelper& helper = NotifyHelper::notificationSessionForAccount(kAccount, kPassword);
   helper.addDataclassToNotify("com.korvo.Contacts", Value("over TLS"));
   helper.addDataclassToNotify("marker", Value());
   helper.sendNotifications();
   EXPECT_EQ(until(*other, "marker").count(topic("com.korvo.Contacts")), 1u);
+  EXPECT_THAT(logged.messages("Warning"), testing::Not(Contains(HasSubstr("unencrypted"))));
 
-  NotifyHelper::resetSharedHelperForTesting();
-  const std::string empty = home.path() + "/no-authorities.pem";
-  vtc::local::Computer::write(empty, "");
-  setenv("SSL_CERT_FILE", empty.c_str(), 1);
-  NotifyHelper::notificationSessionForAccount(kAccount, kPassword);
+  set(vtc::push::kPushCaFileKey, "");  // the server's own authority is no system one
+  EXPECT_EQ(sessionWarning(),
+            "Could not schedule the Beacon Notification session - invalid "
+            "session returned");
   EXPECT_THAT(logged.messages("Warning"),
-              Contains("Could not schedule the Beacon Notification session - invalid session "
-                       "returned"));
-  if (previous)
-    setenv("SSL_CERT_FILE", kept.c_str(), 1);
-  else
-    unsetenv("SSL_CERT_FILE");
+              Contains("Could not open a push session: the push server at " + broker->url() +
+                       " has a certificate that no authority this computer trusts vouches for"));
+
+  set(vtc::push::kPushPinnedCertificateKey, digest);  // trusted alone, no authority needed
+  const size_t warnings = logged.messages("Warning").size();
+  sessionWarning();
+  EXPECT_EQ(logged.messages("Warning").size(), warnings);
+
+  set(vtc::push::kPushPinnedCertificateKey, std::string(digest).replace(0, 2, "00"));
+  sessionWarning();
+  EXPECT_THAT(logged.messages("Warning"),
+              Contains("Could not open a push session: the push server at " + broker->url() +
+                       " shows a certificate other than the pinned one (its SHA-256 digest is "
+                       "now " +
+                       digest + ")"));
+}
+
+TEST_F(Notify, AnotherAccountOfTheServerCanNeitherReadNorTriggerTheAccountsPushes) {
+  startBroker();
+  auto own = subscriber();
+  auto mallory =
+      connection(vtc::test::MqttBroker::kOtherUser, vtc::test::MqttBroker::kOtherPassword);
+  std::vector<std::string> seen;
+  mallory->setMessageHandler(
+      [&](const vtc::push::MqttConnection::Message& m) { seen.push_back(m.topic); });
+  std::string error;
+  // Refused by the server, or granted and never served: either way nothing.
+  mallory->subscribe({"korvo/nubilo/syncdav/#"}, error);
+  mallory->subscribe(
+      {"korvo/nubilo/syncdav/" + std::string(vtc::test::MqttBroker::kOtherUser) + "/#"}, error);
+  // A push that would start a sync on the account's computers.
+  mallory->publish(topic("com.korvo.Contacts"), {}, error);
+
+  NotifyHelper& helper = NotifyHelper::notificationSessionForAccount(kAccount, kPassword);
+  helper.addDataclassToNotify("com.korvo.Calendars", Value("own"));
+  helper.addDataclassToNotify("marker", Value());
+  helper.sendNotifications();
+  EXPECT_THAT(until(*own, "marker"),
+              ElementsAre(std::pair(topic("com.korvo.Calendars"), Value("own"))));
+  // Its own topics work as ever.
+  const std::string itsOwn =
+      "korvo/nubilo/syncdav/" + std::string(vtc::test::MqttBroker::kOtherUser) + "/x";
+  ASSERT_TRUE(mallory->publish(itsOwn, {}, error)) << error;
+  const auto deadline = std::chrono::steady_clock::now() + std::chrono::seconds(5);
+  while (std::ranges::count(seen, itsOwn) == 0 && std::chrono::steady_clock::now() < deadline)
+    mallory->poll(std::chrono::milliseconds(50));
+  EXPECT_THAT(seen, testing::AllOf(testing::Not(testing::IsEmpty()), testing::Each(itsOwn)));
 }
 
 }  // namespace

@@ -9,6 +9,7 @@
 #include <unistd.h>
 
 #include <filesystem>
+#include <functional>
 #include <fstream>
 #include <thread>
 
@@ -537,6 +538,26 @@ TEST_F(Fetch, EachDownloadFailingInEachWayRaisesItsKind) {
   proxy.answer({"GET", third, 0}, 500);
   EXPECT_EQ(failureOf([&] { quick->fetchChangeLogForDataclass(kDataclass, 3); }).first,
             NubiloFailedToDownloadChangelogException);
+
+  // A changelog of no bytes, answered 200, is an empty one: damage, whichever
+  // fetch meets it, and nothing of it is left in the temporary folder.
+  proxy.clear();
+  std::filesystem::resize_file(dataclassFolder(kDataclass) + "/00003.clog", 0);
+  const std::string temporary = home.path() + "/tmp";
+  std::filesystem::create_directories(temporary);
+  const std::optional<std::string> was =
+      std::getenv("TMPDIR") ? std::optional<std::string>(std::getenv("TMPDIR")) : std::nullopt;
+  ::setenv("TMPDIR", temporary.c_str(), 1);
+  for (auto fetch : std::vector<std::function<void()>>{
+           [&] { quick->fetchChangeLogsForDataclass(kDataclass, 1, 5); },
+           [&] { quick->fetchChangeLogForDataclass(kDataclass, 3); }}) {
+    auto [name, reason] = failureOf(fetch);
+    EXPECT_EQ(name, NubiloCorruptChangelogException);
+    EXPECT_THAT(reason, StartsWith("Empty changelog found for dataclass com.korvo.Contacts with "
+                                   "index 3 transaction"));
+  }
+  EXPECT_TRUE(std::filesystem::is_empty(temporary));
+  was ? ::setenv("TMPDIR", was->c_str(), 1) : ::unsetenv("TMPDIR");
 }
 
 TEST_P(Transfer, DirectoriesOfChangelogsAndTakingBackTheNewestCommit) {
@@ -618,27 +639,40 @@ TEST_P(Transfer, ReportsAreFlattenedAndStoredUnderTheMachinesUUID) {
   EXPECT_EQ(vtc::flattenedSyncReport({}, std::nullopt, std::nullopt),
             (vtc::Dictionary{{"appName", "Granite"}, {"Version", "1"}, {"SyncStatus:code", "0"}}));
 
-  // The machine id stands in for an unreadable firmware UUID.
+  // The machine id keyed with the application's id: never the id itself.
   std::ofstream(home.path() + "/machine-id") << "0123456789abcdef0123456789abcdef\n";
-  vtc::os::setIdentityFilesForTesting(home.path() + "/missing", home.path() + "/missing-too");
+  vtc::os::setIdentityFileForTesting(home.path() + "/missing");
   EXPECT_FALSE(getHostUUIDString());
   EXPECT_THAT(logged.messages("Warning"),
               testing::Contains("getHostUUIDString: unable to determine UUID for host. "
                                 "Error: 2"));
-  vtc::os::setIdentityFilesForTesting(home.path() + "/missing", home.path() + "/machine-id");
-  EXPECT_EQ(getHostUUIDString(), "01234567-89AB-CDEF-0123-456789ABCDEF");
-  vtc::os::setIdentityFilesForTesting("", home.path() + "/missing");  // kept once found
-  EXPECT_EQ(getHostUUIDString(), "01234567-89AB-CDEF-0123-456789ABCDEF");
+  vtc::os::setIdentityFileForTesting(home.path() + "/machine-id");
+  EXPECT_EQ(getHostUUIDString(), "741A1DFD-7F8E-4733-9325-6F6DBE2C9B34");
+  vtc::os::setIdentityFileForTesting(home.path() + "/missing");  // kept once found
+  EXPECT_EQ(getHostUUIDString(), "741A1DFD-7F8E-4733-9325-6F6DBE2C9B34");
+  // Derived as systemd derives an application's id from this machine's.
+  if (std::filesystem::exists("/etc/machine-id")) {
+    int error = 0;
+    vtc::os::setIdentityFileForTesting("");
+    const std::optional<std::string> system = vtc::os::hostUUID(error);
+    std::filesystem::copy_file("/etc/machine-id", home.path() + "/copy-of-machine-id");
+    vtc::os::setIdentityFileForTesting(home.path() + "/copy-of-machine-id");
+    EXPECT_EQ(vtc::os::hostUUID(error), system);
+    std::string hex = system.value_or("");
+    std::erase(hex, '-');
+    std::ranges::transform(hex, hex.begin(), [](char c) { return std::tolower(c); });
+    EXPECT_NE(hex, vtc::os::machineId());
+  }
 
   session->sendReportingInfo(summary);
   session->sendReportingInfo(summary);  // the second finds the collection
   auto stored = vtc::plist::readFile(
-      share.diskPath(session->syncPath() + "/Reports/01234567-89AB-CDEF-0123-456789ABCDEF.plist"));
+      share.diskPath(session->syncPath() + "/Reports/741A1DFD-7F8E-4733-9325-6F6DBE2C9B34.plist"));
   ASSERT_TRUE(stored);
   EXPECT_EQ(stored->dictionary().get("Contacts:clogCount").string(), "3");
   EXPECT_EQ(stored->dictionary().get("RespondingServer").string(),
             session->respondingServer().value_or("?"));
-  vtc::os::setIdentityFilesForTesting("", "");
+  vtc::os::setIdentityFileForTesting("");
 }
 
 }  // namespace

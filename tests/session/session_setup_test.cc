@@ -12,6 +12,7 @@
 
 #include "VantorSyncManager/NubiloException.h"
 #include "VantorSyncManager/PublicNames.h"
+#include "common/SecretMemory.h"
 #include "localshare/ApacheShare.h"
 #include "platform/dav/TesselSession.h"
 #include "support/Failures.h"
@@ -180,7 +181,9 @@ TEST_F(SessionSetup, AllRequestsOfASessionShareOneConnection) {
   session->lockClients();  // locks too: neon's own would open a connection each
   session->relockClients();
   session->unlockClients();
+  EXPECT_FALSE(vtc::processIsDumpable());  // while it holds the password
   session.reset();
+  EXPECT_TRUE(vtc::processIsDumpable());
   auto log = share.accessEntries();
   std::set<int> ports;
   for (const auto& e : log) ports.insert(e.clientPort);

@@ -22,26 +22,6 @@ using local::listenLoopback;
 
 namespace {
 
-bool sendAll(int fd, std::string_view data) {
-  while (!data.empty()) {
-    ssize_t n = ::send(fd, data.data(), data.size(), MSG_NOSIGNAL);
-    if (n <= 0) return false;
-    data.remove_prefix(static_cast<size_t>(n));
-  }
-  return true;
-}
-
-// The length of the first whole request in buf, or 0 while none is complete.
-// The library sends every body with a Content-Length.
-size_t requestLength(const std::string& buf) {
-  size_t headEnd = buf.find("\r\n\r\n");
-  if (headEnd == std::string::npos) return 0;
-  std::string head = buf.substr(0, headEnd + 2);
-  const char* length = ::strcasestr(head.c_str(), "\r\ncontent-length:");
-  size_t total = headEnd + 4 + (length ? std::strtoul(length + 17, nullptr, 10) : 0);
-  return buf.size() < total ? 0 : total;
-}
-
 std::string answerWith(int status) {
   std::string response = "HTTP/1.1 " + std::to_string(status) + " Injected\r\n";
   if (status == 401) response += "WWW-Authenticate: Basic realm=\"Tessel\"\r\n";
@@ -131,10 +111,13 @@ void FaultProxy::serve(int client) {
       if (n <= 0) break;
       if (!swallowing) pending.append(buf, static_cast<size_t>(n));
       while (open && !swallowing) {
-        size_t length = requestLength(pending);
+        size_t length = httpRequestLength(pending);
         if (length == 0) break;
         Rule rule = decide(pending);
-        if (rule.action == "timed out")
+        if (rule.answer)
+          open = sendAnswer(client, *rule.answer, wake_) &&
+                 rule.answer->head.find("Content-Length:") != std::string::npos;
+        else if (rule.action == "timed out")
           swallowing = true;
         else if (rule.action == "dropped")
           open = false;

@@ -1,15 +1,19 @@
 // A fault-injecting HTTP proxy between the library and a server on
 // 127.0.0.1. It forwards everything byte for byte, except requests that a
 // rule matches: those time out (swallowed, never answered), lose their
-// connection, or get an answer of the test's choosing. Requests are matched
-// by method and unescaped path, on every occurrence or only the nth.
+// connection, or get an answer of the test's choosing (a status, or any
+// bytes at any pace: HostileServer.h). Requests are matched by method and
+// unescaped path, on every occurrence or only the nth.
 // Rules and records may be touched from any thread while the proxy serves.
 #pragma once
 
+#include <memory>
 #include <mutex>
 #include <string>
 #include <thread>
 #include <vector>
+
+#include "support/HostileServer.h"
 
 namespace vtc::test {
 
@@ -34,16 +38,21 @@ class FaultProxy {
 
   int port() const { return port_; }
 
-  void timeOut(Match match) { add({std::move(match), "timed out"}); }
-  void dropConnection(Match match) { add({std::move(match), "dropped"}); }
+  void timeOut(Match match) { add({std::move(match), "timed out", 0, 0, 0, nullptr}); }
+  void dropConnection(Match match) { add({std::move(match), "dropped", 0, 0, 0, nullptr}); }
   // Answers with this status and no body instead of forwarding; a 401
   // carries a Basic challenge.
   void answer(Match match, int status) {
-    add({std::move(match), "answered " + std::to_string(status), status});
+    add({std::move(match), "answered " + std::to_string(status), status, 0, 0, nullptr});
+  }
+  // Answers with exactly these bytes instead of forwarding.
+  void respond(Match match, HostileAnswer answer) {
+    add({std::move(match), "answered by the test", 0, 0, 0,
+         std::make_shared<HostileAnswer>(std::move(answer))});
   }
   // Holds the request this long, then forwards it.
   void delay(Match match, int milliseconds) {
-    add({std::move(match), "delayed", 0, 0, milliseconds});
+    add({std::move(match), "delayed", 0, 0, milliseconds, nullptr});
   }
   void clear();
 
@@ -58,6 +67,7 @@ class FaultProxy {
     int status = 0;  // of an answer
     int seen = 0;    // matching requests so far
     int delayMs = 0;
+    std::shared_ptr<const HostileAnswer> answer;
   };
 
   void add(Rule rule);

@@ -31,13 +31,16 @@ MqttBroker::MqttBroker(Options options) : options_(options) {
   port_ = local::freeLoopbackPort();
   // The password goes through a file that mosquitto_passwd hashes in
   // place: never a command line.
-  writeFile(root_ + "/passwords",
-            std::string(local::ApacheShare::kUser) + ":" + local::ApacheShare::kPassword + "\n");
+  writeFile(root_ + "/passwords", std::string(local::ApacheShare::kUser) + ":" +
+                                      local::ApacheShare::kPassword + "\n" + kOtherUser + ":" +
+                                      kOtherPassword + "\n");
+  writeFile(root_ + "/access", std::string(kAccessRule) + "\n");
   if (std::system(("mosquitto_passwd -U '" + root_ + "/passwords' >/dev/null 2>&1").c_str()) != 0)
     throw std::runtime_error("mosquitto_passwd failed");
   std::string config = "listener " + std::to_string(port_) + " 127.0.0.1\n" +
-                       "allow_anonymous false\npassword_file " + root_ +
-                       "/passwords\npersistence false\nlog_dest file " + root_ + "/broker.log\n";
+                       "allow_anonymous false\npassword_file " + root_ + "/passwords\nacl_file " +
+                       root_ + "/access\npersistence false\nlog_dest file " + root_ +
+                       "/broker.log\n";
   // Started as root, mosquitto would give up its rights and lose its files.
   if (::geteuid() == 0) config += "user root\n";
   if (options_.tls) {

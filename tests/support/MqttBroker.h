@@ -1,6 +1,7 @@
 // A private mosquitto push server for one test: its own configuration under
-// a temporary folder, one account (the share's member and password, kept
-// hashed in a password file), optionally TLS with a self-signed certificate
+// a temporary folder, two accounts (the share's member and another, kept
+// hashed in a password file) each confined to its own topics by the per-user
+// rule that the README shows, optionally TLS with a self-signed certificate
 // for 127.0.0.1. Started in the foreground on a free 127.0.0.1 port, stopped
 // by its PID; it can be started again on the same port.
 #pragma once
@@ -16,6 +17,11 @@ class MqttBroker {
   struct Options {
     bool tls = false;
   };
+  // The account besides the share's member.
+  static constexpr const char* kOtherUser = "mallory";
+  static constexpr const char* kOtherPassword = "another secret";
+  // The rule each account is held to.
+  static constexpr const char* kAccessRule = "pattern readwrite korvo/nubilo/syncdav/%u/#";
 
   MqttBroker() : MqttBroker(Options{}) {}
   explicit MqttBroker(Options options);

@@ -30,6 +30,10 @@ int main(int argc, char** argv) {
       std::printf("%s: readable changelog, format %u, %zu changes\n", argv[2], log->version(),
                   log->changes().size());
     }
+    // Records read past are told, not silently left out.
+    for (const vtc::RefusedChange& r : log->refusedChanges())
+      std::printf("record %zu (%s) passed over: %s\n", r.position, r.recordIdentifier.c_str(),
+                  r.reason.c_str());
     return 0;
   } catch (const NubiloException& e) {
     std::fprintf(stderr, "%s: %s\n", argv[2], e.reason().c_str());

@@ -88,8 +88,9 @@ pid_t Computer::start(const std::vector<std::string>& args) const {
 struct Computer::Exec {
   std::vector<std::string> argv, env;
   std::vector<char*> cargv, cenv;
-  Exec(const std::vector<std::string>& args, std::vector<std::string> environment)
-      : env(std::move(environment)) {
+  Exec(const std::vector<std::string>& args, std::vector<std::string> environment,
+       std::vector<std::string> before = {})
+      : argv(std::move(before)), env(std::move(environment)) {
     // A profiler or debugger the client runs under, for measurements:
     // VSM_CLIENT_WRAPPER="valgrind --tool=callgrind".
     if (const char* wrapper = std::getenv("VSM_CLIENT_WRAPPER")) {
@@ -103,7 +104,11 @@ struct Computer::Exec {
     for (auto& v : env) cenv.push_back(v.data());
     cenv.push_back(nullptr);
   }
-  [[noreturn]] void run() const {
+  [[noreturn]] void run(uint64_t addressSpace = 0) const {
+    if (addressSpace > 0) {
+      const rlimit limit{addressSpace, addressSpace};
+      ::setrlimit(RLIMIT_AS, &limit);
+    }
     ::execve(cargv[0], cargv.data(), cenv.data());
     ::_exit(127);
   }
@@ -117,7 +122,7 @@ pid_t Computer::spawn(const std::vector<std::string>& args, const std::string& i
     ::dup2(::open(input.c_str(), O_RDONLY), 0);  // a file: never a terminal
     ::dup2(::open(out.c_str(), O_WRONLY | O_CREAT | O_TRUNC, 0644), 1);
     ::dup2(::open(err.c_str(), O_WRONLY | O_CREAT | O_TRUNC, 0644), 2);
-    exec.run();
+    exec.run(addressSpace_);
   }
   return pid;
 }
@@ -172,6 +177,7 @@ Computer::Result Computer::finish(pid_t pid) const {
   ::wait4(pid, &status, 0, &usage);
   r.cpuSeconds = static_cast<double>(usage.ru_utime.tv_sec + usage.ru_stime.tv_sec) +
                  static_cast<double>(usage.ru_utime.tv_usec + usage.ru_stime.tv_usec) / 1e6;
+
   r.status = WIFEXITED(status) ? WEXITSTATUS(status) : 128 + WTERMSIG(status);
   r.out = read(home_ + "/.last-out");
   r.err = read(home_ + "/.last-err");
@@ -187,6 +193,22 @@ Computer::Result Computer::run(const std::vector<std::string>& args,
   const std::string inputFile = home_ + "/.last-in";
   write(inputFile, input);
   return finish(spawn(args, inputFile));
+}
+
+Computer::Result Computer::runMeasured(const std::vector<std::string>& args) const {
+  const std::string usage = home_ + "/.last-usage";
+  const Exec exec(args, environment(), {"/usr/bin/time", "-q", "-f", "%e %M", "-o", usage});
+  const std::string out = home_ + "/.last-out", err = home_ + "/.last-err";
+  pid_t pid = ::fork();
+  if (pid == 0) {
+    ::dup2(::open("/dev/null", O_RDONLY), 0);
+    ::dup2(::open(out.c_str(), O_WRONLY | O_CREAT | O_TRUNC, 0644), 1);
+    ::dup2(::open(err.c_str(), O_WRONLY | O_CREAT | O_TRUNC, 0644), 2);
+    exec.run(addressSpace_);
+  }
+  Result r = finish(pid);
+  std::istringstream(read(usage)) >> r.seconds >> r.peakKilobytes;
+  return r;
 }
 
 Computer::Result Computer::runOnTerminal(const std::vector<std::string>& args) const {

@@ -5,6 +5,7 @@
 
 #include <sys/types.h>
 
+#include <cstdint>
 #include <map>
 #include <string>
 #include <vector>
@@ -19,8 +20,10 @@ class Computer {
     int status = -1;
     std::string out;
     std::string err;
-    double cpuSeconds = 0;  // user and system time of the run
-    bool timedOut = false;  // killed at the time limit; err ends with its threads' stacks
+    double cpuSeconds = 0;   // user and system time of the run
+    double seconds = 0;      // wall time (runMeasured)
+    long peakKilobytes = 0;  // the most memory the run had resident (runMeasured)
+    bool timedOut = false;   // killed at the time limit; err ends with its threads' stacks
   };
 
   // A run still going after this long is taken to hang: finish() notes the
@@ -40,6 +43,9 @@ class Computer {
 
   // Runs nubilosyncclient with these arguments and waits for it.
   Result run(const std::vector<std::string>& args, const std::string& input = {}) const;
+  // The same, measured by GNU time: the run's own wall time and peak memory
+  // (a child forked from the test would count the test's pages as its own).
+  Result runMeasured(const std::vector<std::string>& args) const;
   // Runs it on a pseudo-terminal, as a person at a terminal would; out holds
   // everything it drew there.
   Result runOnTerminal(const std::vector<std::string>& args) const;
@@ -56,6 +62,8 @@ class Computer {
 
   // Sets an environment variable of the client's processes (PATH, for one).
   void setEnvironment(const std::string& name, const std::string& value);
+  // Gives the client's processes no more address space than this (0: no limit).
+  void setAddressSpaceLimit(uint64_t bytes) { addressSpace_ = bytes; }
 
   // This computer's per-host preference file (it has a machine id of its own).
   std::string perHostFile() const;
@@ -77,6 +85,7 @@ class Computer {
   std::string home_;
   std::string machineId_;
   std::map<std::string, std::string> environment_;
+  uint64_t addressSpace_ = 0;
 };
 
 // The path of the built nubilosyncclient.

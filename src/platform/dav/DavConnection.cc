@@ -7,6 +7,11 @@
 #include <cctype>
 #include <cstring>
 
+#include "common/Format.h"
+#include "common/Limits.h"
+#include "common/Logging.h"
+#include "platform/network/PlainConnection.h"
+
 namespace vtc {
 
 namespace {
@@ -47,12 +52,15 @@ DavConnection::DavConnection(DavEndpoint endpoint, std::string user, std::string
   if (!userAgent.empty()) ne_set_useragent(session_, userAgent.c_str());
   locks_ = ne_lockstore_create();
   ne_lockstore_register(locks_, session_);
+  deadline_ = std::make_unique<RequestDeadline>(session_);
   setReadTimeout(readTimeout);
 }
 
 DavConnection::~DavConnection() {
+  deadline_.reset();
   if (session_) ne_session_destroy(session_);
   if (locks_) ne_lockstore_destroy(locks_);
+  wipe(password_);
 }
 
 void DavConnection::setReadTimeout(int seconds) {
@@ -63,23 +71,64 @@ void DavConnection::setReadTimeout(int seconds) {
   if (used_) ne_close_connection(session_);
 }
 
+void DavConnection::allowNextAnswer(uint64_t bytes, const char* key) {
+  nextAnswer_.emplace(bytes, key);
+}
+
 DavTransaction DavConnection::perform(const std::string& method, const std::string& path,
                                       const std::function<int()>& run) {
   capture_ = Capture{};
   used_ = true;
-  int result = run();
+  std::tie(answerCap_, answerKey_) =
+      nextAnswer_.value_or(std::pair(limits().answerBytes, Limits::kAnswerKey));
+  nextAnswer_.reset();
+  int result = NE_ERROR;
+  const bool late = deadline_->run(readTimeout_, run, result);
   DavTransaction t(method, path);
+  if (late) {
+    t.setOutcome(false, 106, kNoHTTPStatus, kTransactionNoAnswer);
+    t.setErrorText(format("no complete answer within %d seconds", readTimeout_));
+    return t;
+  }
   applyOutcome(t, result, capture_.status, method);
   if (capture_.status != kNoHTTPStatus) t.setResponseHeaders(capture_.headers);
-  if (!t.isSuccessful()) {
+  if (capture_.overCap) {
+    t.setOutcome(false, 153, capture_.status, kTransactionCompleted);
+    t.setErrorText(
+        overLimitText(format("The answer to %@ %@", method, path), answerCap_, answerKey_));
+  } else if (!t.isSuccessful()) {
     const char* error = ne_get_error(session_);
     t.setErrorText(error ? error : "");
   }
   return t;
 }
 
-void DavConnection::onCreateRequest(ne_request*, void* userdata, const char*, const char*) {
-  static_cast<DavConnection*>(userdata)->capture_ = Capture{};
+void DavConnection::onCreateRequest(ne_request* req, void* userdata, const char*, const char*) {
+  auto* self = static_cast<DavConnection*>(userdata);
+  self->capture_ = Capture{};
+  // Every answer is counted, error pages too, before any reader keeps it.
+  ne_add_response_body_reader(req, &DavConnection::acceptBody, &DavConnection::countBody, self);
+}
+
+int DavConnection::acceptBody(void* userdata, ne_request* req, const ne_status* status) {
+  auto* self = static_cast<DavConnection*>(userdata);
+  // Noted here too: a body given up before its end leaves no later hook.
+  self->capture_.status = status ? status->code : kNoHTTPStatus;
+  // A length announced beyond the cap is refused at the body's first bytes.
+  if (const char* length = ne_get_response_header(req, "Content-Length"))
+    self->capture_.bodyBytes =
+        std::strtoull(length, nullptr, 10) > self->answerCap_ ? self->answerCap_ : 0;
+  return 1;
+}
+
+int DavConnection::countBody(void* userdata, const char*, size_t len) {
+  auto* self = static_cast<DavConnection*>(userdata);
+  if (len == 0) return 0;  // the end of the body
+  self->capture_.bodyBytes += len;
+  if (self->capture_.bodyBytes <= self->answerCap_) return 0;
+  self->capture_.overCap = true;
+  ne_set_error(self->session_, "%s", "answer over its size limit");
+  return -1;
 }
 
 int DavConnection::onPostSend(ne_request* req, void* userdata, const ne_status* status) {
@@ -101,6 +150,13 @@ int DavConnection::onAuthenticate(void* userdata, const char*, int attempt, char
   auto* self = static_cast<DavConnection*>(userdata);
   // One try per challenge: wrong credentials fail at once instead of looping.
   if (attempt > 0) return -1;
+  if (self->endpoint_.scheme != "https")
+    if (auto warning =
+            network::passwordInClearWarning(self->user_, self->endpoint_.host,
+                                            format("%@://%@:%d", self->endpoint_.scheme,
+                                                   self->endpoint_.host, self->endpoint_.port),
+                                            "HTTP"))
+      VTC_LOG_WARNING("%@", *warning);
   ne_strnzcpy(username, self->user_.c_str(), NE_ABUFSIZ);
   ne_strnzcpy(password, self->password_.c_str(), NE_ABUFSIZ);
   return 0;

@@ -1,11 +1,16 @@
 // One neon session to one server: credentials, TLS (ServerCertificate.h),
 // time-outs, the lock store, and the capture of each request's status and
 // headers. Every request of a session travels over its one persistent
-// connection. Not thread-safe: callers serialise (TesselSession's monitor).
+// connection. Each request has a deadline for its whole answer (the read
+// time-out) and a cap on the bytes of its answer (common/Limits.h); a
+// password sent over plain HTTP to another computer is noted with a Warning
+// line each time.
+// Not thread-safe: callers serialise (TesselSession's monitor).
 #pragma once
 
 #include <cstdint>
 #include <functional>
+#include <memory>
 #include <optional>
 #include <string>
 
@@ -15,6 +20,8 @@
 
 #include "VantorSyncManager/DavTransaction.h"
 #include "VantorSyncManager/Value.h"
+#include "common/SecretMemory.h"
+#include "platform/dav/RequestDeadline.h"
 #include "platform/dav/ServerCertificate.h"
 
 namespace vtc {
@@ -58,14 +65,21 @@ class DavConnection {
   // Why the server's certificate was refused last; none when it was not.
   std::optional<CertificateRefusal> certificateRefusal() const { return refusal_; }
 
-  // Read and connect time-out in seconds (neon's resolution). neon applies it
-  // when it connects, so a change closes an open connection.
+  // Read and connect time-out in seconds (neon's resolution), and the
+  // deadline of each whole answer. neon applies it when it connects, so a
+  // change closes an open connection.
   void setReadTimeout(int seconds);
+
+  // The answer of the next request may be this large (else the answer cap
+  // of the limits), the sentence naming key when it is larger.
+  void allowNextAnswer(uint64_t bytes, const char* key);
 
   // Runs `run`, which issues one logical request through session() (neon
   // may send it more than once for authentication) and returns neon's result
   // code, and maps the outcome onto a transaction: result code, HTTP status of
-  // the final answer, completion state and response headers.
+  // the final answer, completion state and response headers. An answer that
+  // did not come whole within the deadline is a time-out (106); one over its
+  // cap is refused (153), with a sentence in the error text.
   DavTransaction perform(const std::string& method, const std::string& path,
                          const std::function<int()>& run);
 
@@ -73,7 +87,11 @@ class DavConnection {
   struct Capture {
     int status = kNoHTTPStatus;
     std::optional<Dictionary> headers;
+    uint64_t bodyBytes = 0;
+    bool overCap = false;
   };
+  static int acceptBody(void* userdata, ne_request* req, const ne_status* status);
+  static int countBody(void* userdata, const char* buf, size_t len);
   static void onCreateRequest(ne_request* req, void* userdata, const char* method,
                               const char* requri);
   static int onPostSend(ne_request* req, void* userdata, const ne_status* status);
@@ -84,9 +102,14 @@ class DavConnection {
   DavEndpoint endpoint_;
   std::string user_;
   std::string password_;
+  SecretHold hold_;
   ne_session* session_ = nullptr;
   ne_lock_store* locks_ = nullptr;
+  std::unique_ptr<RequestDeadline> deadline_;
   Capture capture_;
+  uint64_t answerCap_ = 0;  // of the request under way
+  const char* answerKey_ = "";
+  std::optional<std::pair<uint64_t, const char*>> nextAnswer_;
   ServerTraits traits_;
   CertificateTrust trust_;
   std::string certificateDigest_;

@@ -3,6 +3,7 @@
 #include <ne_basic.h>
 #include <ne_props.h>
 
+#include "common/SecretMemory.h"
 #include "platform/dav/DavConnection.h"
 #include "platform/dav/DavPaths.h"
 #include "platform/secrets/StoredAccount.h"
@@ -10,9 +11,13 @@
 MemberAccount::MemberAccount(std::string name, std::string password, std::string applicationID)
     : name_(std::move(name)),
       password_(std::move(password)),
-      applicationID_(std::move(applicationID)) {}
+      applicationID_(std::move(applicationID)),
+      hold_(std::make_unique<vtc::SecretHold>()) {}
 
-MemberAccount::~MemberAccount() = default;
+MemberAccount::~MemberAccount() {
+  connection_.reset();
+  vtc::wipe(password_);
+}
 
 std::shared_ptr<MemberAccount> MemberAccount::accountWithName(std::string name,
                                                               std::string password,

@@ -92,7 +92,9 @@ class TesselSession {
                                        const std::string& nameSpace);
 
   // GET. The result is the body as data, or nothing when it went to
-  // localDestination. A range is sent unless both ends are 0.
+  // localDestination. A range is sent unless both ends are 0. A body in
+  // memory may be as large as the limits' answer cap, one written to a file
+  // as large as their changelog cap; a failed download to a file removes it.
   DavTransaction getDataAtPath(const std::string& path, std::optional<vtc::Date> ifModifiedSince,
                                int64_t rangeStart, int64_t rangeEnd,
                                const std::optional<std::string>& localDestination);

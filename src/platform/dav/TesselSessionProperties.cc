@@ -10,6 +10,8 @@
 #include <functional>
 
 #include "VantorSyncManager/PublicNames.h"
+#include "common/Format.h"
+#include "common/Limits.h"
 #include "platform/dav/DavConnection.h"
 #include "platform/dav/DavMultistatus.h"
 #include "platform/dav/DavPaths.h"
@@ -48,6 +50,21 @@ DavTransaction runPropfind(
   if (parsed) {
     std::vector<vtc::PropfindEntry> entries = vtc::readMultistatus(*builder.root());
     onParsed(t, entries);
+  } else if (t.transactionState() == vtc::kTransactionCompleted &&
+             !vtc::overLimitIn(t.errorText())) {
+    // An answer, but not one of WebDAV: say what came instead.
+    const int status = t.httpStatusCode();
+    const char* xmlError = ne_xml_failed(parser) ? ne_xml_get_error(parser) : nullptr;
+    if (xmlError && vtc::overLimitIn(xmlError))
+      t.setErrorText(xmlError);
+    else if (status / 100 == 2 && status != 207)
+      t.setErrorText(vtc::format(
+          "the answer to PROPFIND was not WebDAV: HTTP %d where a 207 multistatus was expected",
+          status));
+    else if (status == 207)
+      t.setErrorText(
+          vtc::format("the answer to PROPFIND was not WebDAV: its XML cannot be read (%@)",
+                      vtc::clipped(xmlError ? xmlError : "no root element", 200)));
   }
   ne_xml_destroy(parser);
   return t;

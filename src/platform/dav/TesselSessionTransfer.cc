@@ -9,6 +9,7 @@
 
 #include <cstdio>
 
+#include "common/Limits.h"
 #include "platform/dav/DavConnection.h"
 #include "platform/dav/DavPaths.h"
 #include "platform/dav/TesselSession.h"
@@ -56,6 +57,8 @@ DavTransaction TesselSession::getDataAtPath(const std::string& path,
       t.setErrorText("cannot write " + *localDestination);
       return t;
     }
+    // A file takes what a changelog may be; memory what any answer may.
+    connection_->allowNextAnswer(vtc::limits().changelogBytes, vtc::Limits::kChangelogKey);
   } else {
     sink.memory = &body;
   }
@@ -78,6 +81,8 @@ DavTransaction TesselSession::getDataAtPath(const std::string& path,
     return ret;
   });
   if (sink.fd >= 0) ::close(sink.fd);
+  // A failed download leaves nothing behind: a part of an answer is no file.
+  if (!t.isSuccessful() && localDestination) ::unlink(localDestination->c_str());
   if (t.isSuccessful() && !localDestination) t.setResult(vtc::Value(std::move(body)));
   return t;
 }

@@ -1,6 +1,10 @@
 #include "platform/dav/XmlTree.h"
 
+#include <algorithm>
+
 #include "VantorSyncManager/StringAdditions.h"
+#include "common/Format.h"
+#include "common/Limits.h"
 
 namespace vtc {
 
@@ -39,7 +43,9 @@ std::string XmlElement::innerXml() const {
   return out;
 }
 
-XmlTreeBuilder::XmlTreeBuilder(ne_xml_parser* parser) {
+XmlTreeBuilder::XmlTreeBuilder(ne_xml_parser* parser)
+    : parser_(parser),
+      elementsLeft_(std::max<size_t>(kFewestElements, limits().answerBytes / kBytesPerElement)) {
   ne_xml_push_handler(parser, startElement, characters, endElement, this);
 }
 
@@ -48,7 +54,20 @@ int XmlTreeBuilder::startElement(void* userdata, int, const char* nspace, const 
   auto* self = static_cast<XmlTreeBuilder*>(userdata);
   // No answer of ours nests deeply; a server that does is refused rather
   // than allowed to exhaust the stack of the recursive readers.
-  if (self->stack_.size() >= kMaxDepth) return NE_XML_ABORT;
+  if (self->stack_.size() >= kMaxDepth) {
+    ne_xml_set_error(self->parser_, "the answer's XML nests too deep");
+    return NE_XML_ABORT;
+  }
+  if (self->elementsLeft_ == 0) {
+    const size_t allowed =
+        std::max<size_t>(kFewestElements, limits().answerBytes / kBytesPerElement);
+    ne_xml_set_error(self->parser_,
+                     format("The answer holds more than %d XML elements (the limit %@)", allowed,
+                            Limits::kAnswerKey)
+                         .c_str());
+    return NE_XML_ABORT;
+  }
+  --self->elementsLeft_;
   auto element = std::make_unique<XmlElement>();
   element->ns = nspace ? nspace : "";
   element->name = name ? name : "";

@@ -26,10 +26,17 @@ struct XmlElement {
 };
 
 // Collects every element of a document into a tree. Push it onto a parser
-// before the parser sees the document; root() is valid afterwards.
+// before the parser sees the document; root() is valid afterwards. A
+// document nested deeper than kMaxDepth, or holding more elements than its
+// answer's size cap allows (each element costs a hundred bytes or more
+// here, from as few as four of XML), is refused with a sentence as the
+// parser's error.
 class XmlTreeBuilder {
  public:
   static constexpr size_t kMaxDepth = 64;
+  // Bytes of the answer cap per element allowed, and the fewest allowed.
+  static constexpr size_t kBytesPerElement = 64;
+  static constexpr size_t kFewestElements = 65536;
 
   explicit XmlTreeBuilder(ne_xml_parser* parser);
   const XmlElement* root() const { return root_.get(); }
@@ -40,6 +47,8 @@ class XmlTreeBuilder {
   static int characters(void* userdata, int state, const char* cdata, size_t len);
   static int endElement(void* userdata, int state, const char* nspace, const char* name);
 
+  ne_xml_parser* parser_;
+  size_t elementsLeft_;
   std::unique_ptr<XmlElement> root_;
   std::vector<XmlElement*> stack_;
 };

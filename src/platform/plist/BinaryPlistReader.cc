@@ -40,8 +40,9 @@ void appendUtf8(std::string& out, uint32_t c) {
 
 class Reader {
  public:
-  explicit Reader(ByteView bytes)
+  Reader(ByteView bytes, ReadBudget* shared)
       : p_(bytes.data()),
+        shared_(shared),
         size_(bytes.size()),
         // A tree-shaped document yields one value per reference it holds,
         // and every reference takes at least a byte. Sharing an object
@@ -112,7 +113,7 @@ class Reader {
       }
       case kData: {
         uint64_t length;
-        if (!lengthAt(at, low, length) || !fits(at, length) || !spend(length)) return false;
+        if (!lengthAt(at, low, length) || !fits(at, length) || !spend(length, length)) return false;
         out = Value(Bytes(p_ + at, p_ + at + length));
         return true;
       }
@@ -166,7 +167,7 @@ class Reader {
   bool charge(uint64_t n) {
     if (n > refBudget_) return false;
     refBudget_ -= n;
-    return true;
+    return !shared_ || shared_->spend(n * ReadBudget::kValueCost);
   }
 
   // Puts container ref, holding count references, on the path at depth. One
@@ -180,10 +181,12 @@ class Reader {
     return true;
   }
 
-  bool spend(uint64_t bytes) {
-    if (bytes > byteBudget_) return false;
-    byteBudget_ -= bytes;
-    return true;
+  // Takes the most that text or data of n bytes may cost from this
+  // document's budget, and what it does cost from the shared one.
+  bool spend(uint64_t most, uint64_t costs) {
+    if (most > byteBudget_) return false;
+    byteBudget_ -= most;
+    return !shared_ || shared_->spend(costs);
   }
 
   // Where object ref starts; objects lie between the magic and the table.
@@ -230,8 +233,10 @@ class Reader {
     const uint8_t* s = p_ + at;
     std::string& decoded = text_;
     if ((marker >> 4) == kAsciiString) {
-      if (!fits(at, length) || !spend(3 * length)) return false;
-      if (isAscii(s, length)) {
+      if (!fits(at, length)) return false;
+      const bool ascii = isAscii(s, length);
+      if (!spend(3 * length, ascii ? length : 3 * length)) return false;
+      if (ascii) {
         text = std::string_view(reinterpret_cast<const char*>(s), length);
         return true;
       }
@@ -242,7 +247,7 @@ class Reader {
       text = decoded;
       return true;
     }
-    if (length > (tableAt_ - at) / 2 || !spend(3 * length)) return false;
+    if (length > (tableAt_ - at) / 2 || !spend(3 * length, 3 * length)) return false;
     decoded.clear();
     decoded.reserve(length);
     for (uint64_t i = 0; i < length; ++i) {
@@ -264,6 +269,7 @@ class Reader {
   }
 
   const uint8_t* p_;
+  ReadBudget* shared_;
   size_t size_;
   std::string text_;              // decoded text, reused
   uint64_t path_[kMaxDepth + 1];  // the containers from the top down to the one being read
@@ -277,8 +283,8 @@ class Reader {
 
 }  // namespace
 
-std::optional<Value> parseBinary(ByteView bytes) {
-  Reader reader(bytes);
+std::optional<Value> parseBinary(ByteView bytes, ReadBudget* shared) {
+  Reader reader(bytes, shared);
   uint64_t top;
   Value value;
   if (!reader.open(top) || !reader.readTop(top, value)) return std::nullopt;

@@ -7,6 +7,7 @@
 #include <algorithm>
 #include <cstdio>
 #include <cstdlib>
+#include <cstring>
 #include <fstream>
 #include <iterator>
 
@@ -73,81 +74,163 @@ using PlistPtr = std::unique_ptr<void, PlistFree>;
   return nullptr;
 }
 
-Value fromPlist(::plist_t node) {
-  if (!node) return {};
+namespace {
+
+// Reads one node at depth; false when it nests too deep or goes over budget.
+bool read(::plist_t node, unsigned depth, ReadBudget* budget, Value& out) {
+  if (budget && !budget->spend(ReadBudget::kValueCost)) return false;
+  if (!node) return true;
   switch (plist_get_node_type(node)) {
     case PLIST_BOOLEAN: {
       uint8_t b = 0;
       plist_get_bool_val(node, &b);
-      return Value(b != 0);
+      out = Value(b != 0);
+      return true;
     }
     case PLIST_UINT: {
       uint64_t u = 0;
       plist_get_uint_val(node, &u);
-      return Value(static_cast<long long>(u));
+      out = Value(static_cast<long long>(u));
+      return true;
     }
     case PLIST_REAL: {
       double d = 0;
       plist_get_real_val(node, &d);
-      return Value(d);
+      out = Value(d);
+      return true;
     }
     case PLIST_STRING:
     case PLIST_KEY: {
       uint64_t len = 0;
       const char* s = plist_get_string_ptr(node, &len);
-      return Value(std::string(s ? s : "", static_cast<size_t>(len)));
+      if (budget && !budget->spend(len)) return false;
+      out = Value(std::string(s ? s : "", static_cast<size_t>(len)));
+      return true;
     }
     case PLIST_DATE: {
       int32_t sec = 0, usec = 0;
       plist_get_date_val(node, &sec, &usec);
       auto us =
           std::chrono::microseconds((int64_t{sec} + binary::kEpochOffsetSeconds) * 1000000 + usec);
-      return Value(Date(std::chrono::duration_cast<Date::duration>(us)));
+      out = Value(Date(std::chrono::duration_cast<Date::duration>(us)));
+      return true;
     }
     case PLIST_DATA: {
       uint64_t len = 0;
       const char* p = plist_get_data_ptr(node, &len);
+      if (budget && !budget->spend(len)) return false;
       const auto* bytes = reinterpret_cast<const uint8_t*>(p);
-      return Value(Bytes(bytes, bytes + len));
+      out = Value(Bytes(bytes, bytes + len));
+      return true;
     }
     case PLIST_ARRAY: {
-      Array array;
-      uint32_t n = plist_array_get_size(node);
+      const uint32_t n = plist_array_get_size(node);
+      if (n > 0 && depth >= binary::kMaxDepth) return false;
+      Array& array = out.mutableArray();
       array.reserve(n);
-      for (uint32_t i = 0; i < n; ++i) array.push_back(fromPlist(plist_array_get_item(node, i)));
-      return Value(std::move(array));
+      for (uint32_t i = 0; i < n; ++i)
+        if (!read(plist_array_get_item(node, i), depth + 1, budget, array.emplace_back()))
+          return false;
+      return true;
     }
     case PLIST_DICT: {
-      Dictionary dict;
+      if (plist_dict_get_size(node) > 0 && depth >= binary::kMaxDepth) return false;
+      Dictionary& dict = out.mutableDictionary();
       plist_dict_iter it = nullptr;
       plist_dict_new_iter(node, &it);
+      bool ok = true;
       for (;;) {
         char* key = nullptr;
         ::plist_t item = nullptr;
         plist_dict_next_item(node, it, &key, &item);
         if (!key) break;
-        dict.set(key, fromPlist(item));
+        Value value;
+        ok = (!budget || budget->spend(std::strlen(key))) && read(item, depth + 1, budget, value);
+        if (ok) dict.set(key, std::move(value));
         std::free(key);
+        if (!ok) break;
       }
       std::free(it);
-      return Value(std::move(dict));
+      return ok;
     }
     default:
-      return {};
+      return true;
   }
 }
 
-std::optional<Value> parse(ByteView bytes) {
+// Whether the elements of an XML document nest no deeper than limit. Tags
+// are counted without parsing: comments, processing instructions and CDATA
+// do not nest, a self-closed element neither. A document type with an
+// internal subset (entity declarations) is refused: property lists have
+// none.
+bool nestsWithin(ByteView xml, unsigned limit) {
+  const auto* p = reinterpret_cast<const char*>(xml.data());
+  const std::string_view text(p, xml.size());
+  unsigned depth = 0;
+  size_t i = 0;
+  auto skipPast = [&](std::string_view end) {
+    const size_t at = text.find(end, i);
+    i = at == std::string_view::npos ? text.size() : at + end.size();
+  };
+  while ((i = text.find('<', i)) != std::string_view::npos) {
+    const std::string_view rest = text.substr(i);
+    if (rest.starts_with("<?")) {
+      skipPast("?>");
+    } else if (rest.starts_with("<!--")) {
+      skipPast("-->");
+    } else if (rest.starts_with("<![CDATA[")) {
+      skipPast("]]>");
+    } else if (rest.starts_with("<!")) {
+      const size_t close = rest.find('>');
+      if (rest.substr(0, close).find('[') != std::string_view::npos) return false;
+      skipPast(">");
+    } else {
+      // To the end of the tag, past quoted attribute values.
+      const bool closing = rest.starts_with("</");
+      char quote = 0;
+      size_t j = i + 1;
+      for (; j < text.size(); ++j) {
+        if (quote) {
+          if (text[j] == quote) quote = 0;
+        } else if (text[j] == '"' || text[j] == '\'') {
+          quote = text[j];
+        } else if (text[j] == '>') {
+          break;
+        }
+      }
+      const bool selfClosed = j < text.size() && text[j - 1] == '/';
+      if (closing) {
+        if (depth > 0) --depth;
+      } else if (!selfClosed && ++depth > limit) {
+        return false;
+      }
+      i = j;
+    }
+  }
+  return true;
+}
+
+}  // namespace
+
+std::optional<Value> fromPlist(::plist_t node, ReadBudget* budget) {
+  Value out;
+  if (!read(node, 0, budget, out)) return std::nullopt;
+  return out;
+}
+
+std::optional<Value> parse(ByteView bytes, ReadBudget* budget) {
   if (bytes.empty() || bytes.size() > UINT32_MAX) return std::nullopt;
   if (bytes.size() >= binary::kMagicSize &&
       std::equal(binary::kMagic, binary::kMagic + binary::kMagicSize, bytes.begin()))
-    return parseBinary(bytes);
+    return parseBinary(bytes, budget);
+  // The value's depth plus the <plist> element and the top value's own.
+  if (!nestsWithin(bytes, binary::kMaxDepth + 2)) return std::nullopt;
   ::plist_t root = nullptr;
   plist_from_memory(reinterpret_cast<const char*>(bytes.data()),
                     static_cast<uint32_t>(bytes.size()), &root);
   if (!root) return std::nullopt;
   PlistPtr owner(root);
-  return fromPlist(root);
+  return fromPlist(root, budget);
 }
 
 std::string toXml(const Value& value) {

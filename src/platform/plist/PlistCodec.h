@@ -10,6 +10,7 @@
 #include <plist/plist.h>
 
 #include "VantorSyncManager/Value.h"
+#include "platform/plist/BinaryPlistReader.h"
 
 namespace vtc::plist {
 
@@ -17,11 +18,16 @@ namespace vtc::plist {
 // A none value has no property-list form and yields nullptr.
 ::plist_t toPlist(const Value& value);
 
-// The value of a libplist node (a none value for a null node or a UID).
-Value fromPlist(::plist_t node);
+// The value of a libplist node (a none value for a null node or a UID);
+// nullopt when it nests deeper than readers read (binary::kMaxDepth) or
+// goes over the budget given.
+std::optional<Value> fromPlist(::plist_t node, ReadBudget* budget = nullptr);
 
-// Parses XML or binary property-list bytes; nullopt when they are neither.
-std::optional<Value> parse(ByteView bytes);
+// Parses XML or binary property-list bytes; nullopt when they are neither,
+// nest deeper than binary::kMaxDepth, or go over the budget given. XML is
+// measured before libplist builds anything, so that no document can nest
+// deep enough to exhaust the stack of a recursive reader.
+std::optional<Value> parse(ByteView bytes, ReadBudget* budget = nullptr);
 
 std::string toXml(const Value& value);
 Bytes toBinary(const Value& value);

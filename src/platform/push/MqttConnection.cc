@@ -1,7 +1,11 @@
 #include "platform/push/MqttConnection.h"
 
 #include <mosquitto.h>
+#include <mqtt_protocol.h>
 #include <netdb.h>
+#include <openssl/evp.h>
+#include <openssl/ssl.h>
+#include <openssl/x509v3.h>
 #include <poll.h>
 #include <sys/socket.h>
 #include <unistd.h>
@@ -11,6 +15,11 @@
 #include <cstring>
 #include <mutex>
 #include <regex>
+
+#include "common/Format.h"
+#include "common/Limits.h"
+#include "common/Logging.h"
+#include "platform/network/PlainConnection.h"
 
 namespace vtc::push {
 
@@ -61,6 +70,35 @@ std::string reasonOf(int rc) {
   return mosquitto_strerror(rc);
 }
 
+// Room in a packet beside its payload: the topic and the headers.
+constexpr uint32_t kPacketOverhead = 1024;
+
+// Certificate failures that only say no trusted authority vouches.
+bool onlyUntrusted(int error) {
+  switch (error) {
+    case X509_V_ERR_DEPTH_ZERO_SELF_SIGNED_CERT:
+    case X509_V_ERR_SELF_SIGNED_CERT_IN_CHAIN:
+    case X509_V_ERR_UNABLE_TO_GET_ISSUER_CERT:
+    case X509_V_ERR_UNABLE_TO_GET_ISSUER_CERT_LOCALLY:
+    case X509_V_ERR_UNABLE_TO_VERIFY_LEAF_SIGNATURE:
+    case X509_V_ERR_CERT_UNTRUSTED:
+      return true;
+    default:
+      return false;
+  }
+}
+
+// The SHA-256 digest of a certificate as colon-separated lower-case hex
+// pairs, the form in which the share's certificates are pinned.
+std::string digestOf(X509* cert) {
+  unsigned char md[EVP_MAX_MD_SIZE];
+  unsigned int length = 0;
+  if (!cert || X509_digest(cert, EVP_sha256(), md, &length) != 1) return {};
+  std::string out;
+  for (unsigned int i = 0; i < length; ++i) out += format(i ? ":%02x" : "%02x", md[i]);
+  return out;
+}
+
 }  // namespace
 
 std::optional<BrokerAddress> BrokerAddress::parse(const std::string& url) {
@@ -84,9 +122,11 @@ std::string BrokerAddress::url() const {
 }
 
 MqttConnection::MqttConnection(Options options) : options_(std::move(options)) {
+  if (!options_.password.empty()) hold_.emplace();
   initialiseOnce();
   mosq_ = mosquitto_new(options_.clientId.c_str(), options_.cleanSession, this);
   if (!mosq_) return;
+  mosquitto_int_option(mosq_, MOSQ_OPT_PROTOCOL_VERSION, MQTT_PROTOCOL_V5);
   mosquitto_connect_callback_set(mosq_, &MqttConnection::onConnect);
   mosquitto_disconnect_callback_set(mosq_, &MqttConnection::onDisconnect);
   mosquitto_publish_callback_set(mosq_, &MqttConnection::onPublish);
@@ -102,6 +142,8 @@ MqttConnection::~MqttConnection() {
     mosquitto_loop(mosq_, 0, 1);  // sends the DISCONNECT
   }
   mosquitto_destroy(mosq_);
+  if (tls_) SSL_CTX_free(tls_);
+  wipe(options_.password);
 }
 
 void MqttConnection::onConnect(mosquitto*, void* self, int rc) {
@@ -129,6 +171,15 @@ void MqttConnection::onUnsubscribe(mosquitto*, void* self, int mid) {
 void MqttConnection::onMessage(mosquitto*, void* self, const mosquitto_message* message) {
   auto* c = static_cast<MqttConnection*>(self);
   if (!c->handler_ || !message->topic) return;
+  const uint64_t most = limits().pushMessageBytes;
+  if (static_cast<uint64_t>(std::max(0, message->payloadlen)) > most) {
+    // Only a server that ignores the size it was told sends one.
+    if (c->dropped_++ % 100 == 0)
+      VTC_LOG_WARNING("Dropped a push message on %@: %@", clipped(message->topic, 200),
+                      overLimitText(format("a message of %d bytes", message->payloadlen), most,
+                                    Limits::kPushMessageKey));
+    return;
+  }
   const auto* bytes = static_cast<const uint8_t*>(message->payload);
   c->handler_(Message{message->topic, Bytes(bytes, bytes + std::max(0, message->payloadlen))});
 }
@@ -154,6 +205,51 @@ bool MqttConnection::waitFor(const std::function<bool()>& done, std::string& err
   return true;
 }
 
+bool MqttConnection::prepareTls(std::string& error) {
+  if (tls_) return true;
+  tls_ = SSL_CTX_new(TLS_client_method());
+  if (!tls_) {
+    error = "no TLS context could be made";
+    return false;
+  }
+  SSL_CTX_set_min_proto_version(tls_, TLS1_2_VERSION);
+  SSL_CTX_set_default_verify_paths(tls_);
+  if (!options_.trust.caFile.empty() &&
+      SSL_CTX_load_verify_locations(tls_, options_.trust.caFile.c_str(), nullptr) != 1) {
+    error = "the authority's certificate " + options_.trust.caFile + " cannot be read";
+    return false;
+  }
+  X509_VERIFY_PARAM* param = SSL_CTX_get0_param(tls_);
+  if (X509_VERIFY_PARAM_set1_ip_asc(param, options_.broker.host.c_str()) != 1)
+    X509_VERIFY_PARAM_set1_host(param, options_.broker.host.c_str(), 0);
+  SSL_CTX_set_app_data(tls_, this);
+  SSL_CTX_set_verify(tls_, SSL_VERIFY_PEER, &MqttConnection::verifyCertificate);
+  mosquitto_int_option(mosq_, MOSQ_OPT_SSL_CTX_WITH_DEFAULTS, 0);  // this context as it is
+  mosquitto_void_option(mosq_, MOSQ_OPT_SSL_CTX, tls_);
+  return true;
+}
+
+int MqttConnection::verifyCertificate(int preverified, X509_STORE_CTX* context) {
+  auto* ssl =
+      static_cast<SSL*>(X509_STORE_CTX_get_ex_data(context, SSL_get_ex_data_X509_STORE_CTX_idx()));
+  auto* self = static_cast<MqttConnection*>(SSL_CTX_get_app_data(SSL_get_SSL_CTX(ssl)));
+  self->certificateDigest_ = digestOf(X509_STORE_CTX_get0_cert(context));
+  const int failure = X509_STORE_CTX_get_error(context);
+  // Expired, another name, a broken chain: refused, pinned or not.
+  if (!preverified && !onlyUntrusted(failure)) {
+    self->refusal_ = CertificateRefusal::Invalid;
+    return 0;
+  }
+  const std::string& pinned = self->options_.trust.pinnedDigest;
+  if (!pinned.empty()) {
+    if (self->certificateDigest_ == pinned) return 1;  // the pinned one alone decides
+    self->refusal_ = CertificateRefusal::Changed;
+    return 0;
+  }
+  if (!preverified) self->refusal_ = CertificateRefusal::Untrusted;
+  return preverified;
+}
+
 bool MqttConnection::connect(std::string& error) {
   if (!mosq_) {
     error = "no MQTT client could be made";
@@ -161,7 +257,12 @@ bool MqttConnection::connect(std::string& error) {
   }
   if (!options_.username.empty())
     mosquitto_username_pw_set(mosq_, options_.username.c_str(), options_.password.c_str());
-  if (options_.broker.tls) mosquitto_int_option(mosq_, MOSQ_OPT_TLS_USE_OS_CERTS, 1);
+  refusal_.reset();
+  if (options_.broker.tls && !prepareTls(error)) return false;
+  if (!options_.broker.tls && !options_.password.empty())
+    if (auto warning = network::passwordInClearWarning(options_.username, options_.broker.host,
+                                                       options_.broker.url(), "MQTT"))
+      VTC_LOG_WARNING("%@", *warning);
   connectResult_ = -1;
   connected_ = false;
   std::string unreachable;
@@ -170,15 +271,38 @@ bool MqttConnection::connect(std::string& error) {
     return false;
   }
   const int keepAlive = 30;
-  int rc = mosquitto_connect(mosq_, options_.broker.host.c_str(), options_.broker.port, keepAlive);
+  // The largest packet this client takes; a server keeps larger ones back.
+  mosquitto_property* properties = nullptr;
+  const uint64_t most = limits().pushMessageBytes + kPacketOverhead;
+  mosquitto_property_add_int32(&properties, MQTT_PROP_MAXIMUM_PACKET_SIZE,
+                               static_cast<uint32_t>(std::min<uint64_t>(most, UINT32_MAX)));
+  int rc = mosquitto_connect_bind_v5(mosq_, options_.broker.host.c_str(), options_.broker.port,
+                                     keepAlive, nullptr, properties);
+  mosquitto_property_free_all(&properties);
+  // The handshake may end in mosquitto_connect or in the wait after it.
+  auto refused = [&] {
+    if (!refusal_) return false;
+    error = "the push server at " + options_.broker.url() + " " +
+            (*refusal_ == CertificateRefusal::Changed
+                 ? "shows a certificate other than the pinned one (its SHA-256 digest is now " +
+                       certificateDigest_ + ")"
+             : *refusal_ == CertificateRefusal::Untrusted
+                 ? "has a certificate that no authority this computer trusts vouches for"
+                 : "has a certificate that is expired, issued to another name or badly chained");
+    return true;
+  };
   if (rc != MOSQ_ERR_SUCCESS) {
-    error = "cannot reach the push server at " + options_.broker.url() + ": " + reasonOf(rc);
+    if (!refused())
+      error = "cannot reach the push server at " + options_.broker.url() + ": " + reasonOf(rc);
     return false;
   }
-  if (!waitFor([&] { return connectResult_ >= 0; }, error, "connection")) return false;
+  if (!waitFor([&] { return connectResult_ >= 0; }, error, "connection")) {
+    refused();
+    return false;
+  }
   if (connectResult_ != 0) {
     error = "the push server at " + options_.broker.url() +
-            " refused the connection: " + mosquitto_connack_string(connectResult_);
+            " refused the connection: " + mosquitto_reason_string(connectResult_);
     return false;
   }
   return true;

@@ -20,8 +20,7 @@ namespace vtc::push {
 namespace {
 
 bool usableTopicPart(const std::string& part) {
-  return !part.empty() && part.find_first_of("/+#") == std::string::npos &&
-         part.find('\0') == std::string::npos;
+  return !part.empty() && part.find_first_of(std::string_view("/+#\0", 4)) == std::string::npos;
 }
 
 // A client id the broker has not seen: a second connection with the id of
@@ -55,12 +54,24 @@ std::optional<BrokerAddress> configuredBroker() {
   return BrokerAddress::parse(url.string());
 }
 
+CertificateTrust configuredBrokerTrust() {
+  auto& store = prefs::PreferenceStore::shared();
+  auto text = [&](const char* key) {
+    const Value v = store.copyValue(key, kVantorDefaultsKey, prefs::Scope::AnyHost);
+    return v.isString() ? v.string() : std::string();
+  };
+  CertificateTrust trust{text(kPushCaFileKey), text(kPushPinnedCertificateKey)};
+  if (trust.caFile.empty()) trust.caFile = text("tls_ca_file");
+  return trust;
+}
+
 std::unique_ptr<Session> createSession(const std::string& account, const std::string& password,
                                        EventCallback callback, void* context) {
   std::optional<BrokerAddress> broker = configuredBroker();
   if (!broker) return nullptr;
   MqttConnection::Options options;
   options.broker = *broker;
+  options.trust = configuredBrokerTrust();
   options.clientId = freshClientId();
   options.username = account;
   options.password = password;
@@ -88,14 +99,28 @@ std::string accountDigest(const std::string& account) {
   return hex;
 }
 
+std::string topicLevel(std::string_view text) {
+  std::string out;
+  out.reserve(text.size());
+  for (const char c : text) {
+    const auto byte = static_cast<unsigned char>(c);
+    if (c == '%' || c == '/' || c == '+' || c == '#' || byte < 0x20 || byte == 0x7F)
+      out += format("%%%02X", byte);
+    else
+      out += c;
+  }
+  return out;
+}
+
 int32_t createTopic(const std::string& account, const std::string& organisation,
                     const std::string& service, const std::string& subService,
                     const std::string& dataclass, std::optional<Dictionary>& topicInformation) {
   topicInformation.reset();
-  for (const std::string* part : {&account, &organisation, &service, &subService, &dataclass})
+  for (const std::string* part : {&organisation, &service, &subService})
     if (!usableTopicPart(*part)) return EINVAL;
+  if (account.empty() || dataclass.empty()) return EINVAL;
   const std::string topic = organisation + "/" + service + "/" + subService + "/" +
-                            accountDigest(account) + "/" + dataclass;
+                            topicLevel(account) + "/" + topicLevel(dataclass);
   topicInformation = Dictionary{{kTopicKey, Value(topic)}};
   return 0;
 }

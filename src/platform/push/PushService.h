@@ -3,10 +3,14 @@
 //
 // A session is one MQTT connection to the user's push server (the per-user
 // preference "push_server_url", mqtt[s]://HOST[:PORT]) authenticated with
-// the account and its password. A topic is
-// "<organisation>/<service>/<sub-service>/<digest of the account>/<dataclass>":
-// the account name never travels in clear. A payload is a property list
-// (binary form on the wire). Launchables and on-load sessions are kept in
+// the account and its password; over TLS it trusts the authority of
+// "push_ca_file" (else the share's "tls_ca_file") and, when set, only the
+// certificate pinned in "push_pinned_certificate". A topic is
+// "<organisation>/<service>/<sub-service>/<account>/<dataclass>", the account
+// and the dataclass escaped as topic levels (topicLevel), so that a broker's
+// per-user rule ("pattern readwrite korvo/nubilo/syncdav/%u/#") confines each
+// account to its own topics. A payload is a property list (binary form on
+// the wire). Launchables and on-load sessions are kept in
 // the registrations file (PushRegistry.h); the on-load session is the user
 // service that runs `nubilosyncclient listen`.
 //
@@ -19,6 +23,7 @@
 #include <memory>
 #include <optional>
 #include <string>
+#include <string_view>
 #include <vector>
 
 #include "VantorSyncManager/Value.h"
@@ -27,6 +32,8 @@
 namespace vtc::push {
 
 inline constexpr const char* kPushServerKey = "push_server_url";
+inline constexpr const char* kPushCaFileKey = "push_ca_file";
+inline constexpr const char* kPushPinnedCertificateKey = "push_pinned_certificate";
 inline constexpr const char* kTopicKey = "beacon.notify.topic";
 inline constexpr const char* kListenerLabel = "com.korvo.NubiloPushListener";
 
@@ -53,6 +60,8 @@ class Session {
 
 // The push server this user set up, or none.
 std::optional<BrokerAddress> configuredBroker();
+// How a TLS connection to it trusts its certificate (the preferences above).
+CertificateTrust configuredBrokerTrust();
 
 // A connected session, or nothing (no push server set up, or it could not
 // be reached or refused the account: a Warning line says why). Releasing
@@ -61,10 +70,16 @@ std::unique_ptr<Session> createSession(const std::string& account, const std::st
                                        EventCallback callback, void* context);
 
 // The topic of a dataclass; the information dictionary holds it under
-// kTopicKey. EINVAL when a part is empty or holds "/", "+" or "#".
+// kTopicKey. EINVAL when a part is empty, or the organisation, service or
+// sub-service holds "/", "+", "#" or a zero byte.
 int32_t createTopic(const std::string& account, const std::string& organisation,
                     const std::string& service, const std::string& subService,
                     const std::string& dataclass, std::optional<Dictionary>& topicInformation);
+
+// The text as one topic level: "%", "/", "+", "#" and control characters
+// written as "%XX", everything else as it is (so an account of letters,
+// digits, "@", "." and "-" is its own level, as broker rules expect).
+std::string topicLevel(std::string_view text);
 
 // 32 lower-case hex digits of the account's SHA-256.
 std::string accountDigest(const std::string& account);

@@ -32,7 +32,7 @@ Value libplistRead(const Bytes& bytes) {
   ::plist_t root = nullptr;
   plist_from_bin(reinterpret_cast<const char*>(bytes.data()), static_cast<uint32_t>(bytes.size()),
                  &root);
-  Value v = vtc::plist::fromPlist(root);
+  Value v = *vtc::plist::fromPlist(root);
   plist_free(root);
   return v;
 }
