@@ -229,6 +229,10 @@ DataclassOutcome DataclassSync::run(const std::optional<DataclassRecord>& listed
                        *record.maxversion < *state.index || (needsTruth && !resumed));
     Incoming incoming = fetch(slow, record, state, local);
     incoming.stateChanged = resumed;
+    // The fetch may have set a record right that named a changelog the
+    // share lacks: the commit goes after what the share really holds, or it
+    // would leave a hole that every computer then takes for damage.
+    record = incoming.record;
     Plan plan = decide(local, incoming, record);
     origins = plan.origins;
     guardDeletes(local, plan);
