@@ -24,6 +24,7 @@
 
 #include "VantorSyncManager/Value.h"
 #include "client/items/ItemText.h"
+#include "client/stores/FileLayer.h"
 #include "client/stores/VdirItem.h"
 
 namespace vtc::client {
@@ -66,6 +67,7 @@ enum class WriteOutcome { Written, Removed, SkippedChangedOnDisk, Failed };
 
 class VdirCollection {
  public:
+  // Its files are reached through the file layer current now.
   VdirCollection(std::string folder, ItemKind kind);
 
   const std::string& folder() const { return folder_; }
@@ -106,6 +108,7 @@ class VdirCollection {
  private:
   std::string folder_;
   ItemKind kind_;
+  FileLayer* files_;
   bool deferFlushes_ = false;
 };
 
