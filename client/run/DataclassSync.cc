@@ -9,6 +9,7 @@
 #include "VantorSyncManager/VTCPrefsCenter.h"
 #include "client/items/ItemRecord.h"
 #include "client/run/FailureText.h"
+#include "client/run/Housekeeping.h"
 #include "client/run/SyncFailure.h"
 #include "common/Clock.h"
 #include "common/Logging.h"
@@ -133,6 +134,7 @@ DataclassOutcome DataclassSync::run(const std::optional<DataclassRecord>& listed
                           " is missing; create it, or stop syncing it with `nubilosyncclient "
                           "remove " +
                           dataclass + "`.");
+  if (!options_.dryRun) removeFolderLeftovers(folder_);
 
   Local local = readLocal();
   // The guard for what goes out, before anything is written anywhere.
@@ -239,6 +241,10 @@ DataclassOutcome DataclassSync::run(const std::optional<DataclassRecord>& listed
     outcome_.sentChanges = plan.send.size();
     outcome_.filesWritten = plan.takes.size();
     if (!options_.dryRun) {
+      // What runs cut short left on the share is looked for by syncs that
+      // commit only: such a run sends its changes again, and leftovers can
+      // wait for a commit more cheaply than every fetch can list them.
+      if (!plan.send.empty()) removeShareLeftovers(session_, dataclass, record);
       // A long history is written again before this computer's changes go
       // out, as the truth the share holds now: computers that took it in
       // go on from it.

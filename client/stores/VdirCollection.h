@@ -94,6 +94,11 @@ class VdirCollection {
   // is gone already counts as Removed.
   WriteOutcome remove(const std::string& name, const ItemState& expected) const;
 
+  // Removes the temporary files that writes cut short left in the folder
+  // (no write may be under way); how many went. A file that cannot be
+  // removed is logged and left for the next time.
+  size_t removeTemporaryLeftovers() const;
+
   // Many writes in a row: each write and removal skips its own flushes, and
   // flush() then makes all of them durable at once (one sync of the file
   // system instead of two per file). Until flush() returns true, a power

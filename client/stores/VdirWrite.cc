@@ -140,6 +140,28 @@ WriteOutcome VdirCollection::remove(const std::string& name, const ItemState& ex
   return WriteOutcome::Removed;
 }
 
+size_t VdirCollection::removeTemporaryLeftovers() const {
+  FileDescriptor dir(files_->openFolder(folder_));
+  std::vector<std::string> names;
+  if (!dir.valid() || !files_->list(dir.get(), names)) {
+    VTC_LOG_WARNING("Could not look for leftover temporary files in %@: %s", folder_,
+                    strerror(errno));
+    return 0;
+  }
+  size_t removed = 0;
+  for (const std::string& name : names) {
+    if (!isTemporaryName(name)) continue;
+    if (files_->unlink(dir.get(), name) != 0 && errno != ENOENT) {
+      VTC_LOG_WARNING("Could not remove the leftover %@: %s", paths::join(folder_, name),
+                      strerror(errno));
+      continue;
+    }
+    VTC_LOG_INFO("Removed the leftover %@ of a write cut short", paths::join(folder_, name));
+    ++removed;
+  }
+  return removed;
+}
+
 bool VdirCollection::flush() const {
   FileDescriptor dir(files_->openFolder(folder_));
   if (!dir.valid() || files_->syncFileSystem(dir.get()) != 0) {

@@ -14,6 +14,7 @@
 #include <regex>
 #include <set>
 
+#include "VantorSyncManager/NubiloRemoteSession.h"
 #include "localshare/ApacheShare.h"
 #include "localshare/Computer.h"
 #include "localshare/Processes.h"
@@ -162,10 +163,23 @@ TEST_F(Interrupted, ARunKilledHalfwayThroughWritingFilesConvergesOnTheNextRun) {
   EXPECT_EQ(a.finish(pid).status, 128 + SIGKILL);
   EXPECT_GT(written, 0u);
   EXPECT_LT(written, static_cast<size_t>(kCards)) << "the run ended before it was killed";
+  // What a write cut short leaves (the kill may have left one too), and
+  // files of the same look that are not the client's.
+  const std::string leftover = "/.0F8E2C3A-5B7D-4E21-9A64-3C1D2E5F7A90.tmp";
+  Computer::write(a.contacts() + leftover, "");
+  Computer::write(a.contacts() + "/.notes.tmp", "mine");
+  Computer::write(a.contacts() + "/.0F8E2C3A.tmp", "mine");
 
-  sync(a);
+  EXPECT_THAT(sync(a).out, HasSubstr("sent 0 changes"));
   sync(b);
   expectEverywhere(cards);
+  for (const Computer* c : {&a, &b})
+    EXPECT_THAT(c->run({"conflicts"}).out, HasSubstr("No conflicts")) << c->name();
+  std::set<std::string> hidden;
+  for (const auto& entry : std::filesystem::directory_iterator(a.contacts()))
+    if (!entry.path().filename().string().ends_with(".vcf"))
+      hidden.insert(entry.path().filename().string());
+  EXPECT_EQ(hidden, (std::set<std::string>{".0F8E2C3A.tmp", ".notes.tmp"}));
 }
 
 TEST_F(Interrupted, AFileEditedWhileTheSyncWritesItIsKeptAndMergedNextTime) {
@@ -242,7 +256,24 @@ const KillPoint kKillPoints[] = {
     {"CompactionDoneBeforeTheCommitAfterIt", KillPoint::Compaction, {"PUT", "", 2}},
 };
 
-class KilledAt : public Interrupted, public ::testing::WithParamInterface<KillPoint> {};
+class KilledAt : public Interrupted, public ::testing::WithParamInterface<KillPoint> {
+ protected:
+  // The share's collection as a session sees it: its record is sound, and
+  // it holds no temporary changelog and nothing below minversion.
+  void expectTidyShare() {
+    vtc::Dictionary config = share.configuration();
+    config.set("sync_path", vtc::Value("/sync"));
+    auto session = NubiloRemoteSession::sessionWithUsername(ApacheShare::kUser,
+                                                            ApacheShare::kPassword, config);
+    EXPECT_TRUE(session->validPropertiesForDataclass("com.korvo.Contacts"));
+    const std::string min =
+        session->getDataclassInfo("com.korvo.Contacts").get("minversion").string();
+    for (const std::string& member : share.members(kCollection)) {
+      EXPECT_FALSE(member.ends_with(".tmp")) << member;
+      EXPECT_GE(member, min) << "below minversion";
+    }
+  }
+};
 
 INSTANTIATE_TEST_SUITE_P(Steps, KilledAt, ::testing::ValuesIn(kKillPoints),
                          [](const auto& info) { return std::string(info.param.name); });
@@ -281,6 +312,27 @@ TEST_P(KilledAt, TheNextSyncsConvergeWithNobodyActing) {
     EXPECT_THAT(c->run({"conflicts"}).out, HasSubstr("No conflicts")) << c->name();
   for (const Computer* c : {&a, &b})
     EXPECT_THAT(sync(*c).out, HasSubstr("sent 0 changes, received 0 changes")) << c->name();
+
+  // The killed run's temporary changelog stays while its lock could last,
+  // and goes with the next sync that locks the collection after that; so
+  // do changelogs a compaction left below minversion.
+  std::vector<std::string> temporary;
+  for (const std::string& member : share.members(kCollection))
+    if (member.ends_with(".tmp")) temporary.push_back(member);
+  const std::string& held = point.request.method;
+  if ((held == "PROPPATCH" || held == "MOVE") && !point.answerLost) {
+    EXPECT_FALSE(temporary.empty()) << "the killed run left no temporary changelog";
+  }
+  const auto anHourAgo = std::filesystem::file_time_type::clock::now() - std::chrono::hours(1);
+  for (const std::string& name : temporary)
+    std::filesystem::last_write_time(share.diskPath(std::string(kCollection) + "/" + name),
+                                     anHourAgo);
+  cards["p4.vcf"] = card(4, "400");
+  Computer::write(b.contacts() + "/p4.vcf", cards["p4.vcf"]);
+  sync(b);
+  sync(a);
+  expectEverywhere(cards);
+  expectTidyShare();
 }
 
 }  // namespace
