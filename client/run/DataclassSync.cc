@@ -65,6 +65,9 @@ struct DataclassSync::Incoming {
   std::map<std::string, merge::FoldState> folds;
   std::map<std::string, Dictionary> base;
   std::set<std::string> confirmedDeletes;
+  // Changes that could not be read: their records are set aside.
+  std::vector<std::pair<std::string, std::optional<engine::SetAside>>> refused;
+  std::set<std::string> refusedIds;
 };
 
 struct DataclassSync::Plan {
@@ -428,12 +431,28 @@ DataclassSync::Incoming DataclassSync::fetch(bool slow, const DataclassRecord& r
     for (const SyncEngineChange& change : log->changes()) {
       const std::string& id = change.recordIdentifier();
       merge::foldChange(in.folds[id], change, origin, here);
+      in.refusedIds.erase(id);  // a later change to it arrived
       if (isConfirmedDelete(change))
         in.confirmedDeletes.insert(id);
       else
         in.confirmedDeletes.erase(id);
     }
+    // A change that could not be read is refused by itself: its record is
+    // set aside until a later change to it arrives.
+    for (const vtc::RefusedChange& refused : log->refusedChanges()) {
+      auto known = in.folds.find(refused.recordIdentifier);
+      std::string file = known != in.folds.end() && known->second.record
+                             ? recordFile(*known->second.record)
+                             : std::string();
+      if (file.empty()) file = fileNameFor(refused.recordIdentifier, collection_.kind);
+      in.refusedIds.insert(refused.recordIdentifier);
+      in.refused.emplace_back(
+          refused.recordIdentifier,
+          engine::SetAside{file, "its change could not be read: " + refused.reason, origin,
+                           currentClock().now()});
+    }
   }
+  std::erase_if(in.refused, [&](const auto& entry) { return !in.refusedIds.count(entry.first); });
   for (auto& [id, state] : in.folds)
     if (state.changed) ++outcome_.receivedChanges;
   return in;
@@ -477,6 +496,11 @@ DataclassSync::Plan DataclassSync::decide(Local& local, Incoming& in,
     sides.changedHere = local.changed.count(id) > 0;
     if (firstCommit) {
       sides.theirs = std::nullopt;  // an empty share: nothing there to weigh
+      sides.changedThere = false;
+    } else if (in.refusedIds.count(id)) {
+      // Its change could not be read: the share's version is taken to be
+      // the one last synced, so that nothing here is lost or undone.
+      sides.theirs = sides.base;
       sides.changedThere = false;
     } else {
       if (fold != in.folds.end())
@@ -601,6 +625,7 @@ void DataclassSync::store(Local& local, Plan& plan, const Incoming& incoming) {
   engine::SyncOutcome o;
   o.truth = std::move(plan.truth);
   o.folderTakes = std::move(plan.takes);
+  o.setAside = incoming.refused;
   o.networkClient = kNetworkClient;
   o.folderClient = folderClient_;
   NetworkState state = incoming.state;
