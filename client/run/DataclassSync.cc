@@ -534,6 +534,21 @@ DataclassSync::Plan DataclassSync::decide(Local& local, Incoming& in,
       plan.truth.push_back({id, merged, deletedHere ? options_.computerName : origin, deletedHere});
     }
     if (d.folderTakes) plan.takes.push_back(id);
+    if (d.send || d.folderTakes) {
+      using Change = ItemActivity::Change;
+      auto kind = [](const std::optional<Dictionary>& from, const std::optional<Dictionary>& to) {
+        return !to ? Change::Delete : !from ? Change::Add : Change::Edit;
+      };
+      const Dictionary* shown = nullptr;
+      const std::optional<Dictionary>* versions[] = {&merged, &sides.base, &sides.ours,
+                                                     &sides.file};
+      for (const std::optional<Dictionary>* v : versions)
+        if (!shown && *v) shown = &**v;
+      if (shown)
+        outcome_.items.push_back({displayName(*shown), recordFile(*shown),
+                                  d.send ? kind(sides.theirs, merged) : Change::None,
+                                  d.folderTakes ? kind(sides.file, merged) : Change::None});
+    }
     if (sides.base && !merged && !(sides.changedHere && !sides.ours)) {
       if (in.confirmedDeletes.count(id))
         ++outcome_.confirmedDeletes;
