@@ -116,6 +116,13 @@ DataclassSync::Local DataclassSync::readLocal() {
       // Instances keep the keys the file, or else the truth, gave them.
       const Dictionary* previous = record.before ? &*record.before : truth ? &*truth : nullptr;
       now = toRecord(record.now->text, record.file, previous);
+      // The record holds what the file said: its bytes are not needed again,
+      // and the folder is held once, not twice.
+      if (auto f = local.folder.scan.read.find(record.file);
+          f != local.folder.scan.read.end() && f->second.get() == record.now) {
+        f->second->text = ItemText();
+        std::string().swap(f->second->bytes);
+      }
     }
     merge::Merged version = merge::localVersion(collection_.kind, truth, record.before, now);
     if (!merge::sameRecord(version.record, truth)) {
