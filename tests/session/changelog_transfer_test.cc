@@ -639,13 +639,23 @@ TEST_P(Transfer, ReportsAreFlattenedAndStoredUnderTheMachinesUUID) {
   EXPECT_EQ(vtc::flattenedSyncReport({}, std::nullopt, std::nullopt),
             (vtc::Dictionary{{"appName", "Granite"}, {"Version", "1"}, {"SyncStatus:code", "0"}}));
 
-  // The machine id keyed with the application's id: never the id itself.
+  // Without a host UUID the report names no machine and is stored under
+  // the client's guid.
   std::ofstream(home.path() + "/machine-id") << "0123456789abcdef0123456789abcdef\n";
+  vtc::forgetHostUUIDForTesting();
   vtc::os::setIdentityFileForTesting(home.path() + "/missing");
   EXPECT_FALSE(getHostUUIDString());
   EXPECT_THAT(logged.messages("Warning"),
               testing::Contains("getHostUUIDString: unable to determine UUID for host. "
                                 "Error: 2"));
+  session->sendReportingInfo(summary);
+  auto anonymous =
+      vtc::plist::readFile(share.diskPath(session->syncPath() + "/Reports/GUID-A.plist"));
+  ASSERT_TRUE(anonymous);
+  EXPECT_FALSE(anonymous->dictionary().find("MachineGUID"));
+  EXPECT_EQ(anonymous->dictionary().get("Contacts:clogCount").string(), "3");
+
+  // The machine id keyed with the application's id: never the id itself.
   vtc::os::setIdentityFileForTesting(home.path() + "/machine-id");
   EXPECT_EQ(getHostUUIDString(), "741A1DFD-7F8E-4733-9325-6F6DBE2C9B34");
   vtc::os::setIdentityFileForTesting(home.path() + "/missing");  // kept once found
@@ -665,7 +675,6 @@ TEST_P(Transfer, ReportsAreFlattenedAndStoredUnderTheMachinesUUID) {
   }
 
   session->sendReportingInfo(summary);
-  session->sendReportingInfo(summary);  // the second finds the collection
   auto stored = vtc::plist::readFile(
       share.diskPath(session->syncPath() + "/Reports/741A1DFD-7F8E-4733-9325-6F6DBE2C9B34.plist"));
   ASSERT_TRUE(stored);
@@ -673,6 +682,7 @@ TEST_P(Transfer, ReportsAreFlattenedAndStoredUnderTheMachinesUUID) {
   EXPECT_EQ(stored->dictionary().get("RespondingServer").string(),
             session->respondingServer().value_or("?"));
   vtc::os::setIdentityFileForTesting("");
+  vtc::forgetHostUUIDForTesting();
 }
 
 }  // namespace
