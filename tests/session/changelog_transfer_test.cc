@@ -8,9 +8,10 @@
 #include <sys/wait.h>
 #include <unistd.h>
 
+#include <ctime>
 #include <filesystem>
-#include <functional>
 #include <fstream>
+#include <functional>
 #include <thread>
 
 #include "VantorSyncManager/HostIdentity.h"
@@ -56,6 +57,16 @@ std::vector<SyncEngineChange> someChanges(int count, const std::string& tag) {
         SyncEngineChange::kAdd, tag + "-" + std::to_string(i),
         vtc::Array{vtc::Value(vtc::Dictionary{{"action", "set"}, {"name", "FN"}, {"value", tag}})});
   return changes;
+}
+
+// "yyyy-MM-dd HH:mm:ss ZZZ" in GMT.
+std::string gmtText(vtc::Date date) {
+  const std::time_t t = std::chrono::system_clock::to_time_t(date);
+  std::tm tm{};
+  gmtime_r(&t, &tm);
+  char text[64];
+  std::strftime(text, sizeof text, "%Y-%m-%d %H:%M:%S +0000", &tm);
+  return text;
 }
 
 // The failure's name and reason, or "none".
@@ -150,7 +161,7 @@ TEST_P(Commit, PublishesWithThreeRequestsBeyondTheLockAndLeavesNoTemporaryFile) 
   vtc::Dictionary r = record(kDataclass);
   EXPECT_EQ(r.get("maxversion").string(), "00001");
   EXPECT_FALSE(r.find("minversion"));  // only a reset commit sets it
-  EXPECT_EQ(r.get("lastsync").string(), vtc::textOf(vtc::Value(time.now())));
+  EXPECT_EQ(r.get("lastsync").string(), gmtText(time.now()));
   EXPECT_EQ(logged.count("Info", "com.korvo.Contacts Uploading changeLog with index 1"), 1u);
 
   // What another computer reads back: the changes and the creator headers.
@@ -619,6 +630,8 @@ TEST_P(Transfer, ReportsAreFlattenedAndStoredUnderTheMachinesUUID) {
       {"SyncType", "manual"},
       {"Contacts", vtc::Dictionary{{"ClogCount", 3},
                                    {"SyncStart", start},
+                                   {"SyncEnd", std::chrono::system_clock::from_time_t(1299230430)},
+                                   {"SyncDuration", 0.1},
                                    {"SyncMode", "slow"},
                                    {"Error", "NubiloLockFailureException"}}},
       {"Calendars", vtc::Dictionary{}},
@@ -631,7 +644,9 @@ TEST_P(Transfer, ReportsAreFlattenedAndStoredUnderTheMachinesUUID) {
                              {"SyncStatus:duration", "2.5"},
                              {"RespondingServer", "apache-1"},
                              {"MachineGUID", "UUID-1"},
-                             {"Contacts:startTime", vtc::textOf(vtc::Value(start))},
+                             {"Contacts:startTime", gmtText(start)},
+                             {"Contacts:endTime", "2011-03-04 09:20:30 +0000"},
+                             {"Contacts:duration", "0.1"},  // the shortest text of the number
                              {"Contacts:clogCount", "3"},
                              {"Contacts:syncMode", "slow"},
                              {"Contacts:code", "NubiloLockFailureException"},
