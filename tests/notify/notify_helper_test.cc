@@ -201,7 +201,7 @@ TEST_F(Notify, TheLoginSessionIsAddedOnlyWhenNoneIsAndNothingMovesWhileItsStateI
   EXPECT_EQ(NotifyHelper::isBeaconEnabledForAccount(kAccount), 1);
   EXPECT_THAT(vtc::local::Computer::read(unit), HasSubstr("nubilosyncclient listen\n"));
   EXPECT_THAT(vtc::local::Computer::read(unit), HasSubstr("Restart=always\n"));
-  EXPECT_THAT(manager.calls(), ElementsAre("daemon-reload", "enable --now " + unit));
+  EXPECT_THAT(manager.calls(), ElementsAre("daemon-reload", "enable --now --no-block " + unit));
   EXPECT_EQ(vtc::push::readRegistrations()->onLoadSessions.at(0).service, "Kitbag");
 
   manager.forgetCalls();
