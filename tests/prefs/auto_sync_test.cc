@@ -239,10 +239,15 @@ TEST_F(AutoSync, ARealUserManagerStartsAJobThatRunsAtLoadWithoutWaitingForIt) {
 }
 
 TEST_F(AutoSync, SyncOnChangeInstallsTheBookmarksJobOnceAndLeavesItWhenTurnedOff) {
-  ASSERT_TRUE(getNubiloClient());  // the engine's record that sync on change sets
-  EXPECT_FALSE(prefs.checkBookmarksPlistAndCreateIfNecessary());  // no browser
+  // The engine has no record of this client yet: the choice is kept, and
+  // takes effect once the client is registered.
   prefs.setAutomaticallySyncOn(true);
   EXPECT_TRUE(prefs.automaticallySyncOn());
+  EXPECT_TRUE(logged.messages("Error").empty());
+  auto client = getNubiloClient();
+  ASSERT_TRUE(client);
+  EXPECT_EQ(client->objectForKey("SyncsAfterClients"), Value(true));
+  EXPECT_FALSE(prefs.checkBookmarksPlistAndCreateIfNecessary());  // no browser
   EXPECT_FALSE(std::filesystem::exists(vtc::autosync::bookmarksJobFile()));
 
   Computer::write(home.path() + "/.local/share/applications/com.korvo.Voyager.SyncClient.desktop",
@@ -266,6 +271,7 @@ TEST_F(AutoSync, SyncOnChangeInstallsTheBookmarksJobOnceAndLeavesItWhenTurnedOff
   EXPECT_TRUE(manager.calls().empty());
   prefs.setAutomaticallySyncOn(false);
   EXPECT_FALSE(prefs.automaticallySyncOn());
+  EXPECT_EQ(client->objectForKey("SyncsAfterClients"), Value(false));
   EXPECT_TRUE(std::filesystem::exists(vtc::autosync::bookmarksJobFile()));
 
   // A refused submission is an Error line and still a yes; a folder in the

@@ -141,6 +141,12 @@ void SqliteEngine::registerClient(const std::string& client, const Dictionary& d
   s.bind(1, client).bind(2, encode(Value(description))).bind(3, encode(Value(Dictionary{}))).run();
 }
 
+bool SqliteEngine::hasClient(const std::string& client) {
+  Statement s(db_.handle(), "SELECT 1 FROM clients WHERE id = ?1");
+  s.bind(1, client);
+  return s.step();
+}
+
 Dictionary SqliteEngine::clientSettings(const std::string& client) {
   Statement s(db_.handle(), "SELECT settings FROM clients WHERE id = ?1");
   s.bind(1, client);
