@@ -3,7 +3,8 @@
 // SyncEngineChange lists, then pushes back what other computers committed.
 // One SQLite database in the support folder, shared by every process of the
 // user (WAL, busy timeout). Failures raise vtc::engine::EngineError; invalid
-// changes std::invalid_argument. An object is used from one thread.
+// changes std::invalid_argument; memory SQLite cannot get std::bad_alloc.
+// An object is used from one thread.
 #pragma once
 
 #include <cstdint>
