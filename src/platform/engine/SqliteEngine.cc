@@ -4,7 +4,6 @@
 
 #include <sys/stat.h>
 
-#include "VantorSyncManager/VTCPrefsCenter.h"
 #include "common/Clock.h"
 #include "common/Logging.h"
 #include "platform/fs/LocalPaths.h"
@@ -78,7 +77,7 @@ std::string SyncEngine::bundleVersion() {
 }
 
 std::unique_ptr<SyncEngine> SyncEngine::open() {
-  std::string folder = VTCPrefsCenter::applicationSupportDirectory().value_or(
+  std::string folder = paths::supportFolder().value_or(
       paths::join(paths::applicationSupportDirectory(), "NubiloSyncClient"));
   paths::makeDirectories(folder, 0700);
   return open(paths::join(folder, "SyncEngine.sqlite"));
@@ -89,7 +88,7 @@ std::unique_ptr<SyncEngine> SyncEngine::open(const std::string& path) {
 }
 
 std::unique_ptr<SyncEngine> SyncEngine::openInMemoryCopy() {
-  std::string folder = VTCPrefsCenter::applicationSupportDirectory().value_or(
+  std::string folder = paths::supportFolder().value_or(
       paths::join(paths::applicationSupportDirectory(), "NubiloSyncClient"));
   paths::makeDirectories(folder, 0700);
   return std::make_unique<SqliteEngine>(paths::join(folder, "SyncEngine.sqlite"), true);
