@@ -313,6 +313,22 @@ TEST_F(Notify, AnotherAccountOfTheServerCanNeitherReadNorTriggerTheAccountsPushe
   while (std::ranges::count(seen, itsOwn) == 0 && std::chrono::steady_clock::now() < deadline)
     mallory->poll(std::chrono::milliseconds(50));
   EXPECT_THAT(seen, testing::AllOf(testing::Not(testing::IsEmpty()), testing::Each(itsOwn)));
+
+  // A name that no pattern applies to has its pushes through the lines of
+  // its own that the guide shows.
+  const std::string plus = vtc::test::MqttBroker::kPlusUser;
+  auto plusOther = connection(plus, kPassword);
+  ASSERT_TRUE(plusOther->subscribe({"korvo/nubilo/syncdav/alice%2Bsync@example.org/#"}, error))
+      << error;
+  NotifyHelper::resetSharedHelperForTesting();
+  NotifyHelper& plusHelper = NotifyHelper::notificationSessionForAccount(plus, kPassword);
+  plusHelper.addDataclassToNotify("com.korvo.Contacts", Value("plus"));
+  plusHelper.addDataclassToNotify("marker", Value());
+  plusHelper.sendNotifications();
+  EXPECT_THAT(until(*plusOther, "marker"),
+              ElementsAre(std::pair(
+                  std::string("korvo/nubilo/syncdav/alice%2Bsync@example.org/com.korvo.Contacts"),
+                  Value("plus"))));
 }
 
 }  // namespace
