@@ -24,6 +24,7 @@
 #include "platform/plist/PlistCodec.h"
 #include "session/SyncReport.h"
 #include "support/FaultProxy.h"
+#include "support/SessionBus.h"
 #include "support/ShareTest.h"
 
 using testing::HasSubstr;
@@ -456,11 +457,25 @@ TEST_F(CommitFaults, TwoProcessesRacingForOneIndexHaveExactlyOneWinnerEveryRound
   std::printf("racing commits: A won %d, B won %d of %d rounds\n", wins[0], wins[1], kRounds);
 }
 
-TEST_F(Fetch, GrowingBatchesAHoleInsideTheRangeAndMappedLargeChangelogs) {
+TEST_F(Fetch, GrowingBatchesAHoleInsideTheRangeMappedLargeChangelogsAndACancel) {
+  vtc::test::SessionBus bus;
+  vtc::test::NotificationListener progress;
   populate(kDataclass, 19);
+  EXPECT_FALSE(session->commitChanges({}, kDataclass, 20, false));  // nothing, not even progress
   // The twentieth is large enough to be held in a mapped file.
   ASSERT_TRUE(session->commitChanges(noisyChanges(2000), kDataclass, 20, false));
   auto fetched = session->fetchChangeLogsForDataclass(kDataclass, 1, 20);
+  // Progress reached the user's other programs: one per commit, then the fetch's.
+  std::vector<vtc::test::NotificationListener::Received> told;
+  for (int i = 0; i < 50 && told.size() < 21; ++i)
+    for (auto& r : progress.waitFor(std::chrono::milliseconds(200))) told.push_back(r);
+  ASSERT_EQ(told.size(), 21u);
+  for (size_t i = 0; i < told.size(); ++i) {
+    EXPECT_EQ(told[i].name, NubiloSyncProgressNotification) << i;
+    EXPECT_EQ(told[i].object, kDataclass) << i;
+    EXPECT_EQ(told[i].information.empty(), i < 20) << i;
+  }
+
   ASSERT_EQ(fetched.changeLogs.size(), 20u);
   EXPECT_EQ(fetched.changeLogs.at(7)->changes(), someChanges(1, "c7"));
   EXPECT_TRUE(dynamic_cast<NubiloMappedChangelog*>(fetched.changeLogs.at(20).get()));
@@ -482,6 +497,17 @@ TEST_F(Fetch, GrowingBatchesAHoleInsideTheRangeAndMappedLargeChangelogs) {
                                      " bytes) of 20 for dataclass com.korvo.Contacts"),
             1u);
 
+  // Batches stop growing at 256 (257 changelogs).
+  for (int i = 21; i <= 800; ++i)
+    std::filesystem::copy_file(dataclassFolder(kDataclass) + "/00001.clog",
+                               dataclassFolder(kDataclass) + vtc::format("/%05i.clog", i));
+  EXPECT_EQ(session->fetchChangeLogsForDataclass(kDataclass, 1, 800).changeLogs.size(), 800u);
+  for (const char* batch : {"259 to 515", "516 to 772", "773 to 800"})
+    EXPECT_EQ(logged.count("Info", std::string("Processing batched clogs from ") + batch +
+                                       " for com.korvo.Contacts"),
+              1u)
+        << batch;
+
   // A single index; a 404 there is a failed download. Inside a range it is
   // a hole in the stream.
   EXPECT_EQ(session->fetchChangeLogsForDataclass(kDataclass, 3, 3).changeLogs.size(), 1u);
@@ -499,14 +525,21 @@ TEST_F(Fetch, GrowingBatchesAHoleInsideTheRangeAndMappedLargeChangelogs) {
   // Each 404 was asked once more after a pause, through the sleeper.
   EXPECT_EQ(time.sleeps(), std::vector<double>(4, 30.0));
 
-  // Negative bounds fetch nothing; a cancelled session stops every batch.
+  // Negative bounds fetch nothing. A cancel while the third downloads ends
+  // the fetch after that download; no later batch asks for anything.
   EXPECT_TRUE(session->fetchChangeLogsForDataclass(kDataclass, -1, 4).changeLogs.empty());
-  session->cancel();
+  proxy.clear();
   const size_t gets = proxy.count("GET");
+  proxy.delay({"GET", session->changeLogPathForDataclass(kDataclass, 3), 1}, 300);
+  std::thread canceller([&] {
+    vtc::local::waitUntil([&] { return proxy.count("GET") == gets + 3; });
+    session->cancel();
+  });
   auto cancelled = session->fetchChangeLogsForDataclass(kDataclass, 1, 4);
-  EXPECT_TRUE(cancelled.changeLogs.empty());
-  EXPECT_EQ(cancelled.StorageConsumed, 0);
-  EXPECT_EQ(proxy.count("GET"), gets);
+  canceller.join();
+  EXPECT_EQ(cancelled.changeLogs.size(), 3u);
+  EXPECT_EQ(proxy.count("GET"), gets + 3);
+  EXPECT_TRUE(session->fetchChangeLogsForDataclass(kDataclass, 1, 2).changeLogs.empty());
 }
 
 TEST_F(Fetch, EachDownloadFailingInEachWayRaisesItsKind) {
@@ -542,13 +575,18 @@ TEST_F(Fetch, EachDownloadFailingInEachWayRaisesItsKind) {
       EXPECT_EQ(result.changeLogs.size(), 5u);
     }
   }
-  // The failures were reported as final, under the fetch's own message.
-  EXPECT_THAT(traces.withDomain("com.korvo.sync.nubilosession.retrytransaction.final"),
-              testing::Not(testing::IsEmpty()));
   proxy.clear();
   proxy.answer({"GET", third, 0}, 500);
   EXPECT_EQ(failureOf([&] { quick->fetchChangeLogForDataclass(kDataclass, 3); }).first,
             NubiloFailedToDownloadChangelogException);
+  // The two refusals of the batched fetch and the single one were reported
+  // as final under the fetch's own messages (a dropped connection under the
+  // request's).
+  std::vector<std::string> finals;
+  for (const auto& r : traces.withDomain("com.korvo.sync.nubilosession.retrytransaction.final"))
+    finals.push_back(vtc::test::TraceCapture::field(r, "MESSAGE"));
+  EXPECT_EQ(std::ranges::count(finals, "Failed to get attributes on changelog"), 2);
+  EXPECT_EQ(std::ranges::count(finals, "Failed download changelog"), 1);
 
   // A changelog of no bytes, answered 200, is an empty one: damage, whichever
   // fetch meets it, and nothing of it is left in the temporary folder.
@@ -591,7 +629,22 @@ TEST_P(Transfer, DirectoriesOfChangelogsAndTakingBackTheNewestCommit) {
   std::filesystem::copy_file(local + "/" + kDataclass + "/00002.clog",
                              upload + "/nested/00022.clog");
   std::ofstream(upload + "/notes.txt") << "not a changelog";
+  // Each entry takes as long as a whole lock lasts: both locks are renewed
+  // before each, once half the lock duration has passed (the two PUTs come
+  // after the two first locks and the first renewal, then two entries apart).
+  const size_t before = proxy.requests().size();
+  time.advanceOnEveryReading(vtc::Seconds(240));
   session->putChangeLogsFromDirectory(upload, kDataclass, "needstruth", false);
+  time.advanceOnEveryReading(vtc::Seconds(0));
+  const auto seen = proxy.requests();
+  std::vector<int> locksBeforeEachPut{0};
+  for (size_t i = before; i < seen.size(); ++i) {
+    const std::string& method = seen[i].method;
+    if (method == "LOCK") ++locksBeforeEachPut.back();
+    if (method == "PUT") locksBeforeEachPut.push_back(0);
+  }
+  locksBeforeEachPut.pop_back();
+  EXPECT_EQ(locksBeforeEachPut, (std::vector<int>{4, 4}));
   vtc::Dictionary r = record(kDataclass);
   EXPECT_EQ(r.get("minversion").string(), "00010");
   EXPECT_EQ(r.get("maxversion").string(), "00022");
@@ -621,6 +674,13 @@ TEST_P(Transfer, DirectoriesOfChangelogsAndTakingBackTheNewestCommit) {
             "needstruth");
   session->setInfoForDataclass(vtc::Dictionary{{"maxversion", kNBRemoveProp}}, kDataclass);
   EXPECT_FALSE(session->removeLastChangelogForDataclass(kDataclass));
+
+  // Cleared first: only what was uploaded is there, and the range is its own.
+  session->putChangeLogsFromDirectory(upload, kDataclass, "normal", true);
+  EXPECT_EQ(logged.count("Info", "Clearing changelogs for dataclass: com.korvo.Contacts"), 1u);
+  EXPECT_EQ(filesOf(kDataclass), (std::vector<std::string>{"00021.clog", "00022.clog"}));
+  EXPECT_EQ(record(kDataclass).get("minversion").string(), "00021");
+  EXPECT_EQ(record(kDataclass).get("maxversion").string(), "00022");
 }
 
 TEST_P(Transfer, ReportsAreFlattenedAndStoredUnderTheMachinesUUID) {
