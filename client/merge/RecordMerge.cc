@@ -181,11 +181,21 @@ class FieldMerge {
         set(key, t);
       } else if (!theirsChanged) {
         set(key, o);
+      } else if (isStamp(key) && o && t) {
+        // A stamp of when the item changed: the later one stands, and two
+        // stamps are no conflict.
+        set(key, meaningOf(rawOf(*o)) > meaningOf(rawOf(*t)) ? o : t);
       } else {
         set(key, t);
         if (!same(o, t) && !isStructureKey(key)) lose(key, valueOf(t), valueOf(o));
       }
     }
+  }
+
+  // Properties that say when an item last changed, which every edit moves.
+  static bool isStamp(std::string_view key) {
+    const std::string_view name = nameOf(key);
+    return name == "REV" || name == "DTSTAMP" || name == "LAST-MODIFIED";
   }
 
   // If both sides changed an event's times, theirs stand together.

@@ -8,7 +8,9 @@
 // - A field changed on one side only takes that side's value; values are
 //   compared by meaning, so a re-folded line is no change.
 // - A field changed on both sides to different values keeps theirs, the
-//   value that reached the share first, and ours is kept as lost.
+//   value that reached the share first, and ours is kept as lost; a stamp
+//   of when the item changed (REV, DTSTAMP, LAST-MODIFIED) keeps the later
+//   one, and is no conflict.
 // - Each instance of a repeated property is a field of its own, so edits
 //   of two phone numbers, or two alarms added on two computers, both stand.
 // - The times of an event or to-do (DTSTART, DTEND, DUE, DURATION, RRULE)

@@ -9,6 +9,7 @@
 #include "VantorSyncManager/VTCPrefsCenter.h"
 #include "client/items/ItemRecord.h"
 #include "client/run/FailureText.h"
+#include "client/run/Housekeeping.h"
 #include "client/run/SyncFailure.h"
 #include "common/Clock.h"
 #include "common/Logging.h"
@@ -65,6 +66,9 @@ struct DataclassSync::Incoming {
   std::map<std::string, merge::FoldState> folds;
   std::map<std::string, Dictionary> base;
   std::set<std::string> confirmedDeletes;
+  // Changes that could not be read: their records are set aside.
+  std::vector<std::pair<std::string, std::optional<engine::SetAside>>> refused;
+  std::set<std::string> refusedIds;
 };
 
 struct DataclassSync::Plan {
@@ -133,6 +137,7 @@ DataclassOutcome DataclassSync::run(const std::optional<DataclassRecord>& listed
                           " is missing; create it, or stop syncing it with `nubilosyncclient "
                           "remove " +
                           dataclass + "`.");
+  if (!options_.dryRun) removeFolderLeftovers(folder_);
 
   Local local = readLocal();
   // The guard for what goes out, before anything is written anywhere.
@@ -229,12 +234,20 @@ DataclassOutcome DataclassSync::run(const std::optional<DataclassRecord>& listed
                        *record.maxversion < *state.index || (needsTruth && !resumed));
     Incoming incoming = fetch(slow, record, state, local);
     incoming.stateChanged = resumed;
+    // The fetch may have set a record right that named a changelog the
+    // share lacks: the commit goes after what the share really holds, or it
+    // would leave a hole that every computer then takes for damage.
+    record = incoming.record;
     Plan plan = decide(local, incoming, record);
     origins = plan.origins;
     guardDeletes(local, plan);
     outcome_.sentChanges = plan.send.size();
     outcome_.filesWritten = plan.takes.size();
     if (!options_.dryRun) {
+      // What runs cut short left on the share is looked for by syncs that
+      // commit only: such a run sends its changes again, and leftovers can
+      // wait for a commit more cheaply than every fetch can list them.
+      if (!plan.send.empty()) removeShareLeftovers(session_, dataclass, record);
       // A long history is written again before this computer's changes go
       // out, as the truth the share holds now: computers that took it in
       // go on from it.
@@ -428,12 +441,28 @@ DataclassSync::Incoming DataclassSync::fetch(bool slow, const DataclassRecord& r
     for (const SyncEngineChange& change : log->changes()) {
       const std::string& id = change.recordIdentifier();
       merge::foldChange(in.folds[id], change, origin, here);
+      in.refusedIds.erase(id);  // a later change to it arrived
       if (isConfirmedDelete(change))
         in.confirmedDeletes.insert(id);
       else
         in.confirmedDeletes.erase(id);
     }
+    // A change that could not be read is refused by itself: its record is
+    // set aside until a later change to it arrives.
+    for (const vtc::RefusedChange& refused : log->refusedChanges()) {
+      auto known = in.folds.find(refused.recordIdentifier);
+      std::string file = known != in.folds.end() && known->second.record
+                             ? recordFile(*known->second.record)
+                             : std::string();
+      if (file.empty()) file = fileNameFor(refused.recordIdentifier, collection_.kind);
+      in.refusedIds.insert(refused.recordIdentifier);
+      in.refused.emplace_back(
+          refused.recordIdentifier,
+          engine::SetAside{file, "its change could not be read: " + refused.reason, origin,
+                           currentClock().now()});
+    }
   }
+  std::erase_if(in.refused, [&](const auto& entry) { return !in.refusedIds.count(entry.first); });
   for (auto& [id, state] : in.folds)
     if (state.changed) ++outcome_.receivedChanges;
   return in;
@@ -478,6 +507,11 @@ DataclassSync::Plan DataclassSync::decide(Local& local, Incoming& in,
     if (firstCommit) {
       sides.theirs = std::nullopt;  // an empty share: nothing there to weigh
       sides.changedThere = false;
+    } else if (in.refusedIds.count(id)) {
+      // Its change could not be read: the share's version is taken to be
+      // the one last synced, so that nothing here is lost or undone.
+      sides.theirs = sides.base;
+      sides.changedThere = false;
     } else {
       if (fold != in.folds.end())
         sides.theirs = fold->second.record;
@@ -510,6 +544,21 @@ DataclassSync::Plan DataclassSync::decide(Local& local, Incoming& in,
       plan.truth.push_back({id, merged, deletedHere ? options_.computerName : origin, deletedHere});
     }
     if (d.folderTakes) plan.takes.push_back(id);
+    if (d.send || d.folderTakes) {
+      using Change = ItemActivity::Change;
+      auto kind = [](const std::optional<Dictionary>& from, const std::optional<Dictionary>& to) {
+        return !to ? Change::Delete : !from ? Change::Add : Change::Edit;
+      };
+      const Dictionary* shown = nullptr;
+      const std::optional<Dictionary>* versions[] = {&merged, &sides.base, &sides.ours,
+                                                     &sides.file};
+      for (const std::optional<Dictionary>* v : versions)
+        if (!shown && *v) shown = &**v;
+      if (shown)
+        outcome_.items.push_back({displayName(*shown), recordFile(*shown),
+                                  d.send ? kind(sides.theirs, merged) : Change::None,
+                                  d.folderTakes ? kind(sides.file, merged) : Change::None});
+    }
     if (sides.base && !merged && !(sides.changedHere && !sides.ours)) {
       if (in.confirmedDeletes.count(id))
         ++outcome_.confirmedDeletes;
@@ -601,6 +650,7 @@ void DataclassSync::store(Local& local, Plan& plan, const Incoming& incoming) {
   engine::SyncOutcome o;
   o.truth = std::move(plan.truth);
   o.folderTakes = std::move(plan.takes);
+  o.setAside = incoming.refused;
   o.networkClient = kNetworkClient;
   o.folderClient = folderClient_;
   NetworkState state = incoming.state;

@@ -48,6 +48,16 @@ struct SyncOptions {
   Progress* progress = nullptr;  // told how far the sync has come, when set
 };
 
+// What a sync did (or, in a dry run, would do) to one item: the change the
+// share takes and the change its file here takes.
+struct ItemActivity {
+  enum class Change { None, Add, Edit, Delete };
+  std::string name;  // the contact's or event's name (FN or SUMMARY), else its file name
+  std::string file;
+  Change sent = Change::None;
+  Change here = Change::None;
+};
+
 struct DataclassOutcome {
   std::string dataclass;
   std::string mode = "none";   // "none", "fast" or "slow"
@@ -66,6 +76,7 @@ struct DataclassOutcome {
   bool usedServer = false;  // locked, fetched or committed
   bool compacted = false;
   std::optional<int64_t> committedIndex;
+  std::vector<ItemActivity> items;  // every item sent or written, in identity order
   // Items were left over: skipped, set aside or not written.
   bool leftOver() const {
     return !invalidFiles.empty() || !setAside.empty() || !writeFailures.empty();

@@ -5,14 +5,21 @@
 // running the real client against a real Apache share.
 #include <gmock/gmock.h>
 
+#include <fcntl.h>
+#include <linux/fs.h>
+#include <sys/ioctl.h>
+#include <unistd.h>
+
 #include <filesystem>
 #include <sstream>
 
+#include "VantorSyncManager/NubiloDataAdditions.h"
 #include "VantorSyncManager/NubiloRemoteSession.h"
 #include "client/items/ItemRecord.h"
 #include "client/merge/RecordMerge.h"
 #include "localshare/ApacheShare.h"
 #include "localshare/Computer.h"
+#include "platform/plist/PlistCodec.h"
 #include "support/TestHome.h"
 
 using testing::HasSubstr;
@@ -232,6 +239,60 @@ TEST_F(NeverLose, AComputerUpToDateAtACompactionGoesOnWithoutReadingTheWholeTrut
   EXPECT_EQ(contactsOf(a), contactsOf(c));
 }
 
+// A change whose archive cannot be read is refused by itself: the other
+// changes of its changelog arrive, the record is named, and edits of it made
+// here still go out.
+TEST_F(NeverLose, AChangeThatCannotBeReadIsRefusedByItselfAndItsRecordSetAside) {
+  Computer::write(a.contacts() + "/ann.vcf", card("ann", "Ann", "1"));
+  sync(a);
+  sync(b);
+  commitAsAnotherComputer({addOf("bea", "bea.vcf", card("bea", "Bea", "2"))});
+  // The faulty computer's changelog, made by hand: a change of Ann whose
+  // archive is garbage, then Bea's card again.
+  auto put = [](vtc::Bytes& body, const std::string& id, uint32_t type, const vtc::Bytes& archive) {
+    NubiloAppendString(body, id);
+    NubiloAppendUInt32(body, type);
+    NubiloAppendUInt32(body, static_cast<uint32_t>(archive.size()));
+    body.insert(body.end(), archive.begin(), archive.end());
+  };
+  vtc::Bytes body;
+  put(body, "ann", SyncEngineChange::kModify,
+      vtc::Bytes{'b', 'p', 'l', 'i', 's', 't', '0', '0', 7});
+  put(body, "bea", SyncEngineChange::kAdd,
+      vtc::plist::toBinary(vtc::Value(addOf("bea", "bea.vcf", card("bea", "Bea", "3")).changes())));
+  vtc::Bytes file;
+  NubiloAppendUInt32(file, 101);
+  NubiloAppendUInt32(file, 12 + 4 * 2);
+  for (int i = 0; i <= 2; ++i) NubiloAppendUInt32(file, 0xFFFFFFFF);
+  NubiloAppendString(file, "CreatorClientName=Faulty Phone");
+  NubiloAppendString(file, "HeaderEnd=$%__END__OF__HEADER%$");
+  const auto bodyStart = static_cast<uint32_t>(file.size());
+  for (int i = 0; i < 4; ++i) file[8 + i] = static_cast<uint8_t>(bodyStart >> (24 - 8 * i));
+  const vtc::Bytes zipped = *NubiloGzip(body);
+  file.insert(file.end(), zipped.begin(), zipped.end());
+  Computer::write(share.diskPath("/sync/Schemas/com.korvo.Contacts/00003.clog"),
+                  std::string(file.begin(), file.end()));
+  vtc::Dictionary config = share.configuration();
+  config.set("sync_path", vtc::Value("/sync"));
+  NubiloRemoteSession::sessionWithUsername(ApacheShare::kUser, ApacheShare::kPassword, config)
+      ->setInfoForDataclass(vtc::Dictionary{{"maxversion", "00003"}}, "com.korvo.Contacts");
+
+  Computer::Result r = b.run({"sync"});
+  EXPECT_EQ(r.status, 9) << r.err;
+  EXPECT_THAT(r.err,
+              HasSubstr("set aside ann.vcf (from Faulty Phone): its change could not be read"));
+  EXPECT_EQ(contactsOf(b)["bea.vcf"], card("bea", "Bea", "3"));
+  // B's own edit of Ann still goes out, and a later change clears it.
+  Computer::write(b.contacts() + "/ann.vcf", card("ann", "Ann", "from B"));
+  EXPECT_EQ(b.run({"sync"}).status, 9);
+  EXPECT_EQ(a.run({"sync"}).status, 0);  // the later change came with it
+  EXPECT_EQ(contactsOf(a)["ann.vcf"], card("ann", "Ann", "from B"));
+  Computer::write(a.contacts() + "/ann.vcf", card("ann", "Ann", "from A"));
+  sync(a);
+  EXPECT_EQ(b.run({"sync"}).status, 0);
+  EXPECT_EQ(contactsOf(b), contactsOf(a));
+}
+
 TEST_F(NeverLose,
        EmptyingAFolderOfAnySizeIsRefusedAndADeleteConfirmedOnOneComputerTravelsAsConfirmed) {
   Computer::write(a.contacts() + "/one.vcf", card("one", "One", "1"));
@@ -248,6 +309,37 @@ TEST_F(NeverLose,
   Computer::Result applied = sync(b);
   EXPECT_THAT(applied.out, HasSubstr("2 deletes confirmed on another computer"));
   EXPECT_TRUE(contactsOf(b).empty());
+}
+
+// Makes a folder immutable, or mutable again: the one way to make a folder
+// that cannot be written when the tests run as root.
+bool setImmutable(const std::string& folder, bool on) {
+  int fd = ::open(folder.c_str(), O_RDONLY | O_DIRECTORY);
+  if (fd < 0) return false;
+  int flags = 0;
+  bool ok = ::ioctl(fd, FS_IOC_GETFLAGS, &flags) == 0;
+  flags = on ? (flags | FS_IMMUTABLE_FL) : (flags & ~FS_IMMUTABLE_FL);
+  ok = ok && ::ioctl(fd, FS_IOC_SETFLAGS, &flags) == 0;
+  ::close(fd);
+  return ok;
+}
+
+TEST_F(NeverLose, AFolderThatCannotBeWrittenFailsTheSyncNamesTheFileAndIsWrittenNextTime) {
+  Computer::write(a.contacts() + "/ann.vcf", card("ann", "Ann", "1"));
+  sync(a);
+  sync(b);
+  Computer::write(a.contacts() + "/bob.vcf", card("bob", "Bob", "2"));
+  sync(a);
+  if (!setImmutable(b.contacts(), true)) GTEST_SKIP() << "this file system cannot lock a folder";
+  Computer::Result failed = b.run({"sync"});
+  setImmutable(b.contacts(), false);
+  EXPECT_EQ(failed.status, 9) << failed.out << failed.err;
+  EXPECT_THAT(failed.err, HasSubstr("could not write bob.vcf"));
+  EXPECT_THAT(b.run({"status"}).out, HasSubstr("not written bob.vcf"));
+
+  sync(b);
+  EXPECT_EQ(contactsOf(b), contactsOf(a));
+  EXPECT_THAT(b.run({"status"}).out, Not(HasSubstr("not written")));
 }
 
 }  // namespace

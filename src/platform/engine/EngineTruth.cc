@@ -95,6 +95,7 @@ void SqliteEngine::storeSync(const std::string& dataclass, const SyncOutcome& ou
       "INSERT OR IGNORE INTO folder_takes (client, dataclass, record) VALUES (?1, ?2, ?3)");
   for (const std::string& id : outcome.folderTakes)
     take.bind(1, outcome.folderClient).bind(2, dataclass).bind(3, id).run();
+  writeSetAside(dataclass, outcome.setAside);
   Statement purge(db_.handle(), "DELETE FROM tombstones WHERE deleted < ?1");
   purge.bind(1, now - kTombstoneSeconds).run();
   writeState(outcome.networkClient, dataclass, outcome.network);
@@ -120,11 +121,20 @@ void SqliteEngine::storeFolderUpdate(const std::string& client, const std::strin
                   "DELETE FROM folder_takes WHERE client = ?1 AND dataclass = ?2 AND record = ?3");
   for (const std::string& id : update.taken)
     taken.bind(1, client).bind(2, dataclass).bind(3, id).run();
+  writeSetAside(dataclass, update.setAside);
+  writeState(client, dataclass, update.state);
+  t.commit();
+}
+
+void SqliteEngine::writeSetAside(
+    const std::string& dataclass,
+    const std::vector<std::pair<std::string, std::optional<SetAside>>>& entries) {
+  if (entries.empty()) return;
   Statement aside(db_.handle(),
                   "INSERT OR REPLACE INTO set_aside (dataclass, record, file, reason, origin, "
                   "date) VALUES (?1, ?2, ?3, ?4, ?5, ?6)");
   Statement back(db_.handle(), "DELETE FROM set_aside WHERE dataclass = ?1 AND record = ?2");
-  for (const auto& [id, record] : update.setAside) {
+  for (const auto& [id, record] : entries) {
     if (record) {
       aside.bind(1, dataclass).bind(2, id).bind(3, record->file).bind(4, record->reason);
       aside.bind(5, record->origin).bind(6, secondsOf(record->date)).run();
@@ -132,8 +142,6 @@ void SqliteEngine::storeFolderUpdate(const std::string& client, const std::strin
       back.bind(1, dataclass).bind(2, id).run();
     }
   }
-  writeState(client, dataclass, update.state);
-  t.commit();
 }
 
 std::map<std::string, SetAside> SqliteEngine::setAsideRecords(const std::string& dataclass) {

@@ -65,6 +65,8 @@ class SqliteEngine final : public SyncEngine {
   void migrate();
   void writeState(const std::string& client, const std::string& dataclass,
                   const StateUpdate& state);
+  void writeSetAside(const std::string& dataclass,
+                     const std::vector<std::pair<std::string, std::optional<SetAside>>>& entries);
   Dictionary clientSettings(const std::string& client);
   void storeClientSettings(const std::string& client, const Dictionary& settings);
   int64_t anchorOf(const std::string& client, const std::string& dataclass, bool* needsTruth);

@@ -114,6 +114,9 @@ struct SyncOutcome {
   std::vector<Entry> truth;
   // Records whose files the folder client must write or remove.
   std::vector<std::string> folderTakes;
+  // Records set aside (none: no longer), such as one whose change could
+  // not be read.
+  std::vector<std::pair<std::string, std::optional<SetAside>>> setAside;
   std::string networkClient, folderClient;
   StateUpdate network;  // the network client's state
   StateUpdate folder;   // the folder client's item states

@@ -91,6 +91,13 @@ TEST(RecordMerge, ContactsMergeAtTheGrainPeopleEdit) {
   EXPECT_EQ(o.bytes, realEdit);
   EXPECT_TRUE(o.lost.empty());
 
+  // Both stamped their edits: the later stamp stands, and it is no conflict.
+  const std::string stamped = edit(kCard, "UID:ada\r\n", "UID:ada\r\nREV:20250101T000000Z\r\n");
+  o = merge({ItemKind::Contacts, stamped, edit(stamped, "20250101T000000Z", "20250301T000000Z"),
+             edit(stamped, "20250101T000000Z", "20250201T000000Z")});
+  EXPECT_THAT(o.bytes, HasSubstr("REV:20250301T000000Z\r\n"));
+  EXPECT_TRUE(o.lost.empty());
+
   // One field changed on both sides: the share's value stands, ours is kept.
   o = merge({ItemKind::Contacts, kCard, edit(kCard, "FN:Ada Lovelace", "FN:Ada King"),
              edit(kCard, "FN:Ada Lovelace", "FN:Augusta Ada")});
