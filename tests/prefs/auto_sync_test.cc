@@ -244,9 +244,13 @@ TEST_F(AutoSync, SyncOnChangeInstallsTheBookmarksJobOnceAndLeavesItWhenTurnedOff
   prefs.setAutomaticallySyncOn(true);
   EXPECT_TRUE(prefs.automaticallySyncOn());
   EXPECT_TRUE(logged.messages("Error").empty());
-  auto client = getNubiloClient();
+  auto client = getVantorClient();  // registered with the installed description
   ASSERT_TRUE(client);
-  EXPECT_EQ(client->objectForKey("SyncsAfterClients"), Value(true));
+  EXPECT_EQ(client->clientIdentifier(), kVantorSyncClientId);
+  EXPECT_TRUE(client->description().get("Dataclasses").dictionary().contains("com.korvo.Contacts"));
+  EXPECT_EQ(getNubiloClient()->objectForKey("SyncsAfterClients"), Value(true));
+  EXPECT_EQ(getVanterConfiguration().get("sync_namespace"),
+            prefs.configuration().get("sync_namespace"));
   EXPECT_FALSE(prefs.checkBookmarksPlistAndCreateIfNecessary());  // no browser
   EXPECT_FALSE(std::filesystem::exists(vtc::autosync::bookmarksJobFile()));
 

@@ -8,6 +8,7 @@
 #include <fstream>
 #include <iterator>
 #include <stdexcept>
+#include <utility>
 
 #include "localshare/ApacheShare.h"
 #include "localshare/Processes.h"
@@ -67,12 +68,7 @@ MqttBroker::MqttBroker(Options options) : options_(options) {
   }
   writeFile(root_ + "/access", rules);
 
-  // The guide's configuration, on a port of our own, with our files.
-  std::string config = readFile(guideFile("mosquitto.conf"));
-  replaceLine(config, "listener 8883", "listener " + std::to_string(port_) + " 127.0.0.1");
-  replaceLine(config, "password_file /etc/mosquitto/nubilo.passwd",
-              "password_file " + root_ + "/passwords");
-  replaceLine(config, "acl_file /etc/mosquitto/nubilo.acl", "acl_file " + root_ + "/access");
+  // The guide's configuration, on a port and with files of our own.
   if (options_.tls) {
     const std::string make =
         "cd '" + root_ +
@@ -80,13 +76,17 @@ MqttBroker::MqttBroker(Options options) : options_(options) {
         "-subj /CN=127.0.0.1 -addext subjectAltName=IP:127.0.0.1 -keyout server.key "
         "-out server.pem >/dev/null 2>&1";
     if (std::system(make.c_str()) != 0) throw std::runtime_error("openssl failed");
-    replaceLine(config, "certfile /etc/mosquitto/certs/push.pem", "certfile " + certificateFile());
-    replaceLine(config, "keyfile /etc/mosquitto/certs/push.key",
-                "keyfile " + root_ + "/server.key");
-  } else {
-    replaceLine(config, "certfile /etc/mosquitto/certs/push.pem", "");
-    replaceLine(config, "keyfile /etc/mosquitto/certs/push.key", "");
   }
+  const std::pair<const char*, std::string> ours[] = {
+      {"listener 8883", "listener " + std::to_string(port_) + " 127.0.0.1"},
+      {"password_file /etc/mosquitto/nubilo.passwd", "password_file " + root_ + "/passwords"},
+      {"acl_file /etc/mosquitto/nubilo.acl", "acl_file " + root_ + "/access"},
+      {"certfile /etc/mosquitto/certs/push.pem",
+       options_.tls ? "certfile " + certificateFile() : ""},
+      {"keyfile /etc/mosquitto/certs/push.key",
+       options_.tls ? "keyfile " + root_ + "/server.key" : ""}};
+  std::string config = readFile(guideFile("mosquitto.conf"));
+  for (const auto& [from, to] : ours) replaceLine(config, from, to);
   config += "persistence false\nlog_dest file " + root_ + "/broker.log\n";
   // Started as root, mosquitto would give up its rights and lose its files.
   if (::geteuid() == 0) config += "user root\n";

@@ -65,15 +65,4 @@ TEST_F(SyncStatus, OnlyARunningPlanWithThisClientCountsAsSyncing) {
   EXPECT_TRUE(NubiloCurrentlySyncing());
 }
 
-TEST_F(SyncStatus, TheClientRecordIsRegisteredWithTheInstalledDescription) {
-  auto client = getVantorClient();
-  ASSERT_TRUE(client);
-  EXPECT_EQ(client->clientIdentifier(), kVantorSyncClientId);
-  EXPECT_TRUE(client->description().get("Dataclasses").dictionary().contains("com.korvo.Contacts"));
-  client->setObject(vtc::Value("x"), "probe");
-  EXPECT_EQ(getNubiloClient()->objectForKey("probe"), vtc::Value("x"));
-  EXPECT_EQ(getVanterConfiguration().get("sync_namespace"),
-            VTCPrefsCenter::defaultCenter().configuration().get("sync_namespace"));
-}
-
 }  // namespace
