@@ -45,10 +45,12 @@ std::shared_ptr<SyncEngineClientRecord> getNubiloClient() {
     if (!description || !description->isDictionary())
       throw NubiloException("NSInvalidArgumentException",
                             "the client description " + *path + " is no property list");
+    const bool known = engine->hasClient(kVantorSyncClientId);
     engine->registerClient(kVantorSyncClientId, description->dictionary());
     // A choice of syncing after other clients made before the record
     // existed takes effect now.
-    vtc::setSyncsAfterOtherClients(VTCPrefsCenter::defaultCenter().automaticallySyncOn());
+    if (!known)
+      vtc::setSyncsAfterOtherClients(VTCPrefsCenter::defaultCenter().automaticallySyncOn());
     return std::make_shared<SyncEngineClientRecord>(kVantorSyncClientId, description->dictionary());
   } catch (const NubiloException& e) {
     VTC_LOG_ERROR("Exception caught while getting the XSyncClient in getVantorClient -  %@ %@",

@@ -153,6 +153,7 @@ class SyncEngine {
 
   // Client records: registered with a description, with settings by key.
   virtual void registerClient(const std::string& client, const Dictionary& description) = 0;
+  // Whether the client has been registered.
   virtual bool hasClient(const std::string& client) = 0;
   virtual Value objectForKey(const std::string& client, const std::string& key) = 0;
   virtual void setObjectForKey(const std::string& client, const std::string& key,
