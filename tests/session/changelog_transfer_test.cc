@@ -147,7 +147,6 @@ INSTANTIATE_TEST_SUITE_P(Servers, Transfer, vtc::test::kEachServer, vtc::test::s
 
 TEST_P(Commit, PublishesWithThreeRequestsBeyondTheLockAndLeavesNoTemporaryFile) {
   session->getDataclassInfo(kDataclass);
-  EXPECT_FALSE(session->commitChanges({}, kDataclass, 1, false));  // sends nothing
   session->lockDataclass(kDataclass);
   const size_t before = share.accessEntries().size();
   const std::vector<SyncEngineChange> changes = someChanges(3, "first");
