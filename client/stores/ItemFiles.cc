@@ -1,6 +1,7 @@
 #include "client/stores/ItemFiles.h"
 
 #include <fcntl.h>
+#include <sys/stat.h>
 #include <unistd.h>
 
 #include <cctype>
@@ -62,6 +63,9 @@ bool isTemporaryName(std::string_view name) {
 
 std::optional<std::string> readWhole(int fd) {
   std::string bytes;
+  // Sized once from the file's length: a grown string holds up to twice it.
+  struct stat st {};
+  if (::fstat(fd, &st) == 0 && st.st_size > 0) bytes.reserve(static_cast<size_t>(st.st_size));
   char buffer[16384];
   for (;;) {
     ssize_t n = ::read(fd, buffer, sizeof buffer);
