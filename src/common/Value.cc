@@ -8,6 +8,8 @@
 #include <ctime>
 #include <unordered_map>
 
+#include "common/Format.h"
+
 namespace vtc {
 
 namespace {
@@ -76,8 +78,7 @@ std::string describe(const Value& v, int level) {
     case Value::Kind::Integer:
       return std::to_string(v.integer());
     case Value::Kind::Real:
-      std::snprintf(buf, sizeof buf, "%.17g", v.real());
-      return buf;
+      return shortestText(v.real());
     case Value::Kind::Boolean:
       return v.boolean() ? "1" : "0";
     case Value::Kind::Date: {

@@ -289,7 +289,7 @@ TEST_P(Locking, LocksOnMissingOrForgottenResourcesFail) {
             "Failed to unlock resource (lock not held), " + contacts);
 }
 
-TEST_P(Locking, ALockCutOffIsRaisedAfterOnePauseAndAFailedUnlockIsKeptForTheRelease) {
+TEST_P(Locking, ALockCutOffIsRaisedAfterOnePause) {
   const std::string target = schemas + "/Contacts/";
   session->tesselSession().makeCollectionAtPath(schemas + "/Contacts", false);
   proxy.answer({"LOCK", target, 1}, 423);
@@ -301,19 +301,6 @@ TEST_P(Locking, ALockCutOffIsRaisedAfterOnePauseAndAFailedUnlockIsKeptForTheRele
   EXPECT_EQ(time.sleeps().size(), 1u);
   ASSERT_EQ(traces.withDomain(kFinal).size(), 1u);
   EXPECT_EQ(field(kRetry, 1, "COM_KORVO_MESSAGE_VALUE"), "1");
-
-  // An unlock is tried twice at once.
-  proxy.clear();
-  session->lockDataclass("Contacts");
-  proxy.answer({"UNLOCK", target, 0}, 500);
-  session->unlockDataclass("Contacts");
-  EXPECT_EQ(seen("UNLOCK", target), 2u);
-  EXPECT_EQ(session->lockedResources().count(target), 1u);
-  EXPECT_EQ(time.sleeps().size(), 1u);
-  proxy.clear();
-  session.reset();  // the release tries once more, and gets through
-  EXPECT_EQ(seen("UNLOCK", target), 3u);
-  EXPECT_EQ(proxy.requests().back().action, "forwarded");
 }
 
 TEST_P(Locking, ALockThatExpiredIsTakenAgainAndOnlyAMissingTargetIsNotFound) {
@@ -348,10 +335,13 @@ TEST_P(Locking, ALockWhoseRenewalOrReleaseWasRefusedIsStillReleasedOnTheServer) 
   EXPECT_EQ(seen("UNLOCK", target), 1u);
   EXPECT_TRUE(session->lockedResources().empty());
 
+  // An unlock is tried twice at once; a failed one is kept for the release.
   session->lockDataclass("Contacts");
   proxy.answer({"UNLOCK", target, 0}, 403);
   session->unlockDataclass("Contacts");
   EXPECT_EQ(seen("UNLOCK", target), 3u);  // both tries sent
+  EXPECT_EQ(session->lockedResources().count(target), 1u);
+  EXPECT_TRUE(time.sleeps().empty());
   proxy.clear();
   session.reset();  // the release sends it once more, and the server lets go
   EXPECT_EQ(seen("UNLOCK", target), 4u);
