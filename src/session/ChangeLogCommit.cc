@@ -14,6 +14,7 @@
 #include "platform/bus/DistributedNotifications.h"
 #include "platform/dav/TesselSession.h"
 #include "platform/engine/SyncEngine.h"
+#include "platform/sealing/AccountSeal.h"
 
 namespace {
 
@@ -48,6 +49,14 @@ bool NubiloRemoteSession::commitChanges(const std::vector<SyncEngineChange>& cha
         "CreatorClientVersion");
     changeLog.setSchemaVersions(vtc::engine::SyncEngine::open()->schemaVersions(dataclass));
     changeLog.writeToData(bytes);
+    // An encrypted account's share sees the envelope only: who wrote it
+    // (a random id) and with which build.
+    if (_accountSeal)
+      bytes = _accountSeal->sealChangeLog(
+          bytes, dataclass, index,
+          vtc::Dictionary{
+              {"CreatorClientGuid", _configuration.get("guid")},
+              {"CreatorClientVersion", changeLog.headerValueForKey("CreatorClientVersion")}});
   }
   VTC_LOG_INFO("%@ Uploading changeLog with index %d", dataclass, index);
 

@@ -12,14 +12,17 @@
 #include <iterator>
 #include <mutex>
 
+#include <sodium.h>
 #include "VantorSyncManager/NubiloException.h"
 #include "VantorSyncManager/NubiloRemoteSession.h"
 #include "VantorSyncManager/PublicNames.h"
+#include "changelog/ChangeLogEnvelope.h"
 #include "common/Logging.h"
 #include "common/Uuid.h"
 #include "platform/bus/DistributedNotifications.h"
 #include "platform/dav/TesselSession.h"
 #include "platform/fs/LocalPaths.h"
+#include "platform/sealing/AccountSeal.h"
 
 namespace {
 
@@ -60,6 +63,28 @@ uint64_t fileSize(const std::string& path) {
 vtc::Bytes readWhole(const std::string& path) {
   std::ifstream in(path, std::ios::binary);
   return vtc::Bytes(std::istreambuf_iterator<char>(in), std::istreambuf_iterator<char>());
+}
+
+// Opens one downloaded changelog of an encrypted account into result, or
+// refuses it there.
+void openSealed(const vtc::sealing::AccountSeal& seal, const Download& download,
+                const std::string& dataclass, vtc::ChangeLogFetchResult& result) {
+  const vtc::Bytes stored = readWhole(download.file);
+  vtc::Bytes plain;
+  try {
+    plain = seal.openChangeLog(stored, dataclass, download.index);
+  } catch (const std::runtime_error& e) {
+    // Never applied, never a stop: the caller names it and goes on.
+    std::string creator;
+    if (auto envelope = vtc::clog::readEnvelope(stored))
+      creator = envelope->headers.get("CreatorClientGuid").string();
+    VTC_LOG_WARNING("Changelog %d of %@ is set aside: %@", download.index, dataclass, e.what());
+    result.refusedChangeLogs[download.index] = vtc::RefusedChangeLog{e.what(), creator};
+    return;
+  }
+  // Opened in memory: the plain changelog never reaches a file.
+  result.changeLogs[download.index] = std::make_unique<NubiloChangeLog>(plain);
+  sodium_memzero(plain.data(), plain.size());
 }
 
 }  // namespace
@@ -115,6 +140,10 @@ vtc::ChangeLogFetchResult NubiloRemoteSession::fetchChangeLogsForDataclass(
     }
     VTC_LOG_INFO("Processing batched clogs from %i to %i for %@", start, end, dataclass);
     for (Download& download : batch) {
+      if (_accountSeal) {
+        openSealed(*_accountSeal, download, dataclass, result);
+        continue;
+      }
       if (fileSize(download.file) < kMappingThreshold)
         result.changeLogs[download.index] = std::make_unique<NubiloChangeLog>(
             readWhole(download.file));  // the file goes with the download

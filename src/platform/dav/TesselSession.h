@@ -122,7 +122,9 @@ class TesselSession {
 
   // Stores a flattened sync report as "<reportsPath>/<MachineGUID>.plist"
   // (the collection is made on first use).
-  DavTransaction _sendReportingInfo(const vtc::Dictionary& report, const std::string& reportsPath);
+  DavTransaction _sendReportingInfo(
+      const vtc::Dictionary& report, const std::string& reportsPath,
+      const std::function<vtc::Bytes(const vtc::Bytes&)>& seal = nullptr);
 
   const std::string& owner() const { return owner_; }
   // The SHA-256 digest of the HTTPS server's certificate; empty over HTTP.

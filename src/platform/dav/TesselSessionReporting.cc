@@ -4,8 +4,9 @@
 #include "platform/dav/TesselSession.h"
 #include "platform/plist/PlistCodec.h"
 
-DavTransaction TesselSession::_sendReportingInfo(const vtc::Dictionary& report,
-                                                 const std::string& reportsPath) {
+DavTransaction TesselSession::_sendReportingInfo(
+    const vtc::Dictionary& report, const std::string& reportsPath,
+    const std::function<vtc::Bytes(const vtc::Bytes&)>& seal) {
   const vtc::Value& machine = report.get("MachineGUID");
   if (!machine.isString() || machine.string().empty()) {
     DavTransaction t("PUT", reportsPath);
@@ -14,7 +15,8 @@ DavTransaction TesselSession::_sendReportingInfo(const vtc::Dictionary& report,
     return t;
   }
   const std::string xml = vtc::plist::toXml(vtc::Value(report));
-  const vtc::Bytes body(xml.begin(), xml.end());
+  vtc::Bytes body(xml.begin(), xml.end());
+  if (seal) body = seal(body);
   const std::string path =
       stringByAppendingTesselPathComponent(reportsPath, machine.string() + ".plist");
   DavTransaction t = putData(body, path);
