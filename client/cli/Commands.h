@@ -27,7 +27,15 @@ struct SetupRequest {
   std::optional<std::string> pushServer;  // mqtt[s]://host[:port], stored once setup succeeds
   bool allowInsecure = false;             // the password may cross plain http:// or mqtt://
   bool newArea = false;  // start a new sync area where none was expected, without asking
+  // A new account's data is encrypted (a joining computer follows the
+  // share: an area with a key record is encrypted).
+  bool encrypt = false;
+  std::optional<std::string> passphraseCommand;  // prints the passphrase; else the terminal
 };
+
+// `passphrase`: rewraps the account key with a new passphrase; the data
+// stays as it is.
+int passphraseCommand(Output& output);
 
 int setupCommand(const SetupRequest& request, Output& output);
 int addCommand(const std::string& kind, const std::string& folder,
