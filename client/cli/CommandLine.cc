@@ -91,6 +91,11 @@ int runCommandLine(int argc, char** argv) {
   setupCommandLine->add_option(
       "--passphrase-command", passphraseCommandLine,
       "A command whose first output line is the encryption passphrase (else the terminal)");
+  auto* encrypt = app.add_subcommand(
+      "encrypt", "Turn the account's data in the clear over to encryption (one compaction)");
+  std::string encryptPassphraseCommand;
+  encrypt->add_option("--passphrase-command", encryptPassphraseCommand,
+                      "A command whose first output line is the new passphrase");
   auto* passphrase = app.add_subcommand(
       "passphrase", "Change the passphrase of an encrypted account (the data stays as it is)");
 
@@ -197,6 +202,11 @@ int runCommandLine(int argc, char** argv) {
                               conflictId, output);
     if (*status) return statusCommand(statusJson, output);
     if (*passphrase) return passphraseCommand(output);
+    if (*encrypt)
+      return encryptCommand(encryptPassphraseCommand.empty()
+                                ? std::nullopt
+                                : std::optional<std::string>(encryptPassphraseCommand),
+                            output);
     if (*schedule)
       return scheduleCommand(scheduleSwitch == "on",
                              every.empty() ? std::nullopt : std::optional<std::string>(every),

@@ -36,6 +36,9 @@ struct SetupRequest {
 // `passphrase`: rewraps the account key with a new passphrase; the data
 // stays as it is.
 int passphraseCommand(Output& output);
+// `encrypt`: turns this computer's account in the clear over to encryption
+// with one compaction of each dataclass.
+int encryptCommand(const std::optional<std::string>& passphraseCommand, Output& output);
 
 int setupCommand(const SetupRequest& request, Output& output);
 int addCommand(const std::string& kind, const std::string& folder,

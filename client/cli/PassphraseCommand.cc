@@ -13,16 +13,6 @@
 
 namespace vtc::client {
 
-namespace {
-
-std::string asked(const std::string& prompt) {
-  auto typed = readPassword(prompt);
-  if (!typed || typed->empty()) throw SyncFailure(FailureKind::Usage, "No passphrase was given.");
-  return *typed;
-}
-
-}  // namespace
-
 int passphraseCommand(Output& output) {
   if (!accountEncrypted())
     throw SyncFailure(FailureKind::Usage,
@@ -34,7 +24,7 @@ int passphraseCommand(Output& output) {
   std::optional<Dictionary> record = readKeyRecord(*session);
   if (!record)
     throw SyncFailure(FailureKind::Other, "The share holds no key for this encrypted account.");
-  std::string old = asked("Current passphrase: ");
+  std::string old = readPassphrase(std::nullopt, false);
   std::optional<sealing::SecretKey> key;
   try {
     key = unwrapWithPassphrase(*record, old);
@@ -43,14 +33,7 @@ int passphraseCommand(Output& output) {
     throw;
   }
   wipe(old);
-  std::string fresh = asked("New passphrase: ");
-  std::string again = asked("The same passphrase again: ");
-  const bool same = fresh == again;
-  wipe(again);
-  if (!same) {
-    wipe(fresh);
-    throw SyncFailure(FailureKind::Usage, "The two passphrases differ; nothing was changed.");
-  }
+  std::string fresh = readPassphrase(std::nullopt, true);
   const Dictionary rewrapped = sealing::wrapKey(*key, fresh);
   wipe(fresh);
   writeKeyRecord(*session, rewrapped);

@@ -83,29 +83,6 @@ std::string names(const std::vector<AreaComputer>& computers) {
   return out;
 }
 
-// The passphrase from the command or the terminal; a new one is asked
-// twice at a terminal. Held undumpable by the caller, wiped after use.
-std::string readPassphrase(const SetupRequest& request, bool fresh) {
-  if (request.passphraseCommand) return passphraseFromCommand(*request.passphraseCommand);
-  if (request.passwordFromStdin || !::isatty(STDIN_FILENO))
-    throw SyncFailure(FailureKind::Usage,
-                      "This account is encrypted: give its passphrase at a terminal, or with "
-                      "--passphrase-command CMD.");
-  auto typed = readPassword(fresh ? "New passphrase for the account's encryption: "
-                                  : "Passphrase of the account's encryption: ");
-  if (!typed || typed->empty()) throw SyncFailure(FailureKind::Usage, "No passphrase was given.");
-  if (fresh) {
-    auto again = readPassword("The same passphrase again: ");
-    const bool same = again && *again == *typed;
-    if (again) wipe(*again);
-    if (!same) {
-      wipe(*typed);
-      throw SyncFailure(FailureKind::Usage, "The two passphrases differ; nothing was changed.");
-    }
-  }
-  return *typed;
-}
-
 // An encrypted account's key, opened (or for a new account made) before
 // anything is stored, so that a wrong passphrase changes nothing. record:
 // the new account's key record to store on the share, when made here.
@@ -116,7 +93,7 @@ std::optional<sealing::SecretKey> openAccountKey(const SetupRequest& request,
   std::optional<Dictionary> existing;
   if (found.kind == SyncAreaFinding::Kind::SyncArea) existing = readKeyRecord(session);
   if (existing) {
-    std::string passphrase = readPassphrase(request, false);
+    std::string passphrase = readPassphrase(request.passphraseCommand, false);
     try {
       sealing::SecretKey key = unwrapWithPassphrase(*existing, passphrase);
       wipe(passphrase);
@@ -135,7 +112,7 @@ std::optional<sealing::SecretKey> openAccountKey(const SetupRequest& request,
                           "The sync area already holds data that is not encrypted; --encrypt "
                           "starts a new account only (in a new, empty sync area).");
   }
-  std::string passphrase = readPassphrase(request, true);
+  std::string passphrase = readPassphrase(request.passphraseCommand, true);
   sealing::SecretKey key = sealing::SecretKey::random();
   record = sealing::wrapKey(key, passphrase);
   wipe(passphrase);
@@ -312,6 +289,8 @@ int setupCommand(const SetupRequest& request, Output& output) {
   if (!registered.contains("firstsync"))
     record.set("firstsync", Value(textOf(Value(currentClock().now()))));
   if (auto machine = getHostUUIDString()) record.set("machineguid", Value(*machine));
+  // A computer registered before the account was encrypted: its name too.
+  if (seal) record.set("clientname", Value(seal->sealText(name, sealing::kClientNamePurpose)));
   session->patchClientInfo(record);
   storeAccount(setup, guid, name);
   if (push) storePushServer(*push);

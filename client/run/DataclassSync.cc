@@ -461,6 +461,12 @@ DataclassSync::Incoming DataclassSync::fetch(bool slow, const DataclassRecord& r
 }
 
 void DataclassSync::setAsideChangeLogs(const std::map<int64_t, RefusedChangeLog>& refused) {
+  if (!refused.empty() && !session_.accountSeal())
+    throw SyncFailure(FailureKind::Login,
+                      "The account's data is encrypted now (changelog " +
+                          std::to_string(refused.begin()->first) + " of " + collection_.dataclass +
+                          " is); run `nubilosyncclient setup` again to give this computer the "
+                          "passphrase.");
   // Nothing of them is known but who the envelope says wrote them.
   for (const auto& [index, log] : refused) {
     std::string origin;

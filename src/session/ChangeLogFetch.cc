@@ -13,6 +13,7 @@
 #include <mutex>
 
 #include <sodium.h>
+#include "VantorSyncManager/NubiloDataAdditions.h"
 #include "VantorSyncManager/NubiloException.h"
 #include "VantorSyncManager/NubiloRemoteSession.h"
 #include "VantorSyncManager/PublicNames.h"
@@ -63,6 +64,15 @@ uint64_t fileSize(const std::string& path) {
 vtc::Bytes readWhole(const std::string& path) {
   std::ifstream in(path, std::ios::binary);
   return vtc::Bytes(std::istreambuf_iterator<char>(in), std::istreambuf_iterator<char>());
+}
+// Whether the file begins as a changelog without records (an envelope, or
+// an empty changelog).
+bool startsLikeEnvelope(const std::string& path) {
+  std::ifstream in(path, std::ios::binary);
+  uint8_t head[12] = {};
+  if (!in.read(reinterpret_cast<char*>(head), sizeof head)) return false;
+  return NubiloUInt32AtOffset(vtc::ByteView(head, sizeof head), 4) == 12 &&
+         NubiloUInt32AtOffset(vtc::ByteView(head, sizeof head), 8) == 0xFFFFFFFF;
 }
 
 // Opens one downloaded changelog of an encrypted account into result, or
@@ -142,6 +152,13 @@ vtc::ChangeLogFetchResult NubiloRemoteSession::fetchChangeLogsForDataclass(
     for (Download& download : batch) {
       if (_accountSeal) {
         openSealed(*_accountSeal, download, dataclass, result);
+        continue;
+      }
+      // An encrypted account's changelog read without its key would be a
+      // changelog without changes: it is refused instead.
+      if (startsLikeEnvelope(download.file) && vtc::clog::readEnvelope(readWhole(download.file))) {
+        result.refusedChangeLogs[download.index] = vtc::RefusedChangeLog{
+            "it is encrypted, and this computer has not the account's key", ""};
         continue;
       }
       if (fileSize(download.file) < kMappingThreshold)

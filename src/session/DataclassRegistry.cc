@@ -135,7 +135,7 @@ bool NubiloRemoteSession::setInfoForDataclass(const vtc::Dictionary& properties,
   VTC_LOG_INFO("Patching dataclass info at path %@ with properties %@", path, properties);
   vtc::Dictionary patch = properties;
   if (const vtc::Value* digest = patch.find("truthdigest");
-      _accountSeal && digest && digest->isString())
+      _accountSeal && digest && digest->isString() && digest->string() != kNBRemoveProp)
     patch.set("truthdigest", vtc::Value(_accountSeal->sealText(digest->string(),
                                                                vtc::sealing::kTruthDigestPurpose)));
   return _issuePropPatchWithRetryAtPath(path + "/", patch, _syncNamespace).isSuccessful();

@@ -11,6 +11,7 @@
 #include <fstream>
 #include <iterator>
 
+#include "VantorSyncManager/NubiloChangeLog.h"
 #include "VantorSyncManager/NubiloRemoteSession.h"
 #include "VantorSyncManager/PublicNames.h"
 #include "common/Format.h"
@@ -76,16 +77,16 @@ class EncryptedAccount : public ::testing::Test {
     EXPECT_EQ(r.status, status) << c.name() << ": " << r.err << r.out;
     return r;
   }
-  // A library session of the account with its key, as a computer's own.
+  // A library session of the account with its key (when it has one), as a
+  // computer's own.
   std::unique_ptr<NubiloRemoteSession> sealedSession(const std::string& computer) const {
     vtc::Dictionary config = share.configuration();
     config.set("sync_path", vtc::Value("/sync"));
     config.set("ClientName", vtc::Value(computer));
     auto session = NubiloRemoteSession::sessionWithUsername(Share::kUser, Share::kPassword, config);
-    auto record = vtc::plist::parse([&] {
-      const std::string text = readAll(share.diskPath("/sync/AccountKey.plist"));
-      return vtc::Bytes(text.begin(), text.end());
-    }());
+    const std::string text = readAll(share.diskPath("/sync/AccountKey.plist"));
+    if (text.empty()) return session;
+    auto record = vtc::plist::parse(vtc::Bytes(text.begin(), text.end()));
     auto key = vtc::sealing::unwrapKey(record->dictionary(), kPassphrase);
     session->setAccountSeal(std::make_shared<const vtc::sealing::AccountSeal>(std::move(*key)));
     return session;
@@ -112,8 +113,14 @@ class EncryptedAccount : public ::testing::Test {
     session->lockClients();
     session->lockDataclass(kContacts);
     const std::filesystem::path root = std::filesystem::path(share.documentRoot()).parent_path();
-    for (const auto& entry : std::filesystem::recursive_directory_iterator(root))
-      if (entry.is_regular_file()) all += entry.path().string() + "\n" + readAll(entry.path());
+    for (const auto& entry : std::filesystem::recursive_directory_iterator(root)) {
+      if (!entry.is_regular_file()) continue;
+      const std::string bytes = readAll(entry.path());
+      all += entry.path().string() + "\n" + bytes;
+      // A changelog's records are deflated: they are searched as read.
+      if (entry.path().string().find(".clog") != std::string::npos)
+        all += NubiloChangeLog(vtc::Bytes(bytes.begin(), bytes.end())).description();
+    }
     collectProperties(*session, "/sync/", all);
     session->unlockDataclass(kContacts);
     session->unlockClients();
@@ -215,6 +222,62 @@ TEST_F(EncryptedAccount, AChangelogChangedOnTheShareIsSetAsideAndNamedAndSyncing
   sync(a);
   EXPECT_THAT(sync(b).err, Not(HasSubstr("set aside")));
   EXPECT_EQ(Computer::read(b.contacts() + "/person-2.vcf"), vtc::local::peerCard(2, 0));
+}
+
+// An account in the clear turned over to encryption by one of its
+// computers; the other follows once it has the passphrase.
+class AccountTurnedOver : public EncryptedAccount {
+ protected:
+  void SetUp() override {
+    a.join(url, Share::kUser, Share::kPassword, share.setupArguments());
+    b.join(url, Share::kUser, Share::kPassword, share.setupArguments());
+  }
+};
+
+TEST_F(AccountTurnedOver, OneCompactionLeavesOnlyCiphertextAndTheOtherComputerFollows) {
+  for (int i = 0; i < 20; ++i)
+    Computer::write(a.contacts() + "/person-" + std::to_string(i) + ".vcf",
+                    vtc::local::peerCard(i, 0));
+  Computer::write(a.calendars() + "/dentist.ics", kVisit);
+  sync(a);
+  sync(b);
+  Computer::write(b.contacts() + "/person-4.vcf", vtc::local::peerCard(4, 1));
+  sync(b);
+
+  // In the clear, the search finds all of it.
+  const std::string before = everythingOnTheShare();
+  for (const char* secret :
+       {"Person Number", "person.1@example", "+1 555 01", "person-1", "Dentist", "Mac A", "Mac B"})
+    EXPECT_NE(before.find(secret), std::string::npos) << secret;
+
+  std::vector<std::string> encrypt{"encrypt"};
+  for (const std::string& s : a.passphraseArguments(kPassphrase)) encrypt.push_back(s);
+  Computer::Result turned = a.run(encrypt);
+  ASSERT_EQ(turned.status, 0) << turned.err << turned.out;
+  EXPECT_EQ(Computer::read(a.contacts() + "/person-4.vcf"), vtc::local::peerCard(4, 1));
+  // The other computer stops, changing nothing, until it has the passphrase.
+  EXPECT_THAT(sync(b, 3).err, HasSubstr("The account's data is encrypted now"));
+  // Setup again, its folders kept.
+  std::vector<std::string> again{"setup",
+                                 url,
+                                 "--user",
+                                 Share::kUser,
+                                 "--password-command",
+                                 "cat '" + b.home() + "/.password'"};
+  for (const std::string& s : b.passphraseArguments(kPassphrase)) again.push_back(s);
+  for (const std::string& s : share.setupArguments()) again.push_back(s);
+  Computer::Result joined = b.run(again);
+  ASSERT_EQ(joined.status, 0) << joined.err;
+  sync(b);
+  Computer::write(b.contacts() + "/person-5.vcf", vtc::local::peerCard(5, 1));
+  sync(b);
+  sync(a);
+  EXPECT_EQ(Computer::files(a.contacts()), Computer::files(b.contacts()));
+  EXPECT_EQ(Computer::files(a.calendars()), Computer::files(b.calendars()));
+
+  const std::string shared = everythingOnTheShare();
+  for (const std::string& secret : kSecrets)
+    EXPECT_EQ(shared.find(secret), std::string::npos) << secret << " is on the share";
 }
 
 }  // namespace
