@@ -88,9 +88,8 @@ int runCommandLine(int argc, char** argv) {
   setupCommandLine->add_flag("--encrypt", setup.encrypt,
                              "Encrypt a new account's data: the share holds only ciphertext");
   std::string passphraseCommandLine;
-  setupCommandLine->add_option(
-      "--passphrase-command", passphraseCommandLine,
-      "A command whose first output line is the encryption passphrase (else the terminal)");
+  setupCommandLine->add_option("--passphrase-command", passphraseCommandLine,
+                               "A command whose first output line is the encryption passphrase");
   auto* encrypt = app.add_subcommand(
       "encrypt", "Turn the account's data in the clear over to encryption (one compaction)");
   std::string encryptPassphraseCommand;

@@ -30,7 +30,9 @@ struct SetupRequest {
   // A new account's data is encrypted (a joining computer follows the
   // share: an area with a key record is encrypted).
   bool encrypt = false;
-  std::optional<std::string> passphraseCommand;  // prints the passphrase; else the terminal
+  // Prints the passphrase (else it is read like the password); used at
+  // setup only.
+  std::optional<std::string> passphraseCommand;
 };
 
 // `passphrase`: rewraps the account key with a new passphrase; the data

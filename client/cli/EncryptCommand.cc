@@ -21,10 +21,6 @@ int encryptCommand(const std::optional<std::string>& passphraseCommand, Output& 
   if (accountEncrypted())
     throw SyncFailure(FailureKind::Usage, "This computer's account is encrypted already.");
   VTCPrefsCenter& prefs = VTCPrefsCenter::defaultCenter();
-  if (!passphraseCommand && passwordCommandStored())
-    throw SyncFailure(FailureKind::Usage,
-                      "This computer reads its password from a command: give "
-                      "--passphrase-command CMD as well (the key is then kept nowhere here).");
   // Whatever the share holds is taken in while it can still be read.
   const RunResult first = runSync(RunRequest{});
   if (!first.failures.empty())
@@ -43,7 +39,7 @@ int encryptCommand(const std::optional<std::string>& passphraseCommand, Output& 
   const Dictionary record = sealing::wrapKey(key, passphrase);
   wipe(passphrase);
   writeKeyRecord(*session, record);
-  storeAccountKey(member, key, passphraseCommand);
+  storeAccountKey(member, key, passwordCommandStored());
   const sealing::AccountSeal seal(std::move(key));
   session->patchClientInfo(Dictionary{
       {"clientname", seal.sealText(prefs.clientName().value_or(""), sealing::kClientNamePurpose)}});

@@ -233,10 +233,6 @@ int setupCommand(const SetupRequest& request, Output& output) {
   std::optional<Dictionary> newKeyRecord;
   std::optional<sealing::SecretKey> accountKey =
       openAccountKey(request, *session, found, newKeyRecord);
-  if (accountKey && request.passwordCommand && !request.passphraseCommand)
-    throw SyncFailure(FailureKind::Usage,
-                      "This account is encrypted: beside --password-command, give "
-                      "--passphrase-command CMD (the key is then kept nowhere on this computer).");
   std::shared_ptr<const sealing::AccountSeal> seal;
   if (accountKey)
     seal = std::make_shared<const sealing::AccountSeal>(
@@ -278,7 +274,7 @@ int setupCommand(const SetupRequest& request, Output& output) {
   session->setAccountSeal(seal);
   if (accountKey) {
     if (newKeyRecord) writeKeyRecord(*session, *newKeyRecord);
-    storeAccountKey(request.member, *accountKey, request.passphraseCommand);
+    storeAccountKey(request.member, *accountKey, request.passwordCommand.has_value());
   } else {
     forgetAccountKey();
   }

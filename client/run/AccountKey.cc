@@ -1,12 +1,20 @@
 #include "client/run/AccountKey.h"
 
+#include <unistd.h>
 #include "VantorSyncManager/PublicNames.h"
 #include "VantorSyncManager/StringAdditions.h"
+
+#include <filesystem>
+#include <fstream>
+
 #include "client/run/Account.h"
+#include "client/run/SupportFolder.h"
 #include "client/run/SyncFailure.h"
 #include "common/Format.h"
 #include "common/SecretMemory.h"
 #include "platform/dav/TesselSession.h"
+#include "platform/fs/AtomicWrite.h"
+#include "platform/fs/LocalPaths.h"
 #include "platform/plist/PlistCodec.h"
 #include "platform/prefs/PreferenceStore.h"
 #include "platform/sealing/KeyRecord.h"
@@ -24,6 +32,11 @@ constexpr const char* kKeyService = "NubiloAccountKey";
 constexpr const char* kKeyRecordName = "AccountKey.plist";
 // A key record is a few hundred bytes; anything much larger is not one.
 constexpr size_t kLargestKeyRecord = 16 * 1024;
+
+// Beside a password command: only the user reads it.
+std::string keyFilePath() {
+  return paths::join(supportFolder(), "AccountKey");
+}
 
 std::string keyRecordPath(const NubiloRemoteSession& session) {
   return stringByAppendingTesselPathComponent(session.syncPath(), kKeyRecordName);
@@ -86,28 +99,30 @@ std::string passphraseFromCommand(const std::string& command) {
 }
 
 void storeAccountKey(const std::string& member, const sealing::SecretKey& key,
-                     const std::optional<std::string>& passphraseCommand) {
-  auto& store = PreferenceStore::shared();
-  if (!passphraseCommand) {
-    std::string text = key.toText();
-    std::string why;
-    const bool stored =
-        secrets::storeGenericPassword(kKeyService, member, "Nubilo account key", text, &why);
-    wipe(text);
-    if (!stored)
-      throw SyncFailure(FailureKind::Other,
-                        "The account's key could not be stored in the Secret Service (" + why +
-                            "); on a computer without one, give --passphrase-command CMD.");
+                     bool besidePasswordCommand) {
+  std::string text = key.toText();
+  std::string why;
+  bool stored = false;
+  if (besidePasswordCommand) {
+    std::error_code ignored;  // a folder that cannot be made fails the write
+    std::filesystem::create_directories(supportFolder(), ignored);
+    stored = fs::writeFileAtomically(keyFilePath(), text + "\n", 0600);
+    why = "the key file " + keyFilePath() + " could not be written";
+  } else {
+    stored = secrets::storeGenericPassword(kKeyService, member, "Nubilo account key", text, &why);
+    why = "the Secret Service: " + why;
   }
-  store.setValue(kPassphraseCommandKey, passphraseCommand ? Value(*passphraseCommand) : Value(),
-                 kVantorDefaultsKey, Scope::AnyHost);
+  wipe(text);
+  if (!stored)
+    throw SyncFailure(FailureKind::Other, "The account's key could not be stored (" + why + ").");
+  auto& store = PreferenceStore::shared();
   store.setValue(kEncryptedAccountKey, Value(true), kVantorDefaultsKey, Scope::AnyHost);
   store.synchronize(kVantorDefaultsKey, Scope::AnyHost);
 }
 
 void forgetAccountKey() {
+  ::unlink(keyFilePath().c_str());
   auto& store = PreferenceStore::shared();
-  store.setValue(kPassphraseCommandKey, Value(), kVantorDefaultsKey, Scope::AnyHost);
   store.setValue(kEncryptedAccountKey, Value(), kVantorDefaultsKey, Scope::AnyHost);
   store.synchronize(kVantorDefaultsKey, Scope::AnyHost);
 }
@@ -117,44 +132,28 @@ bool accountEncrypted() {
   return v.kind() == Value::Kind::Boolean && v.boolean();
 }
 
-std::shared_ptr<const sealing::AccountSeal> accountSeal(NubiloRemoteSession& session,
-                                                        const std::string& member) {
+std::shared_ptr<const sealing::AccountSeal> accountSeal(const std::string& member) {
   if (!accountEncrypted()) return nullptr;
   const SecretHold holding;
-  const Value command = perUser(kPassphraseCommandKey);
-  if (command.isString() && !command.string().empty()) {
-    std::string passphrase = passphraseFromCommand(command.string());
-    std::optional<Dictionary> record = readKeyRecord(session);
-    if (!record) {
-      wipe(passphrase);
-      throw SyncFailure(FailureKind::Login,
-                        "The share holds no key for this encrypted account; nothing is sent "
-                        "until it does (was the sync area replaced?).");
-    }
-    try {
-      sealing::SecretKey key = unwrapWithPassphrase(*record, passphrase);
-      wipe(passphrase);
-      return std::make_shared<const sealing::AccountSeal>(std::move(key));
-    } catch (const SyncFailure& e) {
-      wipe(passphrase);
-      if (e.kind() != FailureKind::Login) throw;
-      throw SyncFailure(FailureKind::Login,
-                        "The passphrase that the passphrase command prints does not open this "
-                        "account's key; if it was changed on another computer, change the "
-                        "command to print the new one.");
-    }
-  }
   std::string why;
-  std::optional<std::string> text = secrets::findGenericPassword(kKeyService, member, &why);
+  std::optional<std::string> text;
+  if (passwordCommandStored()) {
+    std::ifstream in(keyFilePath());
+    std::string line;
+    if (std::getline(in, line)) text = std::move(line);
+    why = "no key file " + keyFilePath();
+  } else {
+    text = secrets::findGenericPassword(kKeyService, member, &why);
+    why = "not in the Secret Service: " + why;
+  }
   std::optional<sealing::SecretKey> key;
   if (text) key = sealing::SecretKey::fromText(*text);
   if (text) wipe(*text);
   if (!key)
-    throw SyncFailure(FailureKind::Login,
-                      "This account is encrypted and its key is not in the Secret Service" +
-                          (why.empty() ? std::string() : " (" + why + ")") +
-                          "; run `nubilosyncclient setup " + storedServerURL() + " --user " +
-                          member + "` again to give the passphrase.");
+    throw SyncFailure(FailureKind::Login, "This account is encrypted and its key is missing (" +
+                                              why + "); run `nubilosyncclient setup " +
+                                              storedServerURL() + " --user " + member +
+                                              "` again to give the passphrase.");
   return std::make_shared<const sealing::AccountSeal>(std::move(*key));
 }
 

@@ -60,7 +60,7 @@ std::map<std::string, Dictionary> readReports(NubiloRemoteSession& session) {
 void askTheShare(StatusReport& status) {
   const auto [member, password] = storedCredentials();
   auto session = openSession(member, password, VTCPrefsCenter::defaultCenter().configuration());
-  session->setAccountSeal(accountSeal(*session, member));
+  session->setAccountSeal(accountSeal(member));
   const ServerView view = ServerView::read(*session);
   const Dictionary own = session->getClientInfo();
   for (DataclassStatus& d : status.dataclasses) {

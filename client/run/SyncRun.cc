@@ -98,7 +98,7 @@ RunResult runSync(const RunRequest& request) {
     if (auto warning = network::passwordInClearWarning(member, server.host, server.url(), "HTTP"))
       result.warnings.push_back(*warning);
   auto session = openSession(member, password, prefs.configuration());
-  session->setAccountSeal(accountSeal(*session, member));
+  session->setAccountSeal(accountSeal(member));
   HeldLocks locks(*session);
   if (!request.dryRun) locks.releaseLeftovers();
   auto engine =

@@ -92,8 +92,11 @@ void openSealed(const vtc::sealing::AccountSeal& seal, const Download& download,
     result.refusedChangeLogs[download.index] = vtc::RefusedChangeLog{e.what(), creator};
     return;
   }
-  // Opened in memory: the plain changelog never reaches a file.
-  result.changeLogs[download.index] = std::make_unique<NubiloChangeLog>(plain);
+  // A large one is mapped like any other (the temporary file goes with it).
+  if (plain.size() < kMappingThreshold)
+    result.changeLogs[download.index] = std::make_unique<NubiloChangeLog>(plain);
+  else
+    result.changeLogs[download.index] = std::make_unique<NubiloMappedChangelog>(plain);
   sodium_memzero(plain.data(), plain.size());
 }
 
