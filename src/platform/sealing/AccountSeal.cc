@@ -2,6 +2,10 @@
 
 #include <sodium.h>
 
+#include <algorithm>
+#include <istream>
+#include <ostream>
+#include <sstream>
 #include <stdexcept>
 
 #include "changelog/ChangeLogEnvelope.h"
@@ -15,6 +19,11 @@ constexpr size_t kNonce = crypto_aead_xchacha20poly1305_ietf_NPUBBYTES;
 constexpr size_t kTag = crypto_aead_xchacha20poly1305_ietf_ABYTES;
 constexpr char kSubkeyContext[crypto_kdf_CONTEXTBYTES + 1] = "nubiloac";
 constexpr uint64_t kNonceSubkey = 1;
+// A changelog is sealed in pieces of this many bytes, each with its tag.
+constexpr size_t kPiece = 64 * 1024;
+constexpr size_t kStreamTag = crypto_secretstream_xchacha20poly1305_ABYTES;
+// The envelope's index and headers fit in this many bytes.
+constexpr size_t kLargestEnvelope = 4096;
 
 const uint8_t* bytesOf(const std::string& text) {
   return reinterpret_cast<const uint8_t*>(text.data());
@@ -67,33 +76,100 @@ std::optional<Bytes> AccountSeal::open(ByteView sealed, const std::string& purpo
   return plain;
 }
 
-Bytes AccountSeal::sealChangeLog(ByteView changelog, const std::string& dataclass, int64_t index,
-                                 const Dictionary& envelopeHeaders) const {
+void AccountSeal::sealChangeLog(std::istream& changelog, uint64_t size, std::ostream& out,
+                                const std::string& dataclass, int64_t index,
+                                const Dictionary& envelopeHeaders) const {
   Dictionary headers = envelopeHeaders;
   headers.set(clog::kBodyEncryptionHeader, Value(kChangeLogEncryption));
   // The envelope is authenticated with the body: it is read before the key
   // opens anything, but changed it fails like the body.
-  Bytes out = clog::envelopeHead(std::move(headers));
-  const Bytes body = seal(changelog, changeLogPlace(dataclass, index, out));
-  out.insert(out.end(), body.begin(), body.end());
-  return out;
+  const Bytes head = clog::envelopeHead(std::move(headers));
+  const std::string place = changeLogPlace(dataclass, index, head);
+  crypto_secretstream_xchacha20poly1305_state state;
+  uint8_t streamHeader[crypto_secretstream_xchacha20poly1305_HEADERBYTES];
+  ::crypto_secretstream_xchacha20poly1305_init_push(&state, streamHeader, key_.data());
+  out.write(reinterpret_cast<const char*>(head.data()), static_cast<std::streamsize>(head.size()));
+  out.write(reinterpret_cast<const char*>(streamHeader), sizeof streamHeader);
+  Bytes piece(kPiece), sealed(kPiece + kStreamTag);
+  uint64_t left = size;
+  do {
+    const size_t n = static_cast<size_t>(std::min<uint64_t>(left, kPiece));
+    if (!changelog.read(reinterpret_cast<char*>(piece.data()), static_cast<std::streamsize>(n)))
+      throw std::runtime_error("the changelog to seal could not be read");
+    left -= n;
+    unsigned long long written = 0;
+    ::crypto_secretstream_xchacha20poly1305_push(
+        &state, sealed.data(), &written, piece.data(), n, bytesOf(place), place.size(),
+        left == 0 ? crypto_secretstream_xchacha20poly1305_TAG_FINAL : 0);
+    out.write(reinterpret_cast<const char*>(sealed.data()), static_cast<std::streamsize>(written));
+  } while (left > 0);
+  sodium_memzero(piece.data(), piece.size());
+  if (!out) throw std::runtime_error("the sealed changelog could not be written");
 }
 
-Bytes AccountSeal::openChangeLog(ByteView stored, const std::string& dataclass,
-                                 int64_t index) const {
-  const std::optional<clog::Envelope> envelope = clog::readEnvelope(stored);
+void AccountSeal::openChangeLog(std::istream& stored, std::ostream& out,
+                                const std::string& dataclass, int64_t index) const {
+  // The envelope is small: it is found in the first bytes.
+  Bytes prefix(kLargestEnvelope);
+  stored.read(reinterpret_cast<char*>(prefix.data()), static_cast<std::streamsize>(prefix.size()));
+  prefix.resize(static_cast<size_t>(stored.gcount()));
+  stored.clear();
+  const std::optional<clog::Envelope> envelope = clog::readEnvelope(prefix);
   if (!envelope)
     throw std::runtime_error("it is not encrypted, and this account encrypts every changelog");
   const std::string& kind = envelope->headers.get(clog::kBodyEncryptionHeader).string();
   if (kind != kChangeLogEncryption)
     throw std::runtime_error("it is encrypted in a way this program does not know (" + kind + ")");
-  const ByteView head = stored.first(stored.size() - envelope->body.size());
-  std::optional<Bytes> plain = open(envelope->body, changeLogPlace(dataclass, index, head));
-  if (!plain)
-    throw std::runtime_error(
-        "it failed authentication: it was changed, cut or moved on the share, or written "
-        "with another key");
-  return std::move(*plain);
+  const size_t headSize = prefix.size() - envelope->body.size();
+  const std::string place = changeLogPlace(dataclass, index, ByteView(prefix).first(headSize));
+  const char* const failed =
+      "it failed authentication: it was changed, cut or moved on the share, or written with "
+      "another key";
+  stored.seekg(static_cast<std::streamoff>(headSize));
+  uint8_t streamHeader[crypto_secretstream_xchacha20poly1305_HEADERBYTES];
+  crypto_secretstream_xchacha20poly1305_state state;
+  if (!stored.read(reinterpret_cast<char*>(streamHeader), sizeof streamHeader) ||
+      ::crypto_secretstream_xchacha20poly1305_init_pull(&state, streamHeader, key_.data()) != 0)
+    throw std::runtime_error(failed);
+  Bytes sealed(kPiece + kStreamTag), piece(kPiece);
+  for (;;) {
+    stored.read(reinterpret_cast<char*>(sealed.data()), static_cast<std::streamsize>(sealed.size()));
+    const size_t n = static_cast<size_t>(stored.gcount());
+    unsigned long long opened = 0;
+    unsigned char tag = 0;
+    if (n < kStreamTag ||
+        ::crypto_secretstream_xchacha20poly1305_pull(&state, piece.data(), &opened, &tag,
+                                                     sealed.data(), n, bytesOf(place),
+                                                     place.size()) != 0)
+      throw std::runtime_error(failed);
+    out.write(reinterpret_cast<const char*>(piece.data()), static_cast<std::streamsize>(opened));
+    if (tag == crypto_secretstream_xchacha20poly1305_TAG_FINAL) {
+      // Nothing may follow the last piece.
+      if (stored.peek() != std::char_traits<char>::eof()) throw std::runtime_error(failed);
+      break;
+    }
+    if (n < sealed.size()) throw std::runtime_error(failed);  // cut short
+  }
+  sodium_memzero(piece.data(), piece.size());
+  if (!out) throw std::runtime_error("the opened changelog could not be written");
+}
+
+Bytes AccountSeal::sealChangeLog(ByteView changelog, const std::string& dataclass, int64_t index,
+                                 const Dictionary& envelopeHeaders) const {
+  std::istringstream in(std::string(changelog.begin(), changelog.end()));
+  std::ostringstream out;
+  sealChangeLog(in, changelog.size(), out, dataclass, index, envelopeHeaders);
+  const std::string text = out.str();
+  return Bytes(text.begin(), text.end());
+}
+
+Bytes AccountSeal::openChangeLog(ByteView stored, const std::string& dataclass,
+                                 int64_t index) const {
+  std::istringstream in(std::string(stored.begin(), stored.end()));
+  std::ostringstream out;
+  openChangeLog(in, out, dataclass, index);
+  const std::string text = out.str();
+  return Bytes(text.begin(), text.end());
 }
 
 std::string AccountSeal::sealText(const std::string& text, const std::string& purpose) const {

@@ -1,12 +1,14 @@
 // What an encrypted account's key does to the bytes the share holds:
 // changelogs (inside their envelope), reports, and short texts such as a
-// computer's name. Everything is XChaCha20-Poly1305 with associated data
-// naming what the bytes are and where they belong, so bytes moved from one
-// place to another fail authentication like bytes changed. Thread-safe:
-// a seal does not change once made.
+// computer's name. Everything is XChaCha20-Poly1305 (a changelog as a
+// secretstream of 64 KiB pieces, so memory follows one piece) with
+// associated data naming what the bytes are and where they belong, so bytes
+// moved from one place to another fail authentication like bytes changed.
+// Thread-safe: a seal does not change once made.
 #pragma once
 
 #include <cstdint>
+#include <iosfwd>
 #include <optional>
 #include <string>
 
@@ -28,13 +30,22 @@ class AccountSeal {
  public:
   explicit AccountSeal(SecretKey key);
 
-  // The bytes the share holds for changelog (the ordinary format) at index
-  // of dataclass: an envelope whose headers are envelopeHeaders (nothing
-  // personal) around the sealed changelog.
+  // Writes to out what the share holds for the changelog (the ordinary
+  // format, size bytes read from changelog) at index of dataclass: an
+  // envelope whose headers are envelopeHeaders (nothing personal) around
+  // the sealed changelog. Raises std::runtime_error when a stream fails.
+  void sealChangeLog(std::istream& changelog, uint64_t size, std::ostream& out,
+                     const std::string& dataclass, int64_t index,
+                     const Dictionary& envelopeHeaders) const;
+  // Writes the changelog inside stored (a seekable stream) to out. Raises
+  // std::runtime_error with the reason when stored is no envelope of this
+  // account's or fails authentication; out then holds a part of it at most,
+  // which the caller throws away.
+  void openChangeLog(std::istream& stored, std::ostream& out, const std::string& dataclass,
+                     int64_t index) const;
+  // The same in memory.
   Bytes sealChangeLog(ByteView changelog, const std::string& dataclass, int64_t index,
                       const Dictionary& envelopeHeaders) const;
-  // The changelog inside stored. Raises std::runtime_error with the reason
-  // when stored is no envelope of this account's or fails authentication.
   Bytes openChangeLog(ByteView stored, const std::string& dataclass, int64_t index) const;
 
   // Any bytes, for one purpose ("report", say): nonce and ciphertext.
