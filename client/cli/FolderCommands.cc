@@ -15,6 +15,8 @@ int addCommand(const std::string& kindWordGiven, const std::string& folder,
   if (!kind)
     throw SyncFailure(FailureKind::Usage,
                       "\"" + kindWordGiven + "\" is no kind of folder; use contacts or calendars.");
+  // Before anything is made: the name becomes paths on the share and here.
+  if (dataclass) requirePlainDataclassName(*dataclass);
   std::error_code error;
   std::filesystem::path path = std::filesystem::absolute(folder, error);
   if (error) throw SyncFailure(FailureKind::Usage, "\"" + folder + "\" is not a usable path.");

@@ -11,8 +11,8 @@
 #include <fstream>
 #include <iterator>
 #include <mutex>
+#include <optional>
 
-#include <sodium.h>
 #include "VantorSyncManager/NubiloDataAdditions.h"
 #include "VantorSyncManager/NubiloException.h"
 #include "VantorSyncManager/NubiloRemoteSession.h"
@@ -65,39 +65,44 @@ vtc::Bytes readWhole(const std::string& path) {
   std::ifstream in(path, std::ios::binary);
   return vtc::Bytes(std::istreambuf_iterator<char>(in), std::istreambuf_iterator<char>());
 }
-// Whether the file begins as a changelog without records (an envelope, or
-// an empty changelog).
-bool startsLikeEnvelope(const std::string& path) {
+// The envelope's headers when the file is an encrypted account's changelog
+// (read from its first bytes only).
+std::optional<vtc::Dictionary> envelopeHeadersOf(const std::string& path) {
   std::ifstream in(path, std::ios::binary);
-  uint8_t head[12] = {};
-  if (!in.read(reinterpret_cast<char*>(head), sizeof head)) return false;
-  return NubiloUInt32AtOffset(vtc::ByteView(head, sizeof head), 4) == 12 &&
-         NubiloUInt32AtOffset(vtc::ByteView(head, sizeof head), 8) == 0xFFFFFFFF;
+  vtc::Bytes head(4096);
+  in.read(reinterpret_cast<char*>(head.data()), static_cast<std::streamsize>(head.size()));
+  head.resize(static_cast<size_t>(in.gcount()));
+  auto envelope = vtc::clog::readEnvelope(head);
+  if (!envelope) return std::nullopt;
+  return std::move(envelope->headers);
 }
 
 // Opens one downloaded changelog of an encrypted account into result, or
-// refuses it there.
+// refuses it there. It is opened from file to file, a piece at a time.
 void openSealed(const vtc::sealing::AccountSeal& seal, const Download& download,
                 const std::string& dataclass, vtc::ChangeLogFetchResult& result) {
-  const vtc::Bytes stored = readWhole(download.file);
-  vtc::Bytes plain;
+  Download plain(download.index, downloadFile());
   try {
-    plain = seal.openChangeLog(stored, dataclass, download.index);
+    std::ifstream stored(download.file, std::ios::binary);
+    std::ofstream out(plain.file, std::ios::binary | std::ios::trunc);
+    seal.openChangeLog(stored, out, dataclass, download.index);
+    out.close();
+    if (!out) throw std::runtime_error("it could not be written whole here");
   } catch (const std::runtime_error& e) {
     // Never applied, never a stop: the caller names it and goes on.
     std::string creator;
-    if (auto envelope = vtc::clog::readEnvelope(stored))
-      creator = envelope->headers.get("CreatorClientGuid").string();
+    if (auto headers = envelopeHeadersOf(download.file))
+      creator = headers->get("CreatorClientGuid").string();
     VTC_LOG_WARNING("Changelog %d of %@ is set aside: %@", download.index, dataclass, e.what());
     result.refusedChangeLogs[download.index] = vtc::RefusedChangeLog{e.what(), creator};
     return;
   }
-  // A large one is mapped like any other (the temporary file goes with it).
-  if (plain.size() < kMappingThreshold)
-    result.changeLogs[download.index] = std::make_unique<NubiloChangeLog>(plain);
+  // Read like a plain changelog of its size (the files go with the
+  // changelog or the download).
+  if (fileSize(plain.file) < kMappingThreshold)
+    result.changeLogs[download.index] = std::make_unique<NubiloChangeLog>(readWhole(plain.file));
   else
-    result.changeLogs[download.index] = std::make_unique<NubiloMappedChangelog>(plain);
-  sodium_memzero(plain.data(), plain.size());
+    result.changeLogs[download.index] = NubiloMappedChangelog::adoptingFile(plain.release());
 }
 
 }  // namespace
@@ -159,7 +164,9 @@ vtc::ChangeLogFetchResult NubiloRemoteSession::fetchChangeLogsForDataclass(
       }
       // An encrypted account's changelog read without its key would be a
       // changelog without changes: it is refused instead.
-      if (startsLikeEnvelope(download.file) && vtc::clog::readEnvelope(readWhole(download.file))) {
+      if (envelopeHeadersOf(download.file)) {
+        VTC_LOG_WARNING("Changelog %d of %@ is encrypted and this session has no key",
+                        download.index, dataclass);
         result.refusedChangeLogs[download.index] = vtc::RefusedChangeLog{
             "it is encrypted, and this computer has not the account's key", ""};
         continue;

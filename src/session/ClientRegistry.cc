@@ -14,6 +14,7 @@
 #include "platform/dav/TesselSession.h"
 #include "platform/sealing/AccountSeal.h"
 #include "prefs/SyncEngineSettings.h"
+#include "session/DataclassName.h"
 
 namespace {
 
@@ -198,12 +199,14 @@ bool NubiloRemoteSession::patchClientInfo(const vtc::Dictionary& properties) {
 
 void NubiloRemoteSession::setStatus(const std::string& status, const std::string& guid,
                                     const std::string& dataclass) {
+  vtc::requirePlainDataclassName(dataclass);  // it names properties
   _dataclassesMet.insert(dataclass);
   setInfoForClient(vtc::Dictionary{{dataclass + ".status", status}}, guid);
 }
 
 void NubiloRemoteSession::setOtherClientStatus(const std::string& status,
                                                const std::string& dataclass) {
+  vtc::requirePlainDataclassName(dataclass);
   _dataclassesMet.insert(dataclass);
   relockClients();
   DavTransaction listing = _TesselSession->listCollectionAtPath(_clientsPath);

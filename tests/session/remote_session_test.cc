@@ -330,7 +330,8 @@ TEST_P(Locking, ALockThatExpiredIsTakenAgainAndOnlyAMissingTargetIsNotFound) {
   session->tesselSession().deleteResourceAtPath(client);
   EXPECT_THAT([&] { session->lockClient(); }, ThrowsFailure(NubiloClientRegistrationException));
   // A missing parent is as missing as the target, with no waiting.
-  EXPECT_THAT([&] { session->lockDataclass("Missing/Inner"); },
+  std::filesystem::remove_all(share.diskPath(schemas));
+  EXPECT_THAT([&] { session->lockDataclass("Inner"); },
               ThrowsFailure(NubiloResourceNotFoundException));
   EXPECT_TRUE(time.sleeps().empty());
 }
@@ -626,6 +627,32 @@ TEST_F(RegistryEdges, EntityTagsCompareWithoutTheWeakPrefix) {
   EXPECT_FALSE(session->eTagChangedForDataclass("Contacts", "W/" + bare));
   EXPECT_TRUE(session->eTagChangedForDataclass("Contacts", "\"something-else\""));
   EXPECT_TRUE(session->eTagChangedForDataclass("Unknown", "eTagNotFound"));  // find failed
+}
+
+// A dataclass name names one collection below the schemas, never another
+// place: a name that could reach elsewhere, or that is no plain name, is
+// refused before any request, and a member of the schemas collection that
+// names no dataclass is left out of the listing.
+TEST_F(RegistryEdges, ANameThatIsNoPlainDataclassNameReachesNothing) {
+  const size_t sent = proxy.requests().size();
+  const std::vector<SyncEngineChange> changes{
+      SyncEngineChange(SyncEngineChange::kAdd, "r1", vtc::Array{})};
+  for (const std::string& bad :
+       std::vector<std::string>{"../../evil", "a/b", "..", ".hidden", "", "tab\tname", "x..y",
+                                "caf\xc3\xa9", std::string(101, 'a')}) {
+    EXPECT_THROW(session->getDataclassInfo(bad), std::invalid_argument) << bad;
+    EXPECT_THROW(session->lockDataclass(bad), std::invalid_argument) << bad;
+    EXPECT_THROW(session->commitChanges(changes, bad, 1, false), std::invalid_argument) << bad;
+    EXPECT_THROW(session->setStatus("normal", "GUID-A", bad), std::invalid_argument) << bad;
+    EXPECT_THROW(session->downloadChangeLogsForDataclass(bad, home.path()), std::invalid_argument)
+        << bad;
+  }
+  EXPECT_EQ(proxy.requests().size(), sent);
+  EXPECT_NO_THROW(session->changeLogPathForDataclass("com.korvo.Contacts-2_b", 1));
+
+  session->getDataclassInfo("Contacts");
+  std::filesystem::create_directories(share.diskPath(schemas + "/not plain"));
+  EXPECT_EQ(session->dataclassNames(), std::vector<std::string>{"Contacts"});
 }
 
 }  // namespace
