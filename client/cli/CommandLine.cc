@@ -85,6 +85,18 @@ int runCommandLine(int argc, char** argv) {
   setupCommandLine->add_flag("--allow-insecure", setup.allowInsecure,
                              "Send the password over plain http:// or mqtt:// (readable on the "
                              "way)");
+  setupCommandLine->add_flag("--encrypt", setup.encrypt,
+                             "Encrypt a new account's data: the share holds only ciphertext");
+  std::string passphraseCommandLine;
+  setupCommandLine->add_option("--passphrase-command", passphraseCommandLine,
+                               "A command whose first output line is the encryption passphrase");
+  auto* encrypt = app.add_subcommand(
+      "encrypt", "Turn the account's data in the clear over to encryption (one compaction)");
+  std::string encryptPassphraseCommand;
+  encrypt->add_option("--passphrase-command", encryptPassphraseCommand,
+                      "A command whose first output line is the new passphrase");
+  auto* passphrase = app.add_subcommand(
+      "passphrase", "Change the passphrase of an encrypted account (the data stays as it is)");
 
   std::string kind, folder, dataclass;
   auto* add = app.add_subcommand("add", "Sync a vdir folder of contacts or calendars");
@@ -163,6 +175,7 @@ int runCommandLine(int argc, char** argv) {
     if (*setupCommandLine) {
       if (!passwordCommand.empty()) setup.passwordCommand = passwordCommand;
       if (!pushServer.empty()) setup.pushServer = pushServer;
+      if (!passphraseCommandLine.empty()) setup.passphraseCommand = passphraseCommandLine;
       return setupCommand(setup, output);
     }
     if (*add)
@@ -187,6 +200,12 @@ int runCommandLine(int argc, char** argv) {
                                                : "",
                               conflictId, output);
     if (*status) return statusCommand(statusJson, output);
+    if (*passphrase) return passphraseCommand(output);
+    if (*encrypt)
+      return encryptCommand(encryptPassphraseCommand.empty()
+                                ? std::nullopt
+                                : std::optional<std::string>(encryptPassphraseCommand),
+                            output);
     if (*schedule)
       return scheduleCommand(scheduleSwitch == "on",
                              every.empty() ? std::nullopt : std::optional<std::string>(every),

@@ -27,7 +27,20 @@ struct SetupRequest {
   std::optional<std::string> pushServer;  // mqtt[s]://host[:port], stored once setup succeeds
   bool allowInsecure = false;             // the password may cross plain http:// or mqtt://
   bool newArea = false;  // start a new sync area where none was expected, without asking
+  // A new account's data is encrypted (a joining computer follows the
+  // share: an area with a key record is encrypted).
+  bool encrypt = false;
+  // Prints the passphrase (else it is read like the password); used at
+  // setup only.
+  std::optional<std::string> passphraseCommand;
 };
+
+// `passphrase`: rewraps the account key with a new passphrase; the data
+// stays as it is.
+int passphraseCommand(Output& output);
+// `encrypt`: turns this computer's account in the clear over to encryption
+// with one compaction of each dataclass.
+int encryptCommand(const std::optional<std::string>& passphraseCommand, Output& output);
 
 int setupCommand(const SetupRequest& request, Output& output);
 int addCommand(const std::string& kind, const std::string& folder,

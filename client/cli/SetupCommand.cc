@@ -17,15 +17,18 @@
 #include "client/cli/StatusText.h"
 #include "client/cli/Terminal.h"
 #include "client/run/Account.h"
+#include "client/run/AccountKey.h"
 #include "client/run/Automation.h"
 #include "client/run/ServerQualification.h"
 #include "client/run/SyncAreaFinding.h"
 #include "client/run/SyncFailure.h"
 #include "common/Clock.h"
 #include "common/Format.h"
+#include "common/SecretMemory.h"
 #include "common/Uuid.h"
 #include "platform/dav/DavPaths.h"
 #include "platform/dav/TesselSession.h"
+#include "platform/sealing/KeyRecord.h"
 #include "prefs/ClientConfiguration.h"
 
 namespace vtc::client {
@@ -70,11 +73,50 @@ std::string readSetupPassword(const SetupRequest& request, const ServerAddress& 
   return *typed;
 }
 
-// "Mac A, Mac B"
+// "Mac A, Mac B"; an encrypted account's names cannot be read before its
+// key is open.
 std::string names(const std::vector<AreaComputer>& computers) {
   std::string out;
-  for (const AreaComputer& c : computers) out += (out.empty() ? "" : ", ") + c.name;
+  for (const AreaComputer& c : computers)
+    out += (out.empty() ? "" : ", ") +
+           (sealing::isSealedText(c.name) ? std::string("name encrypted") : c.name);
   return out;
+}
+
+// An encrypted account's key, opened (or for a new account made) before
+// anything is stored, so that a wrong passphrase changes nothing. record:
+// the new account's key record to store on the share, when made here.
+std::optional<sealing::SecretKey> openAccountKey(const SetupRequest& request,
+                                                 NubiloRemoteSession& session,
+                                                 const SyncAreaFinding& found,
+                                                 std::optional<Dictionary>& record) {
+  std::optional<Dictionary> existing;
+  if (found.kind == SyncAreaFinding::Kind::SyncArea) existing = readKeyRecord(session);
+  if (existing) {
+    std::string passphrase = readPassphrase(request.passphraseCommand, false);
+    try {
+      sealing::SecretKey key = unwrapWithPassphrase(*existing, passphrase);
+      wipe(passphrase);
+      return key;
+    } catch (...) {
+      wipe(passphrase);
+      throw;
+    }
+  }
+  if (!request.encrypt) return std::nullopt;
+  if (found.kind == SyncAreaFinding::Kind::SyncArea) {
+    const Array dataclasses = session.getAllDataclassInfo();
+    for (const Value& d : dataclasses)
+      if (d.dictionary().contains("maxversion"))
+        throw SyncFailure(FailureKind::Usage,
+                          "The sync area already holds data that is not encrypted; --encrypt "
+                          "starts a new account only (in a new, empty sync area).");
+  }
+  std::string passphrase = readPassphrase(request.passphraseCommand, true);
+  sealing::SecretKey key = sealing::SecretKey::random();
+  record = sealing::wrapKey(key, passphrase);
+  wipe(passphrase);
+  return key;
 }
 
 // What setup found, in one sentence, before it changes anything. area and
@@ -185,6 +227,17 @@ int setupCommand(const SetupRequest& request, Output& output) {
   auto session = openSession(request.member, password, configuration);
   const SyncAreaFinding found = findSyncArea(*session, guid);
   sayWhatWasFound(request, found, server, *session, output);
+  // An encrypted account's key is open before the checks, so that even
+  // their lock owners carry this computer's name sealed.
+  const SecretHold holdingKey;
+  std::optional<Dictionary> newKeyRecord;
+  std::optional<sealing::SecretKey> accountKey =
+      openAccountKey(request, *session, found, newKeyRecord);
+  std::shared_ptr<const sealing::AccountSeal> seal;
+  if (accountKey)
+    seal = std::make_shared<const sealing::AccountSeal>(
+        sealing::SecretKey::fromBytes(ByteView(accountKey->data(), sealing::SecretKey::kSize)));
+  session->setAccountSeal(seal);
   // The second client of the checks: another computer as far as the share
   // can tell.
   Dictionary otherConfiguration = configuration;
@@ -198,8 +251,13 @@ int setupCommand(const SetupRequest& request, Output& output) {
                                  ? davpath::collection(session->shareRoot())
                                  : session->syncPath();
   qualifyServer(
-      *session, [&] { return openSession(request.member, password, otherConfiguration); }, folder,
-      server.url());
+      *session,
+      [&] {
+        auto other = openSession(request.member, password, otherConfiguration);
+        other->setAccountSeal(seal);
+        return other;
+      },
+      folder, server.url());
 
   // Later sessions trust this certificate alone: one that changes is refused.
   AccountSetup setup{server,
@@ -213,6 +271,13 @@ int setupCommand(const SetupRequest& request, Output& output) {
   // Every check passed and the password is kept: the share changes now.
   configuration.erase("create_sync_paths");
   session = openSession(request.member, password, configuration);
+  session->setAccountSeal(seal);
+  if (accountKey) {
+    if (newKeyRecord) writeKeyRecord(*session, *newKeyRecord);
+    storeAccountKey(request.member, *accountKey, request.passwordCommand.has_value());
+  } else {
+    forgetAccountKey();
+  }
   const Dictionary registered = registerComputer(*session, guid, name, server.url());
   // For the other computers' status: since when this one syncs, and which
   // report on the share is its own.
@@ -220,6 +285,8 @@ int setupCommand(const SetupRequest& request, Output& output) {
   if (!registered.contains("firstsync"))
     record.set("firstsync", Value(textOf(Value(currentClock().now()))));
   if (auto machine = getHostUUIDString()) record.set("machineguid", Value(*machine));
+  // A computer registered before the account was encrypted: its name too.
+  if (seal) record.set("clientname", Value(seal->sealText(name, sealing::kClientNamePurpose)));
   session->patchClientInfo(record);
   storeAccount(setup, guid, name);
   if (push) storePushServer(*push);

@@ -6,6 +6,10 @@
 #include <cstdio>
 #include <iostream>
 
+#include "client/run/AccountKey.h"
+#include "client/run/SyncFailure.h"
+#include "common/SecretMemory.h"
+
 namespace vtc::client {
 
 std::optional<std::string> readPassword(const std::string& prompt) {
@@ -28,6 +32,23 @@ std::optional<std::string> readPassword(const std::string& prompt) {
   if (!read) return std::nullopt;
   if (!line.empty() && line.back() == '\r') line.pop_back();
   return line;
+}
+
+std::string readPassphrase(const std::optional<std::string>& command, bool fresh) {
+  if (command) return passphraseFromCommand(*command);
+  auto typed = readPassword(fresh ? "New passphrase for the account's encryption: "
+                                  : "Passphrase of the account's encryption: ");
+  if (!typed || typed->empty()) throw SyncFailure(FailureKind::Usage, "No passphrase was given.");
+  if (fresh) {
+    auto again = readPassword("The same passphrase again: ");
+    const bool same = again && *again == *typed;
+    if (again) wipe(*again);
+    if (!same) {
+      wipe(*typed);
+      throw SyncFailure(FailureKind::Usage, "The two passphrases differ; nothing was changed.");
+    }
+  }
+  return *typed;
 }
 
 bool confirm(const std::string& question) {

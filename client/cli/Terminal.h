@@ -12,6 +12,12 @@ namespace vtc::client {
 // nothing could be read.
 std::optional<std::string> readPassword(const std::string& prompt);
 
+// An encrypted account's passphrase: the first line the command prints, or
+// else read as a password; a new one (fresh) is asked twice. Raises
+// SyncFailure when none is given or the two differ. The caller holds it
+// undumpable and wipes it after use.
+std::string readPassphrase(const std::optional<std::string>& command, bool fresh);
+
 // Asks on standard error and reads the answer from standard input (a
 // terminal): true for an answer that begins with "y" or "Y".
 bool confirm(const std::string& question);

@@ -267,6 +267,12 @@ std::pair<std::string, std::string> storedCredentials() {
   return {*member, *password};
 }
 
+bool passwordCommandStored() {
+  const Value command =
+      PreferenceStore::shared().copyAppValue(kPasswordCommandKey, kVantorDefaultsKey);
+  return command.isString() && !command.string().empty();
+}
+
 std::string storedServerURL() {
   ServerAddress a;
   a.scheme = perUser("host_scheme").string();

@@ -89,6 +89,9 @@ void storeAccount(const AccountSetup& setup, const std::string& clientGuid,
 // sentence saying how to set the account up.
 std::pair<std::string, std::string> storedCredentials();
 
+// Whether this computer reads its password from a command.
+bool passwordCommandStored();
+
 // The server's address as stored, for messages.
 std::string storedServerURL();
 

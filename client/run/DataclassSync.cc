@@ -394,6 +394,7 @@ DataclassSync::Incoming DataclassSync::fetch(bool slow, const DataclassRecord& r
           session_.fetchChangeLogsForDataclass(dataclass, start, std::min(to, start + kPiece - 1));
       fetched.StorageConsumed += piece.StorageConsumed;
       for (auto& [index, log] : piece.changeLogs) fetched.changeLogs[index] = std::move(log);
+      fetched.refusedChangeLogs.merge(piece.refusedChangeLogs);
     }
   } catch (const NubiloException& e) {
     // A server error of the moment is tried again next time; only damage is
@@ -417,6 +418,7 @@ DataclassSync::Incoming DataclassSync::fetch(bool slow, const DataclassRecord& r
   outcome_.bytesFetched = fetched.StorageConsumed;
   in.fetched = true;
   in.state = NetworkState{to, record.minversion};
+  setAsideChangeLogs(fetched.refusedChangeLogs);
   if (fetched.changeLogs.empty()) return in;
 
   // Fast: each record the changes touch starts from the truth, or from its
@@ -473,6 +475,25 @@ DataclassSync::Incoming DataclassSync::fetch(bool slow, const DataclassRecord& r
   for (auto& [id, state] : in.folds)
     if (state.changed) ++outcome_.receivedChanges;
   return in;
+}
+
+void DataclassSync::setAsideChangeLogs(const std::map<int64_t, RefusedChangeLog>& refused) {
+  if (!refused.empty() && !session_.accountSeal())
+    throw SyncFailure(FailureKind::Login,
+                      "The account's data is encrypted now (changelog " +
+                          std::to_string(refused.begin()->first) + " of " + collection_.dataclass +
+                          " is); run `nubilosyncclient setup` again to give this computer the "
+                          "passphrase.");
+  // Nothing of them is known but who the envelope says wrote them.
+  for (const auto& [index, log] : refused) {
+    std::string origin;
+    if (!log.creatorGuid.empty()) try {
+        origin = session_.getClientInfo(log.creatorGuid).get("clientname").string();
+      } catch (const NubiloException& e) {
+        VTC_LOG_WARNING("The computer %@ could not be looked up: %@", log.creatorGuid, e);
+      }
+    refusedLogs_.push_back({"changelog " + std::to_string(index), log.reason, origin});
+  }
 }
 
 DataclassSync::Plan DataclassSync::decide(Local& local, Incoming& in,
@@ -845,6 +866,7 @@ void DataclassSync::writeFolder(const std::map<std::string, std::string>* origin
   outcome_.setAside.clear();
   for (const auto& [id, item] : engine_.setAsideRecords(collection_.dataclass))
     outcome_.setAside.push_back({item.file, item.reason, item.origin});
+  outcome_.setAside.insert(outcome_.setAside.end(), refusedLogs_.begin(), refusedLogs_.end());
 }
 
 }  // namespace vtc::client

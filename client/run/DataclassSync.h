@@ -137,6 +137,9 @@ class DataclassSync {
   void writeFolder(const std::map<std::string, std::string>* origins,
                    std::map<std::string, ItemState>* known);
   void report(const char* what, size_t done, size_t total, int64_t bytes = 0);
+  // Changelogs that did not open (an encrypted account's, changed on the
+  // share): never applied, named in this run's outcome.
+  void setAsideChangeLogs(const std::map<int64_t, RefusedChangeLog>& refused);
 
   NubiloRemoteSession& session_;
   engine::SyncEngine& engine_;
@@ -147,6 +150,7 @@ class DataclassSync {
   HeldLocks& locks_;
   std::string folderClient_;
   DataclassOutcome outcome_;
+  std::vector<SetAsideItem> refusedLogs_;
   bool locked_ = false;
 };
 

@@ -1,4 +1,5 @@
 #include "client/run/StatusReport.h"
+#include "client/run/AccountKey.h"
 
 #include <fstream>
 
@@ -43,7 +44,13 @@ std::map<std::string, Dictionary> readReports(NubiloRemoteSession& session) {
     if (!path.ends_with(".plist")) continue;
     DavTransaction got = session.tesselSession().getDataAtPath(path);
     if (!got.isSuccessful()) continue;
-    if (auto report = plist::parse(got.result().data()); report && report->isDictionary())
+    // An encrypted account's reports open with its key; one that does not
+    // is left out like one that is not a property list.
+    std::optional<Bytes> opened;
+    if (const sealing::AccountSeal* seal = session.accountSeal())
+      opened = seal->open(got.result().data(), sealing::kReportPurpose);
+    const Bytes& bytes = session.accountSeal() ? opened.value_or(Bytes{}) : got.result().data();
+    if (auto report = plist::parse(bytes); report && report->isDictionary())
       reports[davpath::lastComponent(path).substr(0, davpath::lastComponent(path).size() - 6)] =
           report->dictionary();
   }
@@ -53,6 +60,7 @@ std::map<std::string, Dictionary> readReports(NubiloRemoteSession& session) {
 void askTheShare(StatusReport& status) {
   const auto [member, password] = storedCredentials();
   auto session = openSession(member, password, VTCPrefsCenter::defaultCenter().configuration());
+  session->setAccountSeal(accountSeal(member));
   const ServerView view = ServerView::read(*session);
   const Dictionary own = session->getClientInfo();
   for (DataclassStatus& d : status.dataclasses) {

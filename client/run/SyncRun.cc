@@ -1,4 +1,5 @@
 #include "client/run/SyncRun.h"
+#include "client/run/AccountKey.h"
 
 #include <unistd.h>
 
@@ -97,6 +98,7 @@ RunResult runSync(const RunRequest& request) {
     if (auto warning = network::passwordInClearWarning(member, server.host, server.url(), "HTTP"))
       result.warnings.push_back(*warning);
   auto session = openSession(member, password, prefs.configuration());
+  session->setAccountSeal(accountSeal(member));
   HeldLocks locks(*session);
   if (!request.dryRun) locks.releaseLeftovers();
   auto engine =

@@ -24,6 +24,16 @@
 class TesselSession;
 namespace vtc {
 struct RetryTexts;
+namespace sealing {
+class AccountSeal;
+}
+
+// A changelog that was downloaded but not taken: an encrypted account's
+// changelog that failed authentication, or one not encrypted at all.
+struct RefusedChangeLog {
+  std::string reason;       // "it failed authentication: ..."
+  std::string creatorGuid;  // as its envelope names it (not authenticated)
+};
 
 // The entity tag of a dataclass record whose collection has none.
 inline constexpr const char* kNoETag = "eTagNotFound";
@@ -33,6 +43,8 @@ inline constexpr const char* kNoETag = "eTagNotFound";
 struct ChangeLogFetchResult {
   std::map<int64_t, std::unique_ptr<NubiloChangeLog>> changeLogs;
   int64_t StorageConsumed = 0;
+  // By index: changelogs downloaded and set aside, never parsed.
+  std::map<int64_t, RefusedChangeLog> refusedChangeLogs;
 };
 }  // namespace vtc
 
@@ -236,6 +248,14 @@ class VSM_EXPORT NubiloRemoteSession {
   std::string lockOwnerText() const;
   const std::optional<std::string>& respondingServer() const { return _respondingServer; }
 
+  // An encrypted account: from now on changelogs, reports, this client's
+  // name (in its record and its lock owner) and the dataclasses' truth
+  // digests are sealed on the way out and opened on the way in; a changelog
+  // that does not open is refused (ChangeLogFetchResult::refusedChangeLogs).
+  // Set before the first lock or commit.
+  void setAccountSeal(std::shared_ptr<const vtc::sealing::AccountSeal> seal);
+  const vtc::sealing::AccountSeal* accountSeal() const { return _accountSeal.get(); }
+
  protected:
   DavTransaction retrying(const vtc::RetryTexts& texts, const std::string& subject,
                           const std::function<DavTransaction()>& issue);
@@ -254,6 +274,9 @@ class VSM_EXPORT NubiloRemoteSession {
   // A client record's properties by name: its own, and the status and
   // version of each dataclass that this session has met.
   std::vector<std::string> clientRecordProperties() const;
+  // The lock owner template from the configuration's client name (sealed
+  // in an encrypted account).
+  void makeLockOwnerFormat();
 
   std::shared_ptr<MemberAccount> _vantorAccount;
   std::unique_ptr<TesselSession> _TesselSession;
@@ -275,4 +298,5 @@ class VSM_EXPORT NubiloRemoteSession {
   std::string _sessionUUID;
   std::set<std::string> _dataclassesMet;
   bool _clientRecordsByName = false;
+  std::shared_ptr<const vtc::sealing::AccountSeal> _accountSeal;
 };

@@ -6,6 +6,8 @@
 #include <unistd.h>
 
 #include <chrono>
+#include <filesystem>
+#include <fstream>
 
 #include "VantorSyncManager/NubiloException.h"
 #include "VantorSyncManager/NubiloRemoteSession.h"
@@ -18,6 +20,7 @@
 #include "platform/dav/TesselSession.h"
 #include "platform/engine/SyncEngine.h"
 #include "platform/fs/LocalPaths.h"
+#include "platform/sealing/AccountSeal.h"
 
 namespace {
 
@@ -62,9 +65,33 @@ bool NubiloRemoteSession::commitChanges(const std::vector<SyncEngineChange>& cha
     for (const SyncEngineChange& change : changes) changeLog.append(change);
     changeLog.finish(localPath);
   }
+  // An encrypted account's share sees the envelope only: who wrote it (a
+  // random id) and with which build.
+  const std::string sealedPath = localPath + ".sealed";
+  const RemoveWhenDone removeSealedWhenDone{sealedPath};
+  if (_accountSeal) {
+    std::ifstream plain(localPath, std::ios::binary);
+    std::ofstream sealed(sealedPath, std::ios::binary | std::ios::trunc);
+    std::error_code error;
+    const uint64_t size = std::filesystem::file_size(localPath, error);
+    try {
+      if (error) throw std::runtime_error(error.message());
+      _accountSeal->sealChangeLog(
+          plain, size, sealed, dataclass, index,
+          vtc::Dictionary{{"CreatorClientGuid", _configuration.get("guid")},
+                          {"CreatorClientVersion",
+                           vtc::format("%ld", static_cast<long>(VantorSyncManagerVersionNumber))}});
+      sealed.close();
+      if (!sealed) throw std::runtime_error("it could not be written whole");
+    } catch (const std::runtime_error& e) {
+      throw NubiloException(NubiloTransactionFailureException,
+                            vtc::format("The changelog could not be sealed: %@", e.what()));
+    }
+  }
   VTC_LOG_INFO("%@ Uploading changeLog with index %d", dataclass, index);
 
-  DavTransaction upload = _TesselSession->putLocalFileAtPath(localPath, temporaryPath);
+  const std::string& uploadPath = _accountSeal ? sealedPath : localPath;
+  DavTransaction upload = _TesselSession->putLocalFileAtPath(uploadPath, temporaryPath);
   if (upload.errorType() == kNBTimeoutError) {
     temporaryPath = temporaryPathFor(finalPath);
     messageTraceTransactionFailure(upload, false, 0, kUploadTrace);
@@ -72,7 +99,7 @@ bool NubiloRemoteSession::commitChanges(const std::vector<SyncEngineChange>& cha
         "%@ Upload of changeLog with index %d failed due to timeout retrying with new tmp path "
         "%@...",
         dataclass, index, temporaryPath);
-    upload = _TesselSession->putLocalFileAtPath(localPath, temporaryPath);
+    upload = _TesselSession->putLocalFileAtPath(uploadPath, temporaryPath);
   }
   if (!upload.isSuccessful()) {
     VTC_LOG_ERROR("Failed to upload change log to path %@", finalPath);

@@ -11,15 +11,19 @@
 #include <fstream>
 #include <iterator>
 #include <mutex>
+#include <optional>
 
+#include "VantorSyncManager/NubiloDataAdditions.h"
 #include "VantorSyncManager/NubiloException.h"
 #include "VantorSyncManager/NubiloRemoteSession.h"
 #include "VantorSyncManager/PublicNames.h"
+#include "changelog/ChangeLogEnvelope.h"
 #include "common/Logging.h"
 #include "common/Uuid.h"
 #include "platform/bus/DistributedNotifications.h"
 #include "platform/dav/TesselSession.h"
 #include "platform/fs/LocalPaths.h"
+#include "platform/sealing/AccountSeal.h"
 
 namespace {
 
@@ -60,6 +64,45 @@ uint64_t fileSize(const std::string& path) {
 vtc::Bytes readWhole(const std::string& path) {
   std::ifstream in(path, std::ios::binary);
   return vtc::Bytes(std::istreambuf_iterator<char>(in), std::istreambuf_iterator<char>());
+}
+// The envelope's headers when the file is an encrypted account's changelog
+// (read from its first bytes only).
+std::optional<vtc::Dictionary> envelopeHeadersOf(const std::string& path) {
+  std::ifstream in(path, std::ios::binary);
+  vtc::Bytes head(4096);
+  in.read(reinterpret_cast<char*>(head.data()), static_cast<std::streamsize>(head.size()));
+  head.resize(static_cast<size_t>(in.gcount()));
+  auto envelope = vtc::clog::readEnvelope(head);
+  if (!envelope) return std::nullopt;
+  return std::move(envelope->headers);
+}
+
+// Opens one downloaded changelog of an encrypted account into result, or
+// refuses it there. It is opened from file to file, a piece at a time.
+void openSealed(const vtc::sealing::AccountSeal& seal, const Download& download,
+                const std::string& dataclass, vtc::ChangeLogFetchResult& result) {
+  Download plain(download.index, downloadFile());
+  try {
+    std::ifstream stored(download.file, std::ios::binary);
+    std::ofstream out(plain.file, std::ios::binary | std::ios::trunc);
+    seal.openChangeLog(stored, out, dataclass, download.index);
+    out.close();
+    if (!out) throw std::runtime_error("it could not be written whole here");
+  } catch (const std::runtime_error& e) {
+    // Never applied, never a stop: the caller names it and goes on.
+    std::string creator;
+    if (auto headers = envelopeHeadersOf(download.file))
+      creator = headers->get("CreatorClientGuid").string();
+    VTC_LOG_WARNING("Changelog %d of %@ is set aside: %@", download.index, dataclass, e.what());
+    result.refusedChangeLogs[download.index] = vtc::RefusedChangeLog{e.what(), creator};
+    return;
+  }
+  // Read like a plain changelog of its size (the files go with the
+  // changelog or the download).
+  if (fileSize(plain.file) < kMappingThreshold)
+    result.changeLogs[download.index] = std::make_unique<NubiloChangeLog>(readWhole(plain.file));
+  else
+    result.changeLogs[download.index] = NubiloMappedChangelog::adoptingFile(plain.release());
 }
 
 }  // namespace
@@ -115,6 +158,19 @@ vtc::ChangeLogFetchResult NubiloRemoteSession::fetchChangeLogsForDataclass(
     }
     VTC_LOG_INFO("Processing batched clogs from %i to %i for %@", start, end, dataclass);
     for (Download& download : batch) {
+      if (_accountSeal) {
+        openSealed(*_accountSeal, download, dataclass, result);
+        continue;
+      }
+      // An encrypted account's changelog read without its key would be a
+      // changelog without changes: it is refused instead.
+      if (envelopeHeadersOf(download.file)) {
+        VTC_LOG_WARNING("Changelog %d of %@ is encrypted and this session has no key",
+                        download.index, dataclass);
+        result.refusedChangeLogs[download.index] = vtc::RefusedChangeLog{
+            "it is encrypted, and this computer has not the account's key", ""};
+        continue;
+      }
       if (fileSize(download.file) < kMappingThreshold)
         result.changeLogs[download.index] = std::make_unique<NubiloChangeLog>(
             readWhole(download.file));  // the file goes with the download

@@ -12,6 +12,7 @@
 #include "common/Logging.h"
 #include "platform/dav/DavPaths.h"
 #include "platform/dav/TesselSession.h"
+#include "platform/sealing/AccountSeal.h"
 #include "prefs/SyncEngineSettings.h"
 #include "session/DataclassName.h"
 
@@ -60,7 +61,9 @@ bool NubiloRemoteSession::registerClient(const std::string& guid, const std::str
   }
   vtc::Dictionary props{
       {"guid", guid},
-      {"clientname", strippedName},
+      {"clientname", _accountSeal
+                         ? _accountSeal->sealText(strippedName, vtc::sealing::kClientNamePurpose)
+                         : strippedName},
       {"classname", SM_CLIENT_CLASS_BRAMBLE},
       {"buildversion", vtc::format("VantorSyncClient-%@", VantorSyncManagerVersionNumber)},
   };

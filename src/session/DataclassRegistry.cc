@@ -10,6 +10,7 @@
 #include "common/Logging.h"
 #include "platform/dav/DavPaths.h"
 #include "platform/dav/TesselSession.h"
+#include "platform/sealing/AccountSeal.h"
 #include "session/DataclassName.h"
 
 std::string NubiloRemoteSession::dataclassPath(const std::string& dataclass) const {
@@ -22,6 +23,17 @@ vtc::Dictionary NubiloRemoteSession::recordFromProperties(const vtc::Dictionary&
   for (const auto& [name, value] : properties)
     if (name.size() > _namespaceLength && name.compare(0, _namespaceLength, _syncNamespace) == 0)
       record.set(name.substr(_namespaceLength), value);
+  // An encrypted account's sealed values come back opened; one that does
+  // not open is left out, as if the share had not kept it.
+  if (_accountSeal)
+    for (const auto& [key, purpose] : {std::pair{"clientname", vtc::sealing::kClientNamePurpose},
+                                       std::pair{"truthdigest", vtc::sealing::kTruthDigestPurpose}})
+      if (const vtc::Value* sealed = record.find(key); sealed && sealed->isString()) {
+        if (auto text = _accountSeal->openText(sealed->string(), purpose))
+          record.set(key, vtc::Value(*text));
+        else
+          record.erase(key);
+      }
   return record;
 }
 
@@ -130,7 +142,12 @@ bool NubiloRemoteSession::setInfoForDataclass(const vtc::Dictionary& properties,
   if (properties.empty()) return true;
   std::string path = dataclassPath(dataclass);
   VTC_LOG_INFO("Patching dataclass info at path %@ with properties %@", path, properties);
-  return _issuePropPatchWithRetryAtPath(path + "/", properties, _syncNamespace).isSuccessful();
+  vtc::Dictionary patch = properties;
+  if (const vtc::Value* digest = patch.find("truthdigest");
+      _accountSeal && digest && digest->isString() && digest->string() != kNBRemoveProp)
+    patch.set("truthdigest", vtc::Value(_accountSeal->sealText(digest->string(),
+                                                               vtc::sealing::kTruthDigestPurpose)));
+  return _issuePropPatchWithRetryAtPath(path + "/", patch, _syncNamespace).isSuccessful();
 }
 
 std::vector<std::string> NubiloRemoteSession::changeLogVersionsForDataclass(

@@ -12,6 +12,7 @@
 #include "common/Uuid.h"
 #include "platform/dav/DavPaths.h"
 #include "platform/dav/TesselSession.h"
+#include "platform/sealing/AccountSeal.h"
 
 namespace {
 
@@ -141,15 +142,26 @@ NubiloRemoteSession::NubiloRemoteSession(std::shared_ptr<MemberAccount> account,
   _lockedResources.clear();
   _clientsInfo.clear();
 
-  // The result still holds one "%@": the acquire date, stamped per lock.
-  _lockOwnerFormatString =
-      vtc::format(kLockOwnerTemplate, _syncNamespace, stringByXMLQuoting(vtc::textOf(name)),
-                  _configuration.get("ClientGuid"),
-                  stringByXMLQuoting(vtc::textOf(_configuration.get("ClientName"))), "%@");
+  makeLockOwnerFormat();
 
   // A failure here surfaces at the first request that needs the collections.
   const vtc::Value& create = _configuration.get("create_sync_paths");
   if (create.isNone() || create.boolean()) createSyncPaths();
+}
+
+void NubiloRemoteSession::makeLockOwnerFormat() {
+  std::string client = vtc::textOf(_configuration.get("ClientName"));
+  if (_accountSeal) client = _accountSeal->sealText(client, vtc::sealing::kClientNamePurpose);
+  // The result still holds one "%@": the acquire date, stamped per lock.
+  _lockOwnerFormatString =
+      vtc::format(kLockOwnerTemplate, _syncNamespace,
+                  stringByXMLQuoting(vtc::textOf(_configuration.get("Name"))),
+                  _configuration.get("ClientGuid"), stringByXMLQuoting(client), "%@");
+}
+
+void NubiloRemoteSession::setAccountSeal(std::shared_ptr<const vtc::sealing::AccountSeal> seal) {
+  _accountSeal = std::move(seal);
+  makeLockOwnerFormat();
 }
 
 std::string NubiloRemoteSession::pathInShare(const std::string& absolute) const {

@@ -8,6 +8,7 @@
 #include "common/Logging.h"
 #include "platform/dav/TesselSession.h"
 #include "platform/os/HostIdentity.h"
+#include "platform/sealing/AccountSeal.h"
 #include "session/SyncReport.h"
 
 namespace {
@@ -79,6 +80,11 @@ void NubiloRemoteSession::sendReportingInfo(const vtc::Dictionary& summary) {
   vtc::Dictionary report = vtc::flattenedSyncReport(summary, _respondingServer, machine);
   // The outcome is not looked at: a report that does not arrive costs only
   // the other computers' view of this sync.
+  std::function<vtc::Bytes(const vtc::Bytes&)> seal;
+  if (_accountSeal)
+    seal = [&](const vtc::Bytes& plain) {
+      return _accountSeal->seal(plain, vtc::sealing::kReportPurpose);
+    };
   _TesselSession->_sendReportingInfo(report, vtc::reportsPathIn(_syncPath),
-                                     machine.value_or(_configuration.get("guid").string()));
+                                     machine.value_or(_configuration.get("guid").string()), seal);
 }

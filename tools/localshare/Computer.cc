@@ -232,6 +232,13 @@ void Computer::setEnvironment(const std::string& name, const std::string& value)
   environment_[name] = value;
 }
 
+std::vector<std::string> Computer::passphraseArguments(const std::string& passphrase) const {
+  const std::string file = home_ + "/.passphrase";
+  write(file, passphrase + "\n");
+  ::chmod(file.c_str(), 0600);
+  return {"--passphrase-command", "cat '" + file + "'"};
+}
+
 void Computer::join(const std::string& url, const std::string& user, const std::string& password,
                     const std::vector<std::string>& moreSetup) const {
   const std::string passwordFile = home_ + "/.password";

@@ -60,6 +60,10 @@ class Computer {
   void join(const std::string& url, const std::string& user, const std::string& password,
             const std::vector<std::string>& moreSetup = {}) const;
 
+  // Writes passphrase into a file of the home and gives the setup
+  // arguments of a passphrase command that prints it.
+  std::vector<std::string> passphraseArguments(const std::string& passphrase) const;
+
   // Sets an environment variable of the client's processes (PATH, for one).
   void setEnvironment(const std::string& name, const std::string& value);
   // Gives the client's processes no more address space than this (0: no limit).

@@ -121,9 +121,10 @@ class TesselSession {
   DavTransaction listCollectionAtPath(const std::string& path);
 
   // Stores a flattened sync report as "<reportsPath>/<name>.plist" (the
-  // collection is made on first use).
-  DavTransaction _sendReportingInfo(const vtc::Dictionary& report, const std::string& reportsPath,
-                                    const std::string& name);
+  // collection is made on first use), sealed first when seal is given.
+  DavTransaction _sendReportingInfo(
+      const vtc::Dictionary& report, const std::string& reportsPath, const std::string& name,
+      const std::function<vtc::Bytes(const vtc::Bytes&)>& seal = nullptr);
 
   const std::string& owner() const { return owner_; }
   // The SHA-256 digest of the HTTPS server's certificate; empty over HTTP.

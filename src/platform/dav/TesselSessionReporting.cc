@@ -3,11 +3,12 @@
 #include "platform/dav/TesselSession.h"
 #include "platform/plist/PlistCodec.h"
 
-DavTransaction TesselSession::_sendReportingInfo(const vtc::Dictionary& report,
-                                                 const std::string& reportsPath,
-                                                 const std::string& name) {
+DavTransaction TesselSession::_sendReportingInfo(
+    const vtc::Dictionary& report, const std::string& reportsPath, const std::string& name,
+    const std::function<vtc::Bytes(const vtc::Bytes&)>& seal) {
   const std::string xml = vtc::plist::toXml(vtc::Value(report));
-  const vtc::Bytes body(xml.begin(), xml.end());
+  vtc::Bytes body(xml.begin(), xml.end());
+  if (seal) body = seal(body);
   const std::string path = reportsPath + "/" + name + ".plist";
   DavTransaction t = putData(body, path);
   // The first report of the account: no collection yet. Servers name a
