@@ -12,6 +12,7 @@
 #include "client/cli/Commands.h"
 #include "client/cli/TerminalText.h"
 #include "client/run/Automation.h"
+#include "client/run/FailureText.h"
 #include "client/run/SyncFailure.h"
 #include "common/Clock.h"
 
@@ -147,8 +148,8 @@ int runCommandLine(int argc, char** argv) {
       ->required()
       ->check(CLI::IsMember({"on", "off"}));
   pushing->footer("Example: nubilosyncclient push on");
-  auto* listen =
-      app.add_subcommand("listen", "Receive pushes and sync on them (what the login service runs)");
+  auto* listen = app.add_subcommand(
+      "listen", "Receive pushes and sync on them (`push on` starts this at each login)");
   listen->footer("Example: nubilosyncclient listen");
 
   try {
@@ -205,8 +206,8 @@ int runCommandLine(int argc, char** argv) {
     std::cerr << "nubilosyncclient: " << shownSafely(e.what()) << "\n";
     return e.exitStatus();
   } catch (const NubiloException& e) {
-    std::cerr << "nubilosyncclient: " << shownSafely(e.reason()) << "\n";
-    return static_cast<int>(FailureKind::Other);
+    std::cerr << "nubilosyncclient: " << shownSafely(failureSentence("the account", e)) << "\n";
+    return static_cast<int>(failureKind(e));
   } catch (const std::bad_alloc&) {
     std::cerr << "nubilosyncclient: this computer could not give the command the memory it "
                  "needed; nothing more was done.\n";

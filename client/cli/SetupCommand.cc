@@ -18,6 +18,7 @@
 #include "client/cli/Terminal.h"
 #include "client/run/Account.h"
 #include "client/run/Automation.h"
+#include "client/run/Collections.h"
 #include "client/run/ServerQualification.h"
 #include "client/run/SyncAreaFinding.h"
 #include "client/run/SyncFailure.h"
@@ -223,10 +224,15 @@ int setupCommand(const SetupRequest& request, Output& output) {
   session->patchClientInfo(record);
   storeAccount(setup, guid, name);
   if (push) storePushServer(*push);
-  if (output.verbosity > 0)
+  if (output.verbosity > 0) {
     output.out << "Set up " << request.member << " at " << server.url() << " for this computer, "
-               << name << ".\nAdd a folder with `nubilosyncclient add contacts FOLDER` or "
-               << "`nubilosyncclient add calendars FOLDER`, then run `nubilosyncclient sync`.\n";
+               << name << ".\n";
+    if (configuredCollections().empty())
+      output.out << "Add a folder with `nubilosyncclient add contacts FOLDER` or "
+                 << "`nubilosyncclient add calendars FOLDER`, then run `nubilosyncclient sync`.\n";
+    else
+      output.out << "Its folders stay as they were; run `nubilosyncclient sync`.\n";
+  }
   return 0;
 }
 

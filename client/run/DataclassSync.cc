@@ -247,8 +247,12 @@ DataclassOutcome DataclassSync::run(const std::optional<DataclassRecord>& listed
       keepConflicts(plan);
       store(local, plan, incoming);
       if (options_.repair) repair(record);
-      if (needsTruth)
-        session_.setStatus("normal", session_.configuration().get("guid").string(), dataclass);
+      if (needsTruth) try {
+          session_.setStatus("normal", session_.configuration().get("guid").string(), dataclass);
+        } catch (const NubiloException& e) {
+          // Committed and stored: the next sync notes it again.
+          VTC_LOG_WARNING("Could not note %@ as taken in: %@", dataclass, e.reason());
+        }
     }
   } catch (...) {
     if (locked_) {

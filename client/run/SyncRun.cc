@@ -3,6 +3,8 @@
 #include <unistd.h>
 
 #include <chrono>
+#include <memory>
+#include <tuple>
 
 #include "VantorSyncManager/Diagnostics.h"
 #include "VantorSyncManager/HostIdentity.h"
@@ -55,6 +57,17 @@ void rememberOutcome(const DataclassOutcome& o, const std::string* sentence) {
 
 }  // namespace
 
+std::string notSyncedSentence(const std::string& name) {
+  std::string names;
+  for (const Collection& c : configuredCollections())
+    names += (names.empty() ? "" : ", ") + c.dataclass;
+  if (names.empty())
+    return name +
+           " is not synced on this computer, nor is any other folder; add one with "
+           "`nubilosyncclient add contacts|calendars FOLDER`.";
+  return name + " is not synced on this computer; its synced folders are " + names + ".";
+}
+
 int RunResult::exitStatus() const {
   if (!failures.empty()) return static_cast<int>(failures.front().kind);
   for (const DataclassOutcome& o : outcomes)
@@ -74,11 +87,7 @@ RunResult runSync(const RunRequest& request) {
   } else {
     for (const std::string& name : request.dataclasses) {
       auto c = configuredCollection(name);
-      if (!c)
-        throw SyncFailure(FailureKind::Usage,
-                          name +
-                              " is not synced on this computer; add a folder for it with "
-                              "`nubilosyncclient add contacts|calendars FOLDER`.");
+      if (!c) throw SyncFailure(FailureKind::Usage, notSyncedSentence(name));
       collections.push_back(*c);
     }
   }
@@ -90,13 +99,30 @@ RunResult runSync(const RunRequest& request) {
   auto owner = SyncOwner::acquire();
   const Date runStart = currentClock().now();
   const SecretHold holdingPassword;
-  const auto [member, password] = storedCredentials();
   RunResult result;
-  const ServerAddress server = ServerAddress::fromConfiguration(prefs.configuration());
-  if (server.scheme != "https")
-    if (auto warning = network::passwordInClearWarning(member, server.host, server.url(), "HTTP"))
-      result.warnings.push_back(*warning);
-  auto session = openSession(member, password, prefs.configuration());
+  std::string member, password;
+  std::unique_ptr<NubiloRemoteSession> session;
+  try {
+    std::tie(member, password) = storedCredentials();
+    const ServerAddress server = ServerAddress::fromConfiguration(prefs.configuration());
+    if (server.scheme != "https")
+      if (auto warning = network::passwordInClearWarning(member, server.host, server.url(), "HTTP"))
+        result.warnings.push_back(*warning);
+    session = openSession(member, password, prefs.configuration());
+  } catch (const SyncFailure& e) {
+    // A run that never reached the share is still this computer's last
+    // attempt: status tells when and why.
+    if (!request.dryRun)
+      for (const Collection& c : collections) {
+        prefs.setLastAttemptedSyncDateForDataclass(c.dataclass);
+        prefs.setSyncSuccessful(false, c.dataclass);
+        DataclassOutcome none;
+        none.dataclass = c.dataclass;
+        const std::string sentence = e.what();
+        rememberOutcome(none, &sentence);
+      }
+    throw;
+  }
   HeldLocks locks(*session);
   if (!request.dryRun) locks.releaseLeftovers();
   auto engine =
@@ -184,12 +210,23 @@ RunResult runSync(const RunRequest& request) {
                      Value(static_cast<int64_t>(o.receivedChanges)));
     }
     VTCLogStatistics(statistics);
-    session->sendReportingInfo(summary);
-    // For the other computers' status: when this one last synced, and which
-    // report is its own. Not judged: it only informs.
+    try {
+      session->sendReportingInfo(summary);
+    } catch (const NubiloException& e) {
+      // The changes are committed; a report that did not go out is no failure.
+      VTC_LOG_WARNING("The sync report could not be written: %@", e.reason());
+    }
+  }
+  if (!request.dryRun) {
+    // For the other computers' status: when this one last synced (an idle
+    // sync too), and which report is its own. Not judged: it only informs.
     Dictionary record{{"lastsync", textOf(Value(currentClock().now()))}};
     if (auto machine = getHostUUIDString()) record.set("machineguid", Value(*machine));
-    session->patchClientInfo(record);
+    try {
+      session->patchClientInfo(record);
+    } catch (const NubiloException& e) {
+      VTC_LOG_WARNING("This computer's last sync could not be noted on the share: %@", e.reason());
+    }
   }
   if (!request.dryRun && result.failures.empty())
     prefs.setLastSuccessfulSyncDate(currentClock().now());

@@ -125,13 +125,13 @@ TEST_F(Living, ARestoredConflictTakesEffectOnTheOtherComputerAndADroppedOneIsGon
 }
 
 TEST_F(Living, EachFailureIsOnePlainSentenceWithAnExitStatusOfItsKind) {
-  // A refused login says how to store the right password, once.
+  // A refused login says to check the password, once.
   Computer wrong{"Mac W"};
   Computer::Result login = wrong.run({"setup", url, "--user", ApacheShare::kUser,
                                       "--password-command", "printf nope", "--allow-insecure"});
   EXPECT_EQ(login.status, 3);
-  EXPECT_THAT(login.err, HasSubstr("refused the password for alice; store the right one with "
-                                   "`nubilosyncclient setup`"));
+  EXPECT_THAT(login.err, HasSubstr("refused the password for alice; check the member name and "
+                                   "the password"));
   const size_t requests = share.accessEntries().size();
   a.setPreference("PasswordCommand", vtc::Value("printf nope"));  // a password changed elsewhere
   EXPECT_EQ(a.run({"sync"}).status, 3);
