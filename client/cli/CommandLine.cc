@@ -20,6 +20,11 @@ namespace vtc::client {
 
 namespace {
 
+#ifndef VSM_CLIENT_VERSION
+#define VSM_CLIENT_VERSION "unknown"
+#endif
+constexpr const char* kClientVersion = VSM_CLIENT_VERSION;
+
 // NUBILO_WAIT_SCALE multiplies every wait of the protocol (lock back-off,
 // the pause before asking again for a missing file): tests that run the
 // client as a program make its waits short with it.
@@ -61,6 +66,7 @@ int runCommandLine(int argc, char** argv) {
   app.add_flag("--periodic", periodic, "With --sync: started by the schedule");
   app.add_option("--dataclasses", launchDataclasses, "With --sync: only these, comma-separated")
       ->delimiter(',');
+  app.set_version_flag("--version", "nubilosyncclient " + std::string(kClientVersion));
   app.add_flag("-q,--quiet", quiet, "Print nothing but errors");
   app.add_flag("-v,--verbose", verbose, "Say more");
 
@@ -134,6 +140,26 @@ int runCommandLine(int argc, char** argv) {
       "  nubilosyncclient add contacts ~/.local/share/contacts/people\n"
       "  nubilosyncclient sync\n  nubilosyncclient status\n\nSee nubilosyncclient(1).");
 
+  std::string setting, settingValue;
+  auto* config = app.add_subcommand("config", "Show or change this computer's settings");
+  auto* configGet = config->add_subcommand("get", "Show one setting");
+  configGet->add_option("NAME", setting, "name or log-level")->required();
+  auto* configSet = config->add_subcommand("set", "Change one setting");
+  configSet->add_option("NAME", setting, "name or log-level")->required();
+  configSet->add_option("VALUE", settingValue, "Its new value")->required();
+  config->footer(
+      "Settings:\n  name       this computer's name, as the other computers see it\n"
+      "  log-level  error, warn, info or debug\n"
+      "Example: nubilosyncclient config set log-level info");
+
+  std::string forgotten;
+  bool forceForget = false;
+  auto* forget = app.add_subcommand(
+      "forget", "Drop a computer that is gone from the account (its record and its locks)");
+  forget->add_option("COMPUTER", forgotten, "Its name, as `status` lists it")->required();
+  forget->add_flag("--force", forceForget, "Also when it synced within the last week");
+  forget->footer("Example: nubilosyncclient forget \"Old laptop\"");
+
   std::string scheduleSwitch, every;
   auto* schedule = app.add_subcommand("schedule", "Sync by itself on a schedule, or stop");
   schedule->add_option("on|off", scheduleSwitch, "on or off")
@@ -188,6 +214,12 @@ int runCommandLine(int argc, char** argv) {
                                                : "",
                               conflictId, output);
     if (*status) return statusCommand(statusJson, output);
+    if (*config)
+      return configCommand(*configGet   ? "get"
+                           : *configSet ? "set"
+                                        : "",
+                           setting, settingValue, output);
+    if (*forget) return forgetCommand(forgotten, forceForget, output);
     if (*schedule)
       return scheduleCommand(scheduleSwitch == "on",
                              every.empty() ? std::nullopt : std::optional<std::string>(every),

@@ -220,7 +220,8 @@ RunResult runSync(const RunRequest& request) {
   if (!request.dryRun) {
     // For the other computers' status: when this one last synced (an idle
     // sync too), and which report is its own. Not judged: it only informs.
-    Dictionary record{{"lastsync", textOf(Value(currentClock().now()))}};
+    Dictionary record{{"lastsync", textOf(Value(currentClock().now()))},
+                      {"clientname", Value(options.computerName)}};
     if (auto machine = getHostUUIDString()) record.set("machineguid", Value(*machine));
     try {
       session->patchClientInfo(record);

@@ -14,6 +14,7 @@
 #include "support/TestHome.h"
 
 using testing::HasSubstr;
+using testing::Not;
 using vtc::local::ApacheShare;
 using vtc::local::Computer;
 
@@ -186,6 +187,48 @@ TEST_F(Living, APasswordFromStandardInputGoesToTheSecretServiceAndNowhereElse) {
         << entry.path();
   }
   EXPECT_THAT(c.run({"status", "--json"}).out, testing::Not(HasSubstr(ApacheShare::kPassword)));
+}
+
+}  // namespace
+
+namespace {
+
+TEST_F(Living, VersionSettingsAndForgettingAComputerThatIsGone) {
+  Computer::Result version = a.run({"--version"});
+  EXPECT_EQ(version.status, 0);
+  EXPECT_THAT(version.out, testing::MatchesRegex("nubilosyncclient [0-9]+\\.[0-9]+\n"));
+
+  // This computer's name and the log's level, without a property list.
+  EXPECT_EQ(a.run({"config", "get", "name"}).out, "Mac A\n");
+  EXPECT_EQ(a.run({"config", "set", "name", "Ann's laptop"}).status, 0);
+  Computer::Result level = a.run({"config", "set", "log-level", "info"});
+  EXPECT_EQ(level.status, 0) << level.err;
+  EXPECT_EQ(level.out,
+            "The log (~/Library/Logs/Sync/nubilosync.log) now records what each sync does, "
+            "warnings and errors.\n");
+  EXPECT_EQ(a.run({"config"}).out, "name Ann's laptop\nlog-level info\n");
+  EXPECT_EQ(a.run({"config", "set", "colour", "red"}).status, 2);
+  EXPECT_EQ(a.run({"config", "set", "log-level", "loud"}).status, 2);
+  ASSERT_EQ(a.run({"sync"}).status, 0);
+  EXPECT_THAT(Computer::read(a.home() + "/Library/Logs/Sync/nubilosync.log"), HasSubstr("|Info|"));
+  EXPECT_THAT(a.run({"status"}).out,
+              HasSubstr("Log: ~/Library/Logs/Sync/nubilosync.log (info; raise it with"));
+  EXPECT_THAT(b.run({"status"}).out, HasSubstr("Ann's laptop: last sync 20"));
+
+  // A computer seen lately is kept unless forced; a forgotten one is gone.
+  Computer c{"Old desktop"};
+  c.join(url, ApacheShare::kUser, ApacheShare::kPassword);
+  ASSERT_EQ(c.run({"sync"}).status, 0);
+  Computer::Result refused = b.run({"forget", "Old desktop"});
+  EXPECT_EQ(refused.status, 2);
+  EXPECT_THAT(refused.err, HasSubstr("within the last week; if it is gone for good, forget it "
+                                     "with `nubilosyncclient forget --force Old desktop`"));
+  EXPECT_EQ(b.run({"forget", "Nobody"}).status, 2);
+  Computer::Result forgot = b.run({"forget", "--force", "Old desktop"});
+  EXPECT_EQ(forgot.status, 0) << forgot.err;
+  EXPECT_EQ(forgot.out, "Forgot Old desktop; if it syncs again, it joins as a new computer.\n");
+  EXPECT_THAT(b.run({"status"}).out, Not(HasSubstr("Old desktop")));
+  EXPECT_EQ(status(b)["computers"].size(), 2u);
 }
 
 }  // namespace
