@@ -127,10 +127,15 @@ int runCommandLine(int argc, char** argv) {
       conflicts->add_subcommand("restore", "Make a losing value the current one (sent next sync)");
   restoreConflict->add_option("ID", conflictId, "As `conflicts` lists it")->required();
   auto* dropConflict = conflicts->add_subcommand("drop", "Forget a kept losing value");
-  dropConflict->add_option("ID", conflictId, "As `conflicts` lists it")->required();
+  bool dropAll = false;
+  auto* dropId = dropConflict->add_option("ID", conflictId, "As `conflicts` lists it");
+  auto* dropEvery = dropConflict->add_flag("--all", dropAll, "Forget every kept losing value");
+  dropId->excludes(dropEvery);
+  dropConflict->require_option(1);
   conflicts->footer("Example: nubilosyncclient conflicts restore 2cb0ddcd");
   restoreConflict->footer("Example: nubilosyncclient conflicts restore 2cb0ddcd");
-  dropConflict->footer("Example: nubilosyncclient conflicts drop 2cb0ddcd");
+  dropConflict->footer(
+      "Examples: nubilosyncclient conflicts drop 2cb0ddcd; nubilosyncclient conflicts drop --all");
   bool statusJson = false;
   auto* status = app.add_subcommand("status", "Say what this computer syncs and how it went");
   status->add_flag("--json", statusJson, "One JSON document, for scripts");

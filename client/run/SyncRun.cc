@@ -15,6 +15,7 @@
 #include "client/run/Account.h"
 #include "client/run/Automation.h"
 #include "client/run/FailureText.h"
+#include "client/run/SharedConflicts.h"
 #include "client/run/StatusReport.h"
 #include "client/run/SyncOwner.h"
 #include "common/Clock.h"
@@ -221,7 +222,8 @@ RunResult runSync(const RunRequest& request) {
     // For the other computers' status: when this one last synced (an idle
     // sync too), and which report is its own. Not judged: it only informs.
     Dictionary record{{"lastsync", textOf(Value(currentClock().now()))},
-                      {"clientname", Value(options.computerName)}};
+                      {"clientname", Value(options.computerName)},
+                      {kSharedConflictsKey, Value(sharedConflictsText(conflicts.list()))}};
     if (auto machine = getHostUUIDString()) record.set("machineguid", Value(*machine));
     try {
       session->patchClientInfo(record);

@@ -232,3 +232,41 @@ TEST_F(Living, VersionSettingsAndForgettingAComputerThatIsGone) {
 }
 
 }  // namespace
+
+namespace {
+
+TEST_F(Living, ConflictsAreListedByNameWithBothValuesOnEveryComputerAndDroppedAllAtOnce) {
+  Computer::write(a.contacts() + "/ann.vcf", card("ann", "Ann Smith", "1"));
+  ASSERT_EQ(a.run({"sync"}).status, 0);
+  ASSERT_EQ(b.run({"sync"}).status, 0);
+  Computer::write(a.contacts() + "/ann.vcf", card("ann", "Ann Smith", "100"));
+  Computer::write(b.contacts() + "/ann.vcf", card("ann", "Ann Smith", "200"));
+  ASSERT_EQ(a.run({"sync"}).status, 0);
+  ASSERT_EQ(b.run({"sync"}).status, 0);
+  ASSERT_EQ(a.run({"sync"}).status, 0);
+
+  // Where the losing value is kept: by name, both values side by side.
+  Computer::Result here = b.runOnTerminal({"conflicts"});
+  EXPECT_EQ(here.status, 0) << here.out;
+  EXPECT_THAT(here.out,
+              testing::ContainsRegex(
+                  "[0-9a-f]{8}  Ann Smith: TEL  \\(ann\\.vcf, com\\.korvo\\.Contacts\\)"));
+  EXPECT_THAT(here.out, testing::ContainsRegex("kept \\(from Mac A\\) +\\| lost \\(from Mac B, "
+                                               "20[0-9-]{8} [0-9:]{8}\\)"));
+  EXPECT_THAT(here.out, testing::ContainsRegex("TEL:100 +\\| TEL:200"));
+  // On the other computer: the same conflict, named as kept on Mac B.
+  Computer::Result there = a.run({"conflicts"});
+  EXPECT_EQ(there.status, 0) << there.err;
+  EXPECT_THAT(there.out, HasSubstr("No conflicts are kept here.\n\nKept on Mac B (restore or drop "
+                                   "them there):\n  Ann Smith: TEL  (ann.vcf, "
+                                   "com.korvo.Contacts)\n"));
+  EXPECT_THAT(there.out, testing::ContainsRegex("TEL:100 +\\| TEL:200"));
+
+  Computer::Result dropped = b.run({"conflicts", "drop", "--all"});
+  EXPECT_EQ(dropped.out, "Dropped 1 conflict; the values that stand are unchanged.\n");
+  EXPECT_EQ(b.run({"conflicts", "drop"}).status, 2);
+  ASSERT_EQ(b.run({"sync"}).status, 0);
+  EXPECT_EQ(a.run({"conflicts"}).out, "No conflicts are kept here.\n");
+}
+
+}  // namespace
