@@ -218,7 +218,7 @@ RunResult runSync(const RunRequest& request) {
       VTC_LOG_WARNING("The sync report could not be written: %@", e.reason());
     }
   }
-  if (!request.dryRun) {
+  if (!request.dryRun && result.failures.empty()) {
     // For the other computers' status: when this one last synced (an idle
     // sync too), and which report is its own. Not judged: it only informs.
     Dictionary record{{"lastsync", textOf(Value(currentClock().now()))},

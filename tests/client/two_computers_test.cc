@@ -164,7 +164,7 @@ TEST_P(Account, EditsOfDifferentFieldsMergeDeletesTravelAndAConflictEndsTheSameE
   EXPECT_EQ(contactsOf(a)["bob.vcf"], card("bob", "Robert", "bob@example.org", "2"));
   EXPECT_EQ(contactsOf(a), contactsOf(b));
   Computer::Result conflicts = b.run({"conflicts"});
-  EXPECT_THAT(conflicts.out, HasSubstr("bob.vcf  FN"));
+  EXPECT_THAT(conflicts.out, HasSubstr(": FN  (bob.vcf, com.korvo.Contacts)"));
   EXPECT_THAT(conflicts.out, HasSubstr("FN:Bobby"));
   EXPECT_THAT(conflicts.out, HasSubstr("from Mac A"));
   EXPECT_THAT(a.run({"conflicts"}).out, HasSubstr("No conflicts"));
