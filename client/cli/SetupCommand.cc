@@ -27,6 +27,7 @@
 #include "common/Uuid.h"
 #include "platform/dav/DavPaths.h"
 #include "platform/dav/TesselSession.h"
+#include "platform/fs/LocalPaths.h"
 #include "prefs/ClientConfiguration.h"
 
 namespace vtc::client {
@@ -129,7 +130,8 @@ Dictionary setupConfiguration(const SetupRequest& request, const ServerAddress& 
   configuration.merge(server.configurationKeys());
   if (request.caFile) {
     std::error_code error;
-    const std::filesystem::path path = std::filesystem::absolute(*request.caFile, error);
+    const std::filesystem::path path =
+        std::filesystem::absolute(paths::expandTilde(*request.caFile), error);
     if (error || !std::filesystem::is_regular_file(path))
       throw SyncFailure(FailureKind::Usage,
                         "There is no certificate file " + *request.caFile + ".");

@@ -14,6 +14,7 @@
 #include "VantorSyncManager/VTCPrefsCenter.h"
 #include "client/run/Account.h"
 #include "client/run/Automation.h"
+#include "client/run/CollectionMeta.h"
 #include "client/run/FailureText.h"
 #include "client/run/SharedConflicts.h"
 #include "client/run/StatusReport.h"
@@ -179,6 +180,12 @@ RunResult runSync(const RunRequest& request) {
       }
       if (failure) outcome = sync.outcome();
       usedServer = usedServer || outcome.usedServer;
+      if (!request.dryRun && !failure) {
+        const auto listed = view.record(collection.dataclass);
+        syncCollectionMeta(*session, collection,
+                           listed ? CollectionMeta{listed->collectionName, listed->collectionColor}
+                                  : CollectionMeta{});
+      }
       if (!request.dryRun) {
         prefs.setSyncSuccessful(!failure, collection.dataclass);
         rememberOutcome(outcome, failure ? &failure->sentence : nullptr);

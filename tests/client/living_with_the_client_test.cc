@@ -270,3 +270,31 @@ TEST_F(Living, ConflictsAreListedByNameWithBothValuesOnEveryComputerAndDroppedAl
 }
 
 }  // namespace
+
+namespace {
+
+TEST_F(Living, AFolderNameAndColourTravelWithTheCollectionAndATildeMeansTheHome) {
+  Computer::write(a.contacts() + "/displayname", "Family\n");
+  Computer::write(a.contacts() + "/color", "#ff8800\n");
+  Computer::write(a.contacts() + "/ann.vcf", card("ann", "Ann", "1"));
+  ASSERT_EQ(a.run({"sync"}).status, 0);
+  ASSERT_EQ(b.run({"sync"}).status, 0);
+  EXPECT_EQ(Computer::read(b.contacts() + "/displayname"), "Family\n");
+  EXPECT_EQ(Computer::read(b.contacts() + "/color"), "#ff8800\n");
+  EXPECT_EQ(contacts(status(b))["items"], 1);  // properties, not records
+
+  // A change on either side travels; a colour removed is removed.
+  Computer::write(b.contacts() + "/displayname", "Family and friends\n");
+  std::filesystem::remove(b.contacts() + "/color");
+  ASSERT_EQ(b.run({"sync"}).status, 0);
+  ASSERT_EQ(a.run({"sync"}).status, 0);
+  EXPECT_EQ(Computer::read(a.contacts() + "/displayname"), "Family and friends\n");
+  EXPECT_FALSE(std::filesystem::exists(a.contacts() + "/color"));
+
+  Computer::Result added = a.run({"add", "contacts", "~/work", "--dataclass", "work.Contacts"});
+  EXPECT_EQ(added.status, 0) << added.err;
+  EXPECT_THAT(added.out, HasSubstr(a.home() + "/work"));
+  EXPECT_TRUE(std::filesystem::is_directory(a.home() + "/work"));
+}
+
+}  // namespace
