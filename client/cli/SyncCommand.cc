@@ -151,6 +151,8 @@ int syncCommand(RunRequest request, Output& output) {
   }
   // What was left over is named every time, until the user has seen to it.
   for (const DataclassOutcome& o : result.outcomes) {
+    for (const std::string& note : o.notes)
+      output.err << "nubilosyncclient: " << shownSafely(note) << "\n";
     for (const auto& [file, why] : o.invalidFiles)
       output.err << "nubilosyncclient: " << o.dataclass << ": skipped " << file << ": " << why
                  << "\n";

@@ -1,5 +1,7 @@
 #include "client/run/ForeignLocks.h"
 
+#include <cstdlib>
+
 #include "VantorSyncManager/NubiloRemoteSession.h"
 #include "common/Logging.h"
 #include "platform/dav/TesselSession.h"
@@ -21,6 +23,24 @@ size_t releaseLocksOf(NubiloRemoteSession& session, const std::string& path,
       ++released;
   }
   return released;
+}
+
+bool abandonedLock(const Dictionary& lock, int64_t lockDuration) {
+  const std::string& timeout = lock.get("timeout").string();
+  if (lockDuration <= 0 || !timeout.starts_with("Second-")) return false;
+  char* end = nullptr;
+  const long long left = std::strtoll(timeout.c_str() + 7, &end, 10);
+  if (end == timeout.c_str() + 7 || *end) return false;
+  return (lockDuration - left) * 5 > lockDuration * 3;
+}
+
+std::string takeoverSentence(const std::string& what, const Dictionary& lock) {
+  std::string holder = lock.get("clientname").string();
+  if (holder.empty()) holder = "another computer";
+  const std::string since = lock.get("acquiredate").string().substr(0, 19);
+  return "Took over the lock of " + what + " that " + holder + " took" +
+         (since.empty() ? "" : " at " + since) +
+         " and stopped renewing: its sync ended without giving the lock back.";
 }
 
 }  // namespace vtc::client

@@ -16,6 +16,7 @@
 #include "client/run/Automation.h"
 #include "client/run/CollectionMeta.h"
 #include "client/run/FailureText.h"
+#include "client/run/LockRenewal.h"
 #include "client/run/SharedConflicts.h"
 #include "client/run/StatusReport.h"
 #include "client/run/SyncOwner.h"
@@ -141,7 +142,8 @@ RunResult runSync(const RunRequest& request) {
   options.maxDeletePercent = request.maxDeletePercent;
   options.deletesConfirmed = request.deletesConfirmed;
   options.repair = request.repair;
-  options.progress = request.progress;
+  LockRenewal renewal(*session, request.progress);
+  options.progress = &renewal;
   options.computerName = prefs.clientName().value_or("this computer");
   ConflictStore conflicts;
 
@@ -193,7 +195,7 @@ RunResult runSync(const RunRequest& request) {
       summary.set(collection.dataclass,
                   Value(summaryEntry(outcome, start, currentClock().now(),
                                      failure ? &failure->sentence : nullptr)));
-      if (request.progress) request.progress->done(collection.dataclass);
+      renewal.done(collection.dataclass);
       result.outcomes.push_back(outcome);
       if (failure) {
         result.failures.push_back(*failure);

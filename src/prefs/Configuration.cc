@@ -161,9 +161,7 @@ vtc::Dictionary VTCPrefsCenter::defaultConfiguration() {
     configuration.merge(*signedLayer);
   } else if (syncing && !noServer) {
     VTC_LOG_ERROR("Failed to validate signature on config file, using default configuration");
-  } else if (noServer) {
-    VTC_LOG_INFO("No configuration server is set up; the built-in configuration applies");
-  } else {
+  } else if (!noServer) {
     VTC_LOG_INFO(
         "Syncing is off and no configuration was downloaded before; the built-in "
         "configuration applies");

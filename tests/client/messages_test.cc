@@ -1,5 +1,6 @@
 // What the client says when things go wrong or are about to happen: a
-// server that is down, a lock another computer holds, a name that is not
+// server that is down, a lock another computer holds (and one it left,
+// taken over), a name that is not
 // synced, a password refused at setup, a dry run and a deletion counted in
 // words, a report that fails after the commit. Every sentence is the
 // user's: no type names or codes of the program's inside.
@@ -9,6 +10,7 @@
 #include <chrono>
 #include <nlohmann/json.hpp>
 
+#include "client/run/ForeignLocks.h"
 #include "localshare/ApacheShare.h"
 #include "localshare/Computer.h"
 #include "localshare/Processes.h"
@@ -71,7 +73,7 @@ TEST_F(Messages, AServerThatIsDownIsToldAtOnceAndStatusKeepsTheAttemptWithItsRea
   EXPECT_THAT(status.out, HasSubstr("1 failed sync since: Cannot reach the server at"));
 }
 
-TEST_F(Messages, ALockNamesTheComputerThatHoldsItAndHowLongItLasts) {
+TEST_F(Messages, ALockNamesItsHolderAndHowLongItLastsAndOneLeftUnrenewedIsTakenOver) {
   Computer::write(a.contacts() + "/ann.vcf", card("ann", "Ann"));
   ASSERT_EQ(run(a, {"sync"}).status, 0);
   // A holds its lock while the share keeps its commit waiting.
@@ -87,6 +89,21 @@ TEST_F(Messages, ALockNamesTheComputerThatHoldsItAndHowLongItLasts) {
                               "minutes at the latest, even if Mac A stopped; try again then\\."));
   ::kill(held, SIGKILL);
   a.finish(held);
+
+  // A lock left unrenewed for more than three fifths of its duration
+  // belongs to a run that stopped: it is taken over, with a sentence.
+  auto lock = [](const char* timeout) {
+    return vtc::Dictionary{{"timeout", timeout},
+                           {"clientname", "Mac A"},
+                           {"acquiredate", "2026-11-23 10:00:00 +0000"}};
+  };
+  EXPECT_FALSE(vtc::client::abandonedLock(lock("Second-240"), 240));
+  EXPECT_FALSE(vtc::client::abandonedLock(lock("Second-100"), 240));
+  EXPECT_TRUE(vtc::client::abandonedLock(lock("Second-90"), 240));
+  EXPECT_FALSE(vtc::client::abandonedLock(lock("Infinite"), 240));
+  EXPECT_EQ(vtc::client::takeoverSentence("com.korvo.Contacts", lock("Second-1")),
+            "Took over the lock of com.korvo.Contacts that Mac A took at 2026-11-23 10:00:00 and "
+            "stopped renewing: its sync ended without giving the lock back.");
 }
 
 TEST_F(Messages, AdviceFitsWhatTheUserDid) {
