@@ -52,6 +52,13 @@ class Messages : public ::testing::Test {
       EXPECT_THAT(r.out + r.err, Not(HasSubstr(inside))) << c.name() << " " << args.front();
     return r;
   }
+  // The requests the proxy keeps waiting: A's commits, held.
+  size_t heldPuts() const {
+    size_t held = 0;
+    for (const auto& seen : proxy.requests())
+      held += seen.method == "PUT" && seen.action == "timed out";
+    return held;
+  }
   static std::string guidOf(Computer::Result status) {
     return nlohmann::json::parse(status.out)["computer"]["guid"].get<std::string>();
   }
@@ -80,7 +87,7 @@ TEST_F(Messages, ALockNamesItsHolderAndHowLongItLastsAndOneLeftUnrenewedIsTakenO
   Computer::write(a.contacts() + "/ann.vcf", card("ann", "Ann", "2"));
   proxy.timeOut({"PUT", "", 0});
   const pid_t held = a.start({"sync", "com.korvo.Contacts"});
-  ASSERT_TRUE(vtc::local::waitUntil([&] { return proxy.count("PUT") > 0; }));
+  ASSERT_TRUE(vtc::local::waitUntil([&] { return heldPuts() == 1; }));
   Computer::Result locked = run(b, {"sync", "com.korvo.Contacts"});
   EXPECT_EQ(locked.status, 1);
   EXPECT_THAT(locked.err, testing::ContainsRegex(
@@ -90,20 +97,24 @@ TEST_F(Messages, ALockNamesItsHolderAndHowLongItLastsAndOneLeftUnrenewedIsTakenO
   ::kill(held, SIGKILL);
   a.finish(held);
 
-  // A lock left unrenewed for more than three fifths of its duration
-  // belongs to a run that stopped: it is taken over, with a sentence.
-  auto lock = [](const char* timeout) {
-    return vtc::Dictionary{{"timeout", timeout},
-                           {"clientname", "Mac A"},
-                           {"acquiredate", "2026-11-23 10:00:00 +0000"}};
-  };
-  EXPECT_FALSE(vtc::client::abandonedLock(lock("Second-240"), 240));
-  EXPECT_FALSE(vtc::client::abandonedLock(lock("Second-100"), 240));
-  EXPECT_TRUE(vtc::client::abandonedLock(lock("Second-90"), 240));
-  EXPECT_FALSE(vtc::client::abandonedLock(lock("Infinite"), 240));
-  EXPECT_EQ(vtc::client::takeoverSentence("com.korvo.Contacts", lock("Second-1")),
-            "Took over the lock of com.korvo.Contacts that Mac A took at 2026-11-23 10:00:00 and "
-            "stopped renewing: its sync ended without giving the lock back.");
+  // A's next run gives its own leftover back; killed again, with a lock
+  // nobody renews (a short one here, as if taken long ago), it is taken over
+  // at once by B, on a terminal, with a sentence naming A.
+  a.setPreference("lock_duration_seconds", vtc::Value(int64_t{3}));
+  const pid_t again = a.start({"sync", "com.korvo.Contacts"});
+  ASSERT_TRUE(vtc::local::waitUntil([&] { return heldPuts() == 2; }));
+  ::kill(again, SIGKILL);
+  a.finish(again);
+  Computer::Result taken = b.runOnTerminal({"sync", "com.korvo.Contacts"});
+  EXPECT_EQ(taken.status, 0) << taken.out;
+  EXPECT_THAT(taken.out, testing::ContainsRegex(
+                             "nubilosyncclient: Took over the lock of com\\.korvo\\.Contacts that "
+                             "Mac A took at 20[0-9-]{8} [0-9:]{8} and stopped renewing: its sync "
+                             "ended without giving the lock back\\."));
+  EXPECT_THAT(taken.out, HasSubstr("com.korvo.Contacts: sent 0 changes, received 1 change"));
+  // A lock renewed lately is not taken.
+  EXPECT_FALSE(vtc::client::abandonedLock(vtc::Dictionary{{"timeout", "Second-100"}}, 240));
+  EXPECT_TRUE(vtc::client::abandonedLock(vtc::Dictionary{{"timeout", "Second-90"}}, 240));
 }
 
 TEST_F(Messages, AdviceFitsWhatTheUserDid) {
