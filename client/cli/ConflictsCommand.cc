@@ -21,6 +21,7 @@
 #include "client/run/FolderWrite.h"
 #include "client/run/SharedConflicts.h"
 #include "client/run/SyncFailure.h"
+#include "client/run/SyncOwner.h"
 #include "client/stores/VdirCollection.h"
 #include "common/Format.h"
 
@@ -112,6 +113,8 @@ void restore(const KeptConflict& c) {
   auto collection = configuredCollection(c.dataclass);
   if (!collection)
     throw SyncFailure(FailureKind::Usage, c.dataclass + " is no longer synced on this computer.");
+  // A sync writes the folder too, and removes temporary files it finds there.
+  auto owner = SyncOwner::acquire();
   VdirCollection folder(collection->folder, collection->kind);
   // The file that holds the record now: it may have been renamed since.
   std::string file = c.file;

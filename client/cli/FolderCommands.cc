@@ -16,6 +16,8 @@ int addCommand(const std::string& kindWordGiven, const std::string& folder,
   if (!kind)
     throw SyncFailure(FailureKind::Usage,
                       "\"" + kindWordGiven + "\" is no kind of folder; use contacts or calendars.");
+  // Before anything is made: the name becomes paths on the share and here.
+  if (dataclass) requirePlainDataclassName(*dataclass);
   std::error_code error;
   // A "~" that reached us (quoted, or from a script) means the home, as in a shell.
   std::filesystem::path path = std::filesystem::absolute(paths::expandTilde(folder), error);

@@ -2,7 +2,9 @@
 
 #include "VantorSyncManager/PublicNames.h"
 #include "client/run/SyncFailure.h"
+#include "common/Logging.h"
 #include "platform/prefs/PreferenceStore.h"
+#include "session/DataclassName.h"
 
 namespace vtc::client {
 
@@ -37,9 +39,24 @@ const char* kindWord(ItemKind kind) {
   return kind == ItemKind::Contacts ? "contacts" : "calendars";
 }
 
+void requirePlainDataclassName(const std::string& dataclass) {
+  const std::string problem = dataclassNameProblem(dataclass);
+  if (!problem.empty())
+    throw SyncFailure(FailureKind::Usage,
+                      "A dataclass name is a plain name of letters, digits, '.', '_' and '-', "
+                      "not starting with '.' and at most " +
+                          std::to_string(kMaxDataclassNameLength) +
+                          " long; this one is not: " + problem + ".");
+}
+
 std::vector<Collection> configuredCollections() {
   std::vector<Collection> all;
   for (const auto& [dataclass, entry] : stored()) {
+    if (!isPlainDataclassName(dataclass)) {
+      VTC_LOG_WARNING("Ignoring a synced folder whose dataclass name is not plain: %@",
+                      dataclassNameProblem(dataclass));
+      continue;
+    }
     auto kind = kindFromWord(entry.dictionary().get("Kind").string());
     const std::string& folder = entry.dictionary().get("Folder").string();
     if (kind && !folder.empty()) all.push_back({dataclass, *kind, folder});
@@ -54,6 +71,7 @@ std::optional<Collection> configuredCollection(const std::string& dataclass) {
 }
 
 void addCollection(const Collection& collection) {
+  requirePlainDataclassName(collection.dataclass);
   Dictionary all = stored();
   if (all.contains(collection.dataclass))
     throw SyncFailure(FailureKind::Usage,

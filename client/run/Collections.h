@@ -25,8 +25,14 @@ const char* kindWord(ItemKind kind);
 
 std::vector<Collection> configuredCollections();
 std::optional<Collection> configuredCollection(const std::string& dataclass);
-// Adds a collection; raises SyncFailure (Usage) when the dataclass or the
-// folder is already synced.
+// Adds a collection; raises SyncFailure (Usage) when the name is not plain,
+// or the dataclass or the folder is already synced.
+// Raises SyncFailure (Usage) with a sentence when the name is not a plain
+// dataclass name (see session/DataclassName.h).
+void requirePlainDataclassName(const std::string& dataclass);
+
+// The folders kept in the preferences; an entry whose name is not a plain
+// dataclass name is left out (Warning logged).
 void addCollection(const Collection& collection);
 // Stops syncing a dataclass; false when it was not synced.
 bool removeCollection(const std::string& dataclass);

@@ -10,6 +10,7 @@
 #include "client/items/ItemRecord.h"
 #include "client/run/FailureText.h"
 #include "client/run/ForeignLocks.h"
+#include "client/run/Housekeeping.h"
 #include "client/run/SyncFailure.h"
 #include "common/Clock.h"
 #include "common/Logging.h"
@@ -116,6 +117,13 @@ DataclassSync::Local DataclassSync::readLocal() {
       // Instances keep the keys the file, or else the truth, gave them.
       const Dictionary* previous = record.before ? &*record.before : truth ? &*truth : nullptr;
       now = toRecord(record.now->text, record.file, previous);
+      // The record holds what the file said: its bytes are not needed again,
+      // and the folder is held once, not twice.
+      if (auto f = local.folder.scan.read.find(record.file);
+          f != local.folder.scan.read.end() && f->second.get() == record.now) {
+        f->second->text = ItemText();
+        std::string().swap(f->second->bytes);
+      }
     }
     merge::Merged version = merge::localVersion(collection_.kind, truth, record.before, now);
     if (!merge::sameRecord(version.record, truth)) {
@@ -137,6 +145,7 @@ DataclassOutcome DataclassSync::run(const std::optional<DataclassRecord>& listed
                           " is missing; create it, or stop syncing it with `nubilosyncclient "
                           "remove " +
                           dataclass + "`.");
+  if (!options_.dryRun) removeFolderLeftovers(folder_);
 
   Local local = readLocal();
   // The guard for what goes out, before anything is written anywhere.
@@ -233,12 +242,20 @@ DataclassOutcome DataclassSync::run(const std::optional<DataclassRecord>& listed
                        *record.maxversion < *state.index || (needsTruth && !resumed));
     Incoming incoming = fetch(slow, record, state, local);
     incoming.stateChanged = resumed;
+    // The fetch may have set a record right that named a changelog the
+    // share lacks: the commit goes after what the share really holds, or it
+    // would leave a hole that every computer then takes for damage.
+    record = incoming.record;
     Plan plan = decide(local, incoming, record);
     origins = plan.origins;
     guardDeletes(local, plan);
     outcome_.sentChanges = plan.send.size();
     outcome_.filesWritten = plan.takes.size();
     if (!options_.dryRun) {
+      // What runs cut short left on the share is looked for by syncs that
+      // commit only: such a run sends its changes again, and leftovers can
+      // wait for a commit more cheaply than every fetch can list them.
+      if (!plan.send.empty()) removeShareLeftovers(session_, dataclass, record);
       // A long history is written again before this computer's changes go
       // out, as the truth the share holds now: computers that took it in
       // go on from it.

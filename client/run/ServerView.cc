@@ -6,6 +6,7 @@
 #include "VantorSyncManager/PublicNames.h"
 #include "common/Format.h"
 #include "platform/dav/DavPaths.h"
+#include "session/DataclassName.h"
 
 namespace vtc::client {
 
@@ -61,7 +62,7 @@ ServerView ServerView::read(NubiloRemoteSession& session) {
   const std::string self = davpath::canonical(session.schemasPath());
   for (const auto& [href, properties] : t.result().dictionary()) {
     const std::string path = davpath::canonical(davpath::fromHref(href));
-    if (path == self) continue;
+    if (path == self || !isPlainDataclassName(davpath::lastComponent(path))) continue;
     Dictionary record;
     for (const auto& [name, value] : properties.dictionary())
       if (name.size() > ns.size() && name.compare(0, ns.size(), ns) == 0)

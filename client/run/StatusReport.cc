@@ -73,7 +73,9 @@ void askTheShare(StatusReport& status) {
                             std::nullopt,
                             {}};
     if (c.get("lastsync").isString()) computer.lastSync = c.get("lastsync").string();
-    auto report = reports.find(c.get("machineguid").string());
+    // A computer without a host UUID stores its report under its guid.
+    const std::string machine = c.get("machineguid").string();
+    auto report = reports.find(machine.empty() ? c.get("guid").string() : machine);
     if (report != reports.end()) computer.report = report->second;
     status.computers.push_back(std::move(computer));
   }

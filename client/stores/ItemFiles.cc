@@ -1,11 +1,14 @@
 #include "client/stores/ItemFiles.h"
 
 #include <fcntl.h>
+#include <sys/stat.h>
 #include <unistd.h>
 
+#include <cctype>
+#include <cerrno>
 #include <cstdio>
 
-#include <cerrno>
+#include "common/Uuid.h"
 
 namespace vtc::client {
 
@@ -35,8 +38,34 @@ bool isItemFileName(std::string_view name, ItemKind kind) {
   return !name.starts_with('.') && name.size() > extension.size() && name.ends_with(extension);
 }
 
+namespace {
+
+constexpr std::string_view kTemporaryEnd = ".tmp";
+constexpr size_t kUuidLength = 36;  // 8-4-4-4-12 hexadecimal digits
+
+}  // namespace
+
+std::string newTemporaryName() {
+  return "." + makeUUIDString() + std::string(kTemporaryEnd);
+}
+
+bool isTemporaryName(std::string_view name) {
+  if (name.size() != 1 + kUuidLength + kTemporaryEnd.size() || !name.starts_with('.') ||
+      !name.ends_with(kTemporaryEnd))
+    return false;
+  const std::string_view uuid = name.substr(1, kUuidLength);
+  for (size_t i = 0; i < uuid.size(); ++i) {
+    const bool dash = i == 8 || i == 13 || i == 18 || i == 23;
+    if (dash ? uuid[i] != '-' : !std::isxdigit(static_cast<unsigned char>(uuid[i]))) return false;
+  }
+  return true;
+}
+
 std::optional<std::string> readWhole(int fd) {
   std::string bytes;
+  // Sized once from the file's length: a grown string holds up to twice it.
+  struct stat st {};
+  if (::fstat(fd, &st) == 0 && st.st_size > 0) bytes.reserve(static_cast<size_t>(st.st_size));
   char buffer[16384];
   for (;;) {
     ssize_t n = ::read(fd, buffer, sizeof buffer);

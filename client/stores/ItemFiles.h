@@ -36,6 +36,11 @@ ItemState fileState(const struct stat& st);
 // not hidden (temporary files of writes start with '.').
 bool isItemFileName(std::string_view name, ItemKind kind);
 
+// A fresh name for the temporary file of a write (".<uuid>.tmp"), and
+// whether a folder entry bears such a name.
+std::string newTemporaryName();
+bool isTemporaryName(std::string_view name);
+
 // The bytes of an open file, read to its end; none on a read error.
 std::optional<std::string> readWhole(int fd);
 

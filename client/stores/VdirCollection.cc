@@ -1,6 +1,5 @@
 #include "client/stores/VdirCollection.h"
 
-#include <dirent.h>
 #include <fcntl.h>
 #include <sys/stat.h>
 
@@ -18,10 +17,6 @@ namespace vtc::client {
 
 namespace {
 
-struct DirectoryCloser {
-  void operator()(DIR* d) const { ::closedir(d); }
-};
-
 std::runtime_error unreadableFolder(const std::string& folder, int error) {
   if (error == ENOENT) return std::runtime_error(format("The folder %@ does not exist.", folder));
   if (error == ENOTDIR) return std::runtime_error(format("%@ is not a folder.", folder));
@@ -30,17 +25,11 @@ std::runtime_error unreadableFolder(const std::string& folder, int error) {
 
 // The names of the folder's item files, sorted. A listing cut short by an
 // error raises: it would make every file after the error look deleted.
-std::vector<std::string> itemFileNames(DIR* dir, const std::string& folder, ItemKind kind) {
+std::vector<std::string> itemFileNames(FileLayer& files, int dir, const std::string& folder,
+                                       ItemKind kind) {
   std::vector<std::string> names;
-  for (;;) {
-    errno = 0;
-    const dirent* entry = ::readdir(dir);
-    if (!entry) {
-      if (errno != 0) throw unreadableFolder(folder, errno);
-      break;
-    }
-    if (isItemFileName(entry->d_name, kind)) names.emplace_back(entry->d_name);
-  }
+  if (!files.list(dir, names)) throw unreadableFolder(folder, errno);
+  std::erase_if(names, [&](const std::string& name) { return !isItemFileName(name, kind); });
   std::sort(names.begin(), names.end());
   return names;
 }
@@ -52,29 +41,24 @@ std::vector<std::string> itemFileNames(DIR* dir, const std::string& folder, Item
 // caller moves into result.states.
 class FileScan {
  public:
-  FileScan(const std::string& folder, ItemKind kind, int dirFd, ScanResult& result)
-      : folder_(folder), kind_(kind), dirFd_(dirFd), result_(result) {}
+  FileScan(const std::string& folder, ItemKind kind, FileLayer& files, int dirFd,
+           ScanResult& result)
+      : folder_(folder), kind_(kind), files_(files), dirFd_(dirFd), result_(result) {}
 
   bool keepsKnownState(const std::string& name, const ItemState* known) {
     struct stat st {};
-    if (::fstatat(dirFd_, name.c_str(), &st, 0) != 0) {
+    if (files_.stat(dirFd_, name, &st) != 0) {
       if (errno == ENOENT) return false;  // removed since the listing, so gone
       return skip(name, known, strerror(errno));
     }
     if (!S_ISREG(st.st_mode)) return false;
     if (known && known->sameFileAs(fileState(st))) return true;
 
-    FileDescriptor file(::openat(dirFd_, name.c_str(), O_RDONLY | O_CLOEXEC));
     auto item = std::make_unique<ItemFile>();
-    bool ok = false;
-    // The state of what is read: a change after this fstat shows at the next scan.
-    if (file.valid() && ::fstat(file.get(), &st) == 0) {
-      if (auto bytes = readWhole(file.get())) {
-        item->bytes = std::move(*bytes);
-        ok = true;
-      }
-    }
-    if (!ok) return errno != ENOENT && skip(name, known, strerror(errno));
+    // The state of what is read: a change after it shows at the next scan.
+    std::optional<std::string> bytes = files_.read(dirFd_, name, &st);
+    if (!bytes) return errno != ENOENT && skip(name, known, strerror(errno));
+    item->bytes = std::move(*bytes);
     ++result_.filesRead;
     std::string problem;
     std::optional<ItemText> text = readItemText(kind_, item->bytes, &problem);
@@ -89,6 +73,7 @@ class FileScan {
  private:
   const std::string& folder_;
   ItemKind kind_;
+  FileLayer& files_;
   int dirFd_;
   ScanResult& result_;
 
@@ -104,7 +89,7 @@ class FileScan {
 }  // namespace
 
 VdirCollection::VdirCollection(std::string folder, ItemKind kind)
-    : folder_(std::move(folder)), kind_(kind) {}
+    : folder_(std::move(folder)), kind_(kind), files_(&currentFileLayer()) {}
 
 bool VdirCollection::exists() const {
   struct stat st {};
@@ -112,14 +97,14 @@ bool VdirCollection::exists() const {
 }
 
 ScanResult VdirCollection::scan(std::map<std::string, ItemState> known) const {
-  std::unique_ptr<DIR, DirectoryCloser> dir(::opendir(folder_.c_str()));
-  if (!dir) throw unreadableFolder(folder_, errno);
+  FileDescriptor dir(files_->openFolder(folder_));
+  if (!dir.valid()) throw unreadableFolder(folder_, errno);
   ScanResult result;
-  FileScan files(folder_, kind_, ::dirfd(dir.get()), result);
+  FileScan files(folder_, kind_, *files_, dir.get(), result);
   // Names and known states both in order: one walk matches them. A state
   // that still holds moves over whole.
   auto before = known.begin();
-  for (const std::string& name : itemFileNames(dir.get(), folder_, kind_)) {
+  for (const std::string& name : itemFileNames(*files_, dir.get(), folder_, kind_)) {
     while (before != known.end() && before->first < name) ++before;
     bool isKnown = before != known.end() && before->first == name;
     if (files.keepsKnownState(name, isKnown ? &before->second : nullptr))
@@ -135,9 +120,8 @@ ScanResult VdirCollection::scan(std::map<std::string, ItemState> known) const {
 
 std::optional<std::string> VdirCollection::read(const std::string& name) const {
   if (!isItemFileName(name, kind_) || name.find('/') != std::string::npos) return std::nullopt;
-  FileDescriptor file(::open(paths::join(folder_, name).c_str(), O_RDONLY | O_CLOEXEC));
-  if (!file.valid()) return std::nullopt;
-  return readWhole(file.get());
+  struct stat st {};
+  return files_->read(AT_FDCWD, paths::join(folder_, name), &st);
 }
 
 bool ItemState::sameFileAs(const ItemState& other) const {
@@ -147,7 +131,7 @@ bool ItemState::sameFileAs(const ItemState& other) const {
 
 std::optional<ItemState> VdirCollection::stat(const std::string& name) const {
   struct stat st {};
-  if (::stat(paths::join(folder_, name).c_str(), &st) != 0) return std::nullopt;
+  if (files_->stat(AT_FDCWD, paths::join(folder_, name), &st) != 0) return std::nullopt;
   return fileState(st);
 }
 

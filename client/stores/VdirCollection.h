@@ -24,6 +24,7 @@
 
 #include "VantorSyncManager/Value.h"
 #include "client/items/ItemText.h"
+#include "client/stores/FileLayer.h"
 #include "client/stores/VdirItem.h"
 
 namespace vtc::client {
@@ -66,6 +67,7 @@ enum class WriteOutcome { Written, Removed, SkippedChangedOnDisk, Failed };
 
 class VdirCollection {
  public:
+  // Its files are reached through the file layer current now.
   VdirCollection(std::string folder, ItemKind kind);
 
   const std::string& folder() const { return folder_; }
@@ -92,6 +94,11 @@ class VdirCollection {
   // is gone already counts as Removed.
   WriteOutcome remove(const std::string& name, const ItemState& expected) const;
 
+  // Removes the temporary files that writes cut short left in the folder
+  // (no write may be under way); how many went. A file that cannot be
+  // removed is logged and left for the next time.
+  size_t removeTemporaryLeftovers() const;
+
   // Many writes in a row: each write and removal skips its own flushes, and
   // flush() then makes all of them durable at once (one sync of the file
   // system instead of two per file). Until flush() returns true, a power
@@ -106,6 +113,7 @@ class VdirCollection {
  private:
   std::string folder_;
   ItemKind kind_;
+  FileLayer* files_;
   bool deferFlushes_ = false;
 };
 

@@ -18,7 +18,6 @@
 #include "client/stores/ItemFiles.h"
 #include "client/stores/VdirCollection.h"
 #include "common/Logging.h"
-#include "common/Uuid.h"
 #include "platform/fs/LocalPaths.h"
 
 namespace vtc::client {
@@ -38,10 +37,10 @@ enum class OnDisk { AsExpected, Changed, Gone, Unknown };
 
 // Whether the file `name` is still as `expected` says (none: absent); its
 // permission bits go to *mode.
-OnDisk compareWithDisk(int dirFd, const std::string& name, const std::optional<ItemState>& expected,
-                       mode_t* mode = nullptr) {
+OnDisk compareWithDisk(FileLayer& files, int dirFd, const std::string& name,
+                       const std::optional<ItemState>& expected, mode_t* mode = nullptr) {
   struct stat st {};
-  if (::fstatat(dirFd, name.c_str(), &st, 0) != 0) {
+  if (files.stat(dirFd, name, &st) != 0) {
     if (errno != ENOENT) return OnDisk::Unknown;
     return expected ? OnDisk::Gone : OnDisk::AsExpected;
   }
@@ -70,39 +69,39 @@ WriteOutcome VdirCollection::write(const std::string& name, const std::string& b
     return WriteOutcome::SkippedChangedOnDisk;
   };
 
-  FileDescriptor dir(::open(folder_.c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC));
+  FileLayer& files = *files_;
+  FileDescriptor dir(files.openFolder(folder_));
   if (!dir.valid()) return failed("opening the folder");
   mode_t mode = kNewFileMode;
-  OnDisk before = compareWithDisk(dir.get(), name, expected, &mode);
+  OnDisk before = compareWithDisk(files, dir.get(), name, expected, &mode);
   if (before == OnDisk::Unknown) return failed("examining the file");
   if (before != OnDisk::AsExpected) return skipped();
 
-  std::string temporary = "." + makeUUIDString() + ".tmp";
-  FileDescriptor file(
-      ::openat(dir.get(), temporary.c_str(), O_WRONLY | O_CREAT | O_EXCL | O_CLOEXEC, mode));
+  const std::string temporary = newTemporaryName();
+  FileDescriptor file(files.createTemporary(dir.get(), temporary, mode));
   if (!file.valid()) return failed("creating a temporary file");
-  // The name is ours alone (O_EXCL), so it can go on every way out.
+  // The name is ours alone (created exclusively), so it can go on every way out.
   struct TemporaryName {
+    FileLayer& files;
     int dirFd;
     const std::string& name;
     bool placed = false;
     ~TemporaryName() {
-      if (!placed) ::unlinkat(dirFd, name.c_str(), 0);
+      if (!placed) files.unlink(dirFd, name);
     }
-  } cleanup{dir.get(), temporary};
+  } cleanup{files, dir.get(), temporary};
 
   if (::fchmod(file.get(), mode) != 0) return failed("setting the permissions");
-  if (!writeWhole(file.get(), bytes)) return failed("writing");
-  if (!deferFlushes_ && ::fsync(file.get()) != 0) return failed("flushing");
+  if (!files.write(file.get(), bytes)) return failed("writing");
+  if (!deferFlushes_ && files.syncFile(file.get()) != 0) return failed("flushing");
 
   // Writing took time: look again, right before the rename.
-  OnDisk now = compareWithDisk(dir.get(), name, expected);
+  OnDisk now = compareWithDisk(files, dir.get(), name, expected);
   if (now == OnDisk::Unknown) return failed("examining the file");
   if (now != OnDisk::AsExpected) return skipped();
   if (expected) {
-    if (::renameat(dir.get(), temporary.c_str(), dir.get(), name.c_str()) != 0)
-      return failed("renaming");
-  } else if (!placeNewFile(dir.get(), temporary, name)) {
+    if (files.rename(dir.get(), temporary, name) != 0) return failed("renaming");
+  } else if (files.renameNoReplace(dir.get(), temporary, name) != 0) {
     if (errno == EEXIST) return skipped();
     return failed("renaming");
   }
@@ -114,7 +113,7 @@ WriteOutcome VdirCollection::write(const std::string& name, const std::string& b
   if (!file.close()) return failed("closing");
   // Until the folder is flushed, a crash can bring back the old file; the
   // caller must then not take the new state as written.
-  if (!deferFlushes_ && ::fsync(dir.get()) != 0) return failed("flushing the folder");
+  if (!deferFlushes_ && files.syncFolder(dir.get()) != 0) return failed("flushing the folder");
   if (state) *state = fileState(st);
   return WriteOutcome::Written;
 }
@@ -126,23 +125,46 @@ WriteOutcome VdirCollection::remove(const std::string& name, const ItemState& ex
     VTC_LOG_ERROR("Could not remove %@ (%s): %s", path, step, strerror(errno));
     return WriteOutcome::Failed;
   };
-  FileDescriptor dir(::open(folder_.c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC));
+  FileLayer& files = *files_;
+  FileDescriptor dir(files.openFolder(folder_));
   if (!dir.valid()) return failed("opening the folder");
-  OnDisk before = compareWithDisk(dir.get(), name, expected);
+  OnDisk before = compareWithDisk(files, dir.get(), name, expected);
   if (before == OnDisk::Unknown) return failed("examining the file");
   if (before == OnDisk::Gone) return WriteOutcome::Removed;  // nothing left to keep
   if (before == OnDisk::Changed) {
     VTC_LOG_INFO("Not removing %@: it changed on disk since it was last read", path);
     return WriteOutcome::SkippedChangedOnDisk;
   }
-  if (::unlinkat(dir.get(), name.c_str(), 0) != 0 && errno != ENOENT) return failed("unlinking");
-  if (!deferFlushes_ && ::fsync(dir.get()) != 0) return failed("flushing the folder");
+  if (files.unlink(dir.get(), name) != 0 && errno != ENOENT) return failed("unlinking");
+  if (!deferFlushes_ && files.syncFolder(dir.get()) != 0) return failed("flushing the folder");
   return WriteOutcome::Removed;
 }
 
+size_t VdirCollection::removeTemporaryLeftovers() const {
+  FileDescriptor dir(files_->openFolder(folder_));
+  std::vector<std::string> names;
+  if (!dir.valid() || !files_->list(dir.get(), names)) {
+    VTC_LOG_WARNING("Could not look for leftover temporary files in %@: %s", folder_,
+                    strerror(errno));
+    return 0;
+  }
+  size_t removed = 0;
+  for (const std::string& name : names) {
+    if (!isTemporaryName(name)) continue;
+    if (files_->unlink(dir.get(), name) != 0 && errno != ENOENT) {
+      VTC_LOG_WARNING("Could not remove the leftover %@: %s", paths::join(folder_, name),
+                      strerror(errno));
+      continue;
+    }
+    VTC_LOG_INFO("Removed the leftover %@ of a write cut short", paths::join(folder_, name));
+    ++removed;
+  }
+  return removed;
+}
+
 bool VdirCollection::flush() const {
-  FileDescriptor dir(::open(folder_.c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC));
-  if (!dir.valid() || ::syncfs(dir.get()) != 0) {
+  FileDescriptor dir(files_->openFolder(folder_));
+  if (!dir.valid() || files_->syncFileSystem(dir.get()) != 0) {
     VTC_LOG_ERROR("Could not flush the writes in %@: %s", folder_, strerror(errno));
     return false;
   }

@@ -88,8 +88,11 @@ class VSM_EXPORT VTCPrefsCenter {
   // minimum.
   int32_t automaticallySyncInterval();
   bool syncNotificationsGloballyEnabled();
-  // Installs the bookmarks job unless its file exists; false when the
-  // browser's sync client is not found or the job cannot be written.
+  // Installs the bookmarks job unless its file exists (true then). False
+  // when the browser's sync client is not found, the job folder cannot be
+  // made, or something other than a file stands at the job file's path. A
+  // refused submission is an Error line and still true, and so is a job
+  // file that could not be written (the job is submitted all the same).
   bool checkBookmarksPlistAndCreateIfNecessary();
 
   // The client configuration, built once per process.

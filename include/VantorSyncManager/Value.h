@@ -1,7 +1,9 @@
 // vtc::Value: one property-list value (string, integer, real, boolean, date,
 // data, array, dictionary, or none), and vtc::Dictionary, an insertion-ordered
 // map from strings to values. Values are plain copyable data; a Value is not
-// safe for concurrent mutation, concurrent reads are fine.
+// safe for concurrent mutation, concurrent reads are fine. Strings and data
+// never change once made, so large ones are shared between copies: a photo
+// held by a record, its change and its merge is in memory once.
 #pragma once
 
 #include <chrono>
@@ -92,7 +94,7 @@ class VSM_EXPORT Value {
   Value(double v) : v_(v) {}
   Value(bool v) : v_(v) {}
   Value(Date d) : v_(d) {}
-  Value(Bytes b) : v_(std::move(b)) {}
+  Value(Bytes b);
   Value(Array a);
   Value(Dictionary d);
   Value(const Value& other);
@@ -132,9 +134,13 @@ class VSM_EXPORT Value {
 
  private:
   // Containers are held in place: a decoded dictionary costs one allocation
-  // (its entries), not two.
-  using Storage = std::variant<std::monostate, std::string, int64_t, double, bool, Date, Bytes,
-                               Array, Dictionary>;
+  // (its entries), not two. Strings and data of kSharedSize bytes or more
+  // are held shared (the last two kinds).
+  using Storage =
+      std::variant<std::monostate, std::string, int64_t, double, bool, Date, Bytes, Array,
+                   Dictionary, std::shared_ptr<const std::string>, std::shared_ptr<const Bytes>>;
+  static constexpr size_t kSharedSize = 1024;
+  const std::string* stringIfAny() const;
   Storage v_;
 };
 

@@ -18,6 +18,9 @@
 
 namespace vtc {
 
+// The shortest text that reads back as the same number ("0.1", "2.5", "1e+20").
+std::string shortestText(double v);
+
 // Text forms used by "%@".
 inline std::string textOf(const std::string& s) {
   return s;
@@ -40,6 +43,8 @@ template <typename T>
 requires std::is_arithmetic_v<T> std::string textOf(T v) {
   if constexpr (std::is_same_v<T, bool>)
     return v ? "1" : "0";
+  else if constexpr (std::is_floating_point_v<T>)
+    return shortestText(static_cast<double>(v));
   else
     return std::to_string(v);
 }

@@ -1,6 +1,8 @@
-// _VTCLog and initVTCLogger. The three process-wide statics are never freed;
+// _VTCLog and the line writer. The process-wide statics are never freed;
 // the once-guard and the lazy open are deliberately unsynchronised (a second
-// initialisation in a race only repeats the same work).
+// initialisation in a race only repeats the same work). What the log is set
+// up with (level, file, rolling) comes from initVTCLogger, which reads it
+// from the preferences and hands it to configure().
 #include <fcntl.h>
 #include <pthread.h>
 #include <sys/stat.h>
@@ -18,29 +20,15 @@
 #include "common/Clock.h"
 #include "common/Logging.h"
 #include "common/Utf8.h"
-#include "platform/fs/LocalPaths.h"
-#include "platform/prefs/PreferenceFiles.h"
-#include "platform/workspace/ApplicationLookup.h"
 
 namespace {
 
 bool loggerInited = false;
 int32_t currentLogLevel = 0;
 int32_t logFile = 0;
+std::string logPath;  // set by configure
 
-constexpr const char* kLogPath = "~/Library/Logs/Sync/nubilosync.log";
-constexpr const char* kPreferenceDomain = "com.korvo.VantorSync";
 constexpr off_t kRollSize = 4194305;  // more than 4 MiB
-
-int levelFromWord(const std::string& word) {
-  if (strcasecmp(word.c_str(), "debug") == 0) return 3;
-  if (strcasecmp(word.c_str(), "info") == 0) return 2;
-  if (strcasecmp(word.c_str(), "warn") == 0) return 1;
-  if (strcasecmp(word.c_str(), "error") == 0) return 0;
-  // "verbose" silences everything, errors included; kept as configured.
-  if (strcasecmp(word.c_str(), "verbose") == 0) return -1;
-  return 1;
-}
 
 const char* levelWord(int level) {
   switch (level) {
@@ -61,8 +49,7 @@ std::string rolledPath(const std::string& path) {
   return path.substr(0, path.size() - std::strlen("log")) + "0.log";
 }
 
-void rollIfLarge() {
-  std::string path = vtc::log::logFilePath();
+void rollIfLarge(const std::string& path) {
   struct stat st {};
   if (::stat(path.c_str(), &st) != 0 || st.st_size < kRollSize) return;
   std::string old = rolledPath(path);
@@ -125,22 +112,6 @@ std::string cFormat(const char* format) {
 
 }  // namespace
 
-extern "C" VSM_EXPORT void initVTCLogger(void) {
-  if (loggerInited) return;
-  setlogmask(0xFF);
-  vtc::Value level = vtc::prefs::copyAppValue("LoggingLevel", kPreferenceDomain);
-  if (level.isNone()) {
-    // A computer with the internal bug-reporting tool installed logs Info.
-    if (vtc::workspace::applicationInstalled("Ticketer.app")) currentLogLevel = 2;
-  } else {
-    currentLogLevel = levelFromWord(level.isString() ? level.string() : level.description());
-  }
-  vtc::Value roll = vtc::prefs::copyAppValue("RollLogs", kPreferenceDomain);
-  if (roll.isNone() || roll.boolean()) rollIfLarge();
-  loggerInited = true;
-  setlogmask(0xFF);
-}
-
 extern "C" VSM_EXPORT void _VTCLog(const char* file, int line, const char* function, int level,
                                    const char* format, ...) {
   initVTCLogger();
@@ -165,17 +136,23 @@ bool wants(int level) {
   return currentLogLevel >= level;
 }
 
-std::string logFilePath() {
-  return paths::expandTilde(kLogPath);
+void configure(int level, const std::string& file, bool roll) {
+  setlogmask(0xFF);
+  currentLogLevel = level;
+  logPath = file;
+  if (roll) rollIfLarge(file);
+  loggerInited = true;
+  setlogmask(0xFF);
+}
+
+bool configured() {
+  return loggerInited;
 }
 
 void writeLine(const char* file, int line, const char* function, int level,
                std::string_view message) {
   if (logFile == 0) {
-    std::string path = logFilePath();
-    std::string folder = path.substr(0, path.find_last_of('/'));
-    paths::makeDirectories(folder, 0755);  // a failure shows up as a failed open
-    int fd = ::open(path.c_str(), O_RDWR | O_APPEND | O_CREAT | O_CLOEXEC, 0600);
+    int fd = ::open(logPath.c_str(), O_RDWR | O_APPEND | O_CREAT | O_CLOEXEC, 0600);
     if (fd == 0) return;
     logFile = fd;  // -1 when the open failed: lines are dropped from now on
   }

@@ -19,7 +19,16 @@ bool wants(int level);
 void writeLine(const char* file, int line, const char* function, int level,
                std::string_view message);
 
-// The log file path for this process's $HOME.
+// Sets the log up for the process: lines are written up to `level` into
+// `file` (whose folder exists), rolled first when `roll` is set and the file
+// has grown past 4 MiB. initVTCLogger calls it once, with what the
+// preferences say.
+void configure(int level, const std::string& file, bool roll);
+// Whether configure has run (since the last resetForTesting).
+bool configured();
+
+// The log file for this process's $HOME, the one initVTCLogger hands to
+// configure (defined beside it).
 std::string logFilePath();
 
 // Closes the file and forgets the configured level, so that the next line

@@ -8,6 +8,8 @@
 #include <ctime>
 #include <unordered_map>
 
+#include "common/Format.h"
+
 namespace vtc {
 
 namespace {
@@ -76,8 +78,7 @@ std::string describe(const Value& v, int level) {
     case Value::Kind::Integer:
       return std::to_string(v.integer());
     case Value::Kind::Real:
-      std::snprintf(buf, sizeof buf, "%.17g", v.real());
-      return buf;
+      return shortestText(v.real());
     case Value::Kind::Boolean:
       return v.boolean() ? "1" : "0";
     case Value::Kind::Date: {
@@ -115,11 +116,22 @@ std::string describe(const Value& v, int level) {
 
 }  // namespace
 
-Value::Value(const char* s) : v_(s ? std::string(s) : std::string()) {
+Value::Value(const char* s) : Value(s ? std::string_view(s) : std::string_view()) {
   if (!s) v_ = std::monostate{};
 }
-Value::Value(std::string s) : v_(std::move(s)) {}
-Value::Value(std::string_view s) : v_(std::string(s)) {}
+Value::Value(std::string s) {
+  if (s.size() >= kSharedSize)
+    v_ = std::make_shared<const std::string>(std::move(s));
+  else
+    v_ = std::move(s);
+}
+Value::Value(std::string_view s) : Value(std::string(s)) {}
+Value::Value(Bytes b) {
+  if (b.size() >= kSharedSize)
+    v_ = std::make_shared<const Bytes>(std::move(b));
+  else
+    v_ = std::move(b);
+}
 Value::Value(Array a) : v_(std::move(a)) {}
 Value::Value(Dictionary d) : v_(std::move(d)) {}
 
@@ -147,13 +159,23 @@ Value::Kind Value::kind() const {
       return Kind::Data;
     case 7:
       return Kind::Array;
-    default:
+    case 8:
       return Kind::Dictionary;
+    case 9:
+      return Kind::String;
+    default:
+      return Kind::Data;
   }
 }
 
+const std::string* Value::stringIfAny() const {
+  if (auto* s = std::get_if<std::string>(&v_)) return s;
+  if (auto* shared = std::get_if<std::shared_ptr<const std::string>>(&v_)) return shared->get();
+  return nullptr;
+}
+
 const std::string& Value::string() const {
-  auto* s = std::get_if<std::string>(&v_);
+  const std::string* s = stringIfAny();
   return s ? *s : kEmptyString;
 }
 
@@ -161,7 +183,7 @@ int64_t Value::integer() const {
   if (auto* i = std::get_if<int64_t>(&v_)) return *i;
   if (auto* d = std::get_if<double>(&v_)) return static_cast<int64_t>(*d);
   if (auto* b = std::get_if<bool>(&v_)) return *b ? 1 : 0;
-  if (auto* s = std::get_if<std::string>(&v_)) return leadingInteger(*s);
+  if (auto* s = stringIfAny()) return leadingInteger(*s);
   return 0;
 }
 
@@ -169,7 +191,7 @@ double Value::real() const {
   if (auto* d = std::get_if<double>(&v_)) return *d;
   if (auto* i = std::get_if<int64_t>(&v_)) return static_cast<double>(*i);
   if (auto* b = std::get_if<bool>(&v_)) return *b ? 1.0 : 0.0;
-  if (auto* s = std::get_if<std::string>(&v_)) return std::strtod(s->c_str(), nullptr);
+  if (auto* s = stringIfAny()) return std::strtod(s->c_str(), nullptr);
   return 0.0;
 }
 
@@ -177,7 +199,7 @@ bool Value::boolean() const {
   if (auto* b = std::get_if<bool>(&v_)) return *b;
   if (auto* i = std::get_if<int64_t>(&v_)) return *i != 0;
   if (auto* d = std::get_if<double>(&v_)) return *d != 0.0;
-  if (auto* s = std::get_if<std::string>(&v_)) {
+  if (auto* s = stringIfAny()) {
     // "YES", "true" or a non-zero leading number, skipping leading blanks.
     size_t i = s->find_first_not_of(" \t\n");
     if (i == std::string::npos) return false;
@@ -197,8 +219,9 @@ Date Value::date() const {
 }
 
 const Bytes& Value::data() const {
-  auto* b = std::get_if<Bytes>(&v_);
-  return b ? *b : kEmptyBytes;
+  if (auto* b = std::get_if<Bytes>(&v_)) return *b;
+  if (auto* shared = std::get_if<std::shared_ptr<const Bytes>>(&v_)) return **shared;
+  return kEmptyBytes;
 }
 
 const Array& Value::array() const {
@@ -231,7 +254,7 @@ bool operator==(const Value& a, const Value& b) {
     case Value::Kind::None:
       return true;
     case Value::Kind::String:
-      return a.string() == b.string();
+      return &a.string() == &b.string() || a.string() == b.string();
     case Value::Kind::Integer:
       return a.integer() == b.integer();
     case Value::Kind::Real:
@@ -241,7 +264,7 @@ bool operator==(const Value& a, const Value& b) {
     case Value::Kind::Date:
       return a.date() == b.date();
     case Value::Kind::Data:
-      return a.data() == b.data();
+      return &a.data() == &b.data() || a.data() == b.data();
     case Value::Kind::Array:
       return a.array() == b.array();
     case Value::Kind::Dictionary:

@@ -31,7 +31,6 @@ inline constexpr const char* kStorageConsumed = "StorageConsumed.";
 
 inline constexpr int32_t kDefaultSyncMode = 6;
 inline constexpr const char* kQueueFolder = "com.korvo.nubilo.queueddataclasses";
-inline constexpr const char* kSupportFolder = "NubiloSyncClient";
 
 inline std::string forDataclass(const char* prefix, const std::string& dataclass) {
   return prefix + dataclass;

@@ -24,11 +24,14 @@ void removeEngineLastSuccessfulSyncDate() {
 void setSyncsAfterOtherClients(bool on) {
   try {
     auto engine = engine::SyncEngine::open();
+    // No record yet: nothing to tell. Registering the client applies the
+    // stored choice (getNubiloClient).
+    if (!engine->hasClient(kVantorSyncClientId)) return;
     engine->setSyncsAfterClients(kVantorSyncClientId, on);
     engine->setShouldSynchronize(kVantorSyncClientId, on, {"app", "device", "peer"});
   } catch (const std::exception& e) {
-    // The preference is stored all the same; the engine learns it at the
-    // next change of the setting.
+    // The preference is stored all the same; the engine learns it when the
+    // client is registered again.
     VTC_LOG_ERROR("Could not tell the sync engine about syncing after other clients: %@", e.what());
   }
 }

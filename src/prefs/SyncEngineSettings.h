@@ -17,8 +17,10 @@ std::string strippedClientName(const std::string& name);
 std::optional<Date> engineLastSuccessfulSyncDate();
 void removeEngineLastSuccessfulSyncDate();
 
-// Tells the engine to sync this client after other clients, and to sync
-// with clients of the types "app", "device" and "peer", or neither.
+// Tells the engine's record of this client to sync after other clients,
+// and to sync with clients of the types "app", "device" and "peer", or
+// neither. Without a record it does nothing. An engine failure is an Error
+// line.
 void setSyncsAfterOtherClients(bool on);
 
 }  // namespace vtc

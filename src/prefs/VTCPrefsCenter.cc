@@ -2,12 +2,6 @@
 // account and maintenance.
 #include "VantorSyncManager/VTCPrefsCenter.h"
 
-#include <sys/stat.h>
-#include <unistd.h>
-
-#include <cerrno>
-#include <cstdio>
-#include <cstring>
 #include <mutex>
 
 #include "VantorSyncManager/PublicNames.h"
@@ -42,28 +36,7 @@ VTCPrefsCenter::~VTCPrefsCenter() {
 }
 
 std::optional<std::string> VTCPrefsCenter::applicationSupportDirectory() {
-  // Cached for the home it was made in (tests change homes within a process).
-  static std::mutex mutex;
-  static std::optional<std::string> cached;
-  static std::string cachedBase;
-  std::lock_guard<std::mutex> lock(mutex);
-  std::string base = vtc::paths::applicationSupportDirectory();
-  if (cached && base == cachedBase) return cached;
-  cachedBase = base;
-  cached.reset();
-  if (base.empty()) return std::nullopt;
-  std::string path = vtc::paths::join(base, keys::kSupportFolder);
-  struct stat st {};
-  if (::stat(path.c_str(), &st) == 0) {
-    if (S_ISDIR(st.st_mode)) return cached = path;
-    if (::unlink(path.c_str()) != 0) return std::nullopt;
-  }
-  if (!vtc::paths::makeDirectories(path, 0700)) {
-    std::fprintf(stderr, "createDirectoryAtPath:%s failed %s\n", path.c_str(),
-                 std::strerror(errno));
-    return std::nullopt;
-  }
-  return cached = path;
+  return vtc::paths::supportFolder();
 }
 
 vtc::Value VTCPrefsCenter::get(const std::string& key) {

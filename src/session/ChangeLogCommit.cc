@@ -3,17 +3,21 @@
 // After every step the server is in a state that a reader either does not
 // see (a stray temporary file) or can detect and repair (a record naming a
 // changelog that is not there yet).
+#include <unistd.h>
+
 #include <chrono>
 
 #include "VantorSyncManager/NubiloException.h"
 #include "VantorSyncManager/NubiloRemoteSession.h"
 #include "VantorSyncManager/PublicNames.h"
+#include "changelog/ChangeLogFileWriter.h"
 #include "common/Clock.h"
 #include "common/Logging.h"
 #include "common/Uuid.h"
 #include "platform/bus/DistributedNotifications.h"
 #include "platform/dav/TesselSession.h"
 #include "platform/engine/SyncEngine.h"
+#include "platform/fs/LocalPaths.h"
 
 namespace {
 
@@ -38,20 +42,29 @@ bool NubiloRemoteSession::commitChanges(const std::vector<SyncEngineChange>& cha
   const std::string finalPath = changeLogPathForDataclass(dataclass, index);
   std::string temporaryPath = temporaryPathFor(finalPath);
 
-  vtc::Bytes bytes;
+  // Written record by record into a file and sent from there: memory
+  // follows one record, not the whole changelog.
+  const std::string folder = vtc::paths::temporaryDirectory();
+  const std::string localPath =
+      vtc::paths::join(folder, ".changelog-" + vtc::makeUUIDString() + ".gz");
+  struct RemoveWhenDone {
+    const std::string& path;
+    ~RemoveWhenDone() { ::unlink(path.c_str()); }
+  } removeWhenDone{localPath};
   {
-    NubiloChangeLog changeLog(changes);
+    vtc::clog::ChangeLogFileWriter changeLog(folder);
     changeLog.setHeaderValue(_configuration.get("guid"), "CreatorClientGuid");
     changeLog.setHeaderValue(_configuration.get("ClientName"), "CreatorClientName");
     changeLog.setHeaderValue(
         vtc::Value(vtc::format("%ld", static_cast<long>(VantorSyncManagerVersionNumber))),
         "CreatorClientVersion");
     changeLog.setSchemaVersions(vtc::engine::SyncEngine::open()->schemaVersions(dataclass));
-    changeLog.writeToData(bytes);
+    for (const SyncEngineChange& change : changes) changeLog.append(change);
+    changeLog.finish(localPath);
   }
   VTC_LOG_INFO("%@ Uploading changeLog with index %d", dataclass, index);
 
-  DavTransaction upload = _TesselSession->putData(bytes, temporaryPath);
+  DavTransaction upload = _TesselSession->putLocalFileAtPath(localPath, temporaryPath);
   if (upload.errorType() == kNBTimeoutError) {
     temporaryPath = temporaryPathFor(finalPath);
     messageTraceTransactionFailure(upload, false, 0, kUploadTrace);
@@ -59,7 +72,7 @@ bool NubiloRemoteSession::commitChanges(const std::vector<SyncEngineChange>& cha
         "%@ Upload of changeLog with index %d failed due to timeout retrying with new tmp path "
         "%@...",
         dataclass, index, temporaryPath);
-    upload = _TesselSession->putData(bytes, temporaryPath);
+    upload = _TesselSession->putLocalFileAtPath(localPath, temporaryPath);
   }
   if (!upload.isSuccessful()) {
     VTC_LOG_ERROR("Failed to upload change log to path %@", finalPath);

@@ -13,6 +13,7 @@
 #include "platform/dav/DavPaths.h"
 #include "platform/dav/TesselSession.h"
 #include "prefs/SyncEngineSettings.h"
+#include "session/DataclassName.h"
 
 namespace {
 
@@ -195,12 +196,14 @@ bool NubiloRemoteSession::patchClientInfo(const vtc::Dictionary& properties) {
 
 void NubiloRemoteSession::setStatus(const std::string& status, const std::string& guid,
                                     const std::string& dataclass) {
+  vtc::requirePlainDataclassName(dataclass);  // it names properties
   _dataclassesMet.insert(dataclass);
   setInfoForClient(vtc::Dictionary{{dataclass + ".status", status}}, guid);
 }
 
 void NubiloRemoteSession::setOtherClientStatus(const std::string& status,
                                                const std::string& dataclass) {
+  vtc::requirePlainDataclassName(dataclass);
   _dataclassesMet.insert(dataclass);
   relockClients();
   DavTransaction listing = _TesselSession->listCollectionAtPath(_clientsPath);

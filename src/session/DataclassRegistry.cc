@@ -10,8 +10,10 @@
 #include "common/Logging.h"
 #include "platform/dav/DavPaths.h"
 #include "platform/dav/TesselSession.h"
+#include "session/DataclassName.h"
 
 std::string NubiloRemoteSession::dataclassPath(const std::string& dataclass) const {
+  vtc::requirePlainDataclassName(dataclass);  // one component below the schemas, never more
   return stringByAppendingTesselPathComponent(_schemasPath, dataclass);
 }
 
@@ -74,7 +76,9 @@ vtc::Array NubiloRemoteSession::getAllDataclassInfo() {
   vtc::Array records;
   if (!t.isSuccessful()) return records;
   for (const auto& [href, props] : t.result().dictionary()) {
-    _dataclassesMet.insert(vtc::davpath::lastComponent(vtc::davpath::fromHref(href)));
+    // A name from the share becomes part of property names: plain ones only.
+    std::string name = vtc::davpath::lastComponent(vtc::davpath::fromHref(href));
+    if (vtc::isPlainDataclassName(name)) _dataclassesMet.insert(std::move(name));
     records.push_back(vtc::Value(recordFromProperties(props.dictionary())));
   }
   return records;
@@ -84,8 +88,13 @@ std::vector<std::string> NubiloRemoteSession::dataclassNames() {
   DavTransaction t = _TesselSession->listCollectionAtPath(_schemasPath);
   std::vector<std::string> names;
   if (!t.isSuccessful()) return names;
-  for (const auto& entry : t.result().array())
-    names.push_back(vtc::davpath::lastComponent(entry.dictionary().get(kNBURI).string()));
+  for (const auto& entry : t.result().array()) {
+    std::string name = vtc::davpath::lastComponent(entry.dictionary().get(kNBURI).string());
+    if (vtc::isPlainDataclassName(name))
+      names.push_back(std::move(name));
+    else
+      VTC_LOG_WARNING("Ignoring a member of the schemas collection that names no dataclass");
+  }
   return names;
 }
 

@@ -5,12 +5,14 @@
 #include "VantorSyncManager/PublicNames.h"
 #include "VantorSyncManager/StringAdditions.h"
 #include "common/Logging.h"
+#include "session/DataclassName.h"
 
 std::string NubiloRemoteSession::clientPath(const std::string& guid) const {
   return stringByAppendingTesselPathComponent(_clientsPath, guid + ".client");
 }
 
 std::string NubiloRemoteSession::dataclassLockPath(const std::string& dataclass) const {
+  vtc::requirePlainDataclassName(dataclass);
   return stringByAppendingTesselPathComponent(_schemasPath, dataclass) + "/";
 }
 

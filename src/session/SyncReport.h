@@ -15,7 +15,11 @@ Dictionary flattenedSyncReport(const Dictionary& summary,
                                const std::optional<std::string>& respondingServer,
                                const std::optional<std::string>& machineGUID);
 
-// "<sync area>/Reports": one "<MachineGUID>.plist" per computer.
+// "<sync area>/Reports": one "<MachineGUID>.plist" per computer, or
+// "<client guid>.plist" for a computer whose host UUID is unknown.
 std::string reportsPathIn(const std::string& syncPath);
+
+// Forgets the host UUID kept by getHostUUIDString (tests only).
+void forgetHostUUIDForTesting();
 
 }  // namespace vtc

@@ -67,12 +67,18 @@ std::string reportsPathIn(const std::string& syncPath) {
   return stringByAppendingTesselPathComponent(syncPath, "Reports");
 }
 
+void forgetHostUUIDForTesting() {
+  std::lock_guard<std::mutex> lock(gHostUUIDMutex);
+  gHostUUID.reset();
+}
+
 }  // namespace vtc
 
 void NubiloRemoteSession::sendReportingInfo(const vtc::Dictionary& summary) {
-  vtc::Dictionary report =
-      vtc::flattenedSyncReport(summary, _respondingServer, getHostUUIDString());
+  const std::optional<std::string> machine = getHostUUIDString();
+  vtc::Dictionary report = vtc::flattenedSyncReport(summary, _respondingServer, machine);
   // The outcome is not looked at: a report that does not arrive costs only
   // the other computers' view of this sync.
-  _TesselSession->_sendReportingInfo(report, vtc::reportsPathIn(_syncPath));
+  _TesselSession->_sendReportingInfo(report, vtc::reportsPathIn(_syncPath),
+                                     machine.value_or(_configuration.get("guid").string()));
 }

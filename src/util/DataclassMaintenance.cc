@@ -6,6 +6,7 @@
 #include "VantorSyncManager/NubiloRemoteSession.h"
 #include "VantorSyncManager/VTCPrefsCenter.h"
 #include "common/Logging.h"
+#include "session/DataclassName.h"
 
 namespace {
 
@@ -52,8 +53,12 @@ std::optional<vtc::Array> registeredDataclasses() {
   try {
     auto session = openSession();
     vtc::Array names;
-    for (const vtc::Value& record : session->getAllDataclassInfo())
-      names.push_back(record.dictionary().get("dataclassname"));
+    for (const vtc::Value& record : session->getAllDataclassInfo()) {
+      // A name from the share that no caller could use as a dataclass is left out.
+      const vtc::Value& name = record.dictionary().get("dataclassname");
+      if (name.isString() && !vtc::isPlainDataclassName(name.string())) continue;
+      names.push_back(name);
+    }
     return names;
   } catch (const std::exception& e) {
     VTC_LOG_ERROR("exception %@ while trying to retrieve registered dataclasses", e.what());

@@ -14,6 +14,7 @@
 #include "platform/engine/SyncEngine.h"
 #include "platform/fs/LocalPaths.h"
 #include "platform/plist/PlistCodec.h"
+#include "prefs/SyncEngineSettings.h"
 
 namespace {
 
@@ -44,7 +45,12 @@ std::shared_ptr<SyncEngineClientRecord> getNubiloClient() {
     if (!description || !description->isDictionary())
       throw NubiloException("NSInvalidArgumentException",
                             "the client description " + *path + " is no property list");
+    const bool known = engine->hasClient(kVantorSyncClientId);
     engine->registerClient(kVantorSyncClientId, description->dictionary());
+    // A choice of syncing after other clients made before the record
+    // existed takes effect now.
+    if (!known)
+      vtc::setSyncsAfterOtherClients(VTCPrefsCenter::defaultCenter().automaticallySyncOn());
     return std::make_shared<SyncEngineClientRecord>(kVantorSyncClientId, description->dictionary());
   } catch (const NubiloException& e) {
     VTC_LOG_ERROR("Exception caught while getting the XSyncClient in getVantorClient -  %@ %@",

@@ -1,16 +1,20 @@
 // Syncs that are cut short or run into each other: a client killed with
-// SIGKILL after reading its folder, after committing and before unlocking,
-// and halfway through writing files; a second run while one is under way;
-// a file edited while the sync writes it. Afterwards every computer holds
-// the whole data set, nothing lost and nothing twice.
+// SIGKILL at each step of a new computer's first sync, of a commit and of a
+// compaction, and halfway through writing files; a second run while one is
+// under way; a file edited while the sync writes it. Afterwards the next
+// syncs of every computer converge with nobody acting: the whole data set
+// everywhere, nothing lost and nothing twice, no conflict nobody made, no
+// change sent back.
 #include <gmock/gmock.h>
 #include <signal.h>
 #include <sys/inotify.h>
 #include <unistd.h>
 
 #include <filesystem>
+#include <regex>
 #include <set>
 
+#include "VantorSyncManager/NubiloRemoteSession.h"
 #include "localshare/ApacheShare.h"
 #include "localshare/Computer.h"
 #include "localshare/Processes.h"
@@ -45,25 +49,43 @@ class Interrupted : public ::testing::Test {
            ApacheShare::kPassword);
   }
 
-  void sync(const Computer& c) {
+  Computer::Result sync(const Computer& c) {
     Computer::Result r = c.run({"sync"});
     EXPECT_EQ(r.status, 0) << c.name() << ": " << r.err << r.out;
+    return r;
   }
-  // Starts A's sync and waits until the proxy holds its request.
-  pid_t stopAt(const std::string& method, const std::string& path = "") {
-    proxy.timeOut({method, path, 1});
+  // Starts A's sync and waits until the proxy holds its request, or has
+  // forwarded it and the server has carried it out (answerLost).
+  pid_t stopAt(const vtc::test::Match& match, bool answerLost = false) {
+    const size_t done = countOnShare(match.method);
+    if (answerLost)
+      proxy.loseAnswer(match);
+    else
+      proxy.timeOut(match);
     pid_t pid = a.start({"sync"});
     EXPECT_TRUE(vtc::local::waitUntil([&] {
       for (const auto& seen : proxy.requests())
-        if (seen.method == method && seen.action == "timed out") return true;
+        if (seen.method == match.method && seen.action != "forwarded") return true;
       return false;
-    }));
+    })) << "A never sent "
+        << match.method;
+    if (answerLost) {
+      EXPECT_TRUE(vtc::local::waitUntil([&] { return countOnShare(match.method) > done; }));
+    }
     return pid;
+  }
+  pid_t stopAt(const std::string& method, const std::string& path = "") {
+    return stopAt({method, path, 1});
   }
   void kill(pid_t pid) {
     ::kill(pid, SIGKILL);
     EXPECT_EQ(a.finish(pid).status, 128 + SIGKILL);
     proxy.clear();
+  }
+  size_t countOnShare(const std::string& method) const {
+    size_t n = 0;
+    for (const auto& entry : share.accessEntries()) n += entry.method == method;
+    return n;
   }
   // Every computer holds exactly these cards, each once.
   void expectEverywhere(const std::map<std::string, std::string>& cards) {
@@ -74,6 +96,12 @@ class Interrupted : public ::testing::Test {
       for (const auto& [name, content] : files) uids.insert(content.substr(0, content.find("FN")));
       EXPECT_EQ(uids.size(), files.size()) << c->name() << " holds a card twice";
     }
+  }
+  // How many changes a sync says it sent.
+  static int sent(const Computer::Result& r) {
+    static const std::regex said("sent ([0-9]+) change");
+    std::smatch m;
+    return std::regex_search(r.out, m, said) ? std::stoi(m[1]) : -1;
   }
 };
 
@@ -135,10 +163,23 @@ TEST_F(Interrupted, ARunKilledHalfwayThroughWritingFilesConvergesOnTheNextRun) {
   EXPECT_EQ(a.finish(pid).status, 128 + SIGKILL);
   EXPECT_GT(written, 0u);
   EXPECT_LT(written, static_cast<size_t>(kCards)) << "the run ended before it was killed";
+  // What a write cut short leaves (the kill may have left one too), and
+  // files of the same look that are not the client's.
+  const std::string leftover = "/.0F8E2C3A-5B7D-4E21-9A64-3C1D2E5F7A90.tmp";
+  Computer::write(a.contacts() + leftover, "");
+  Computer::write(a.contacts() + "/.notes.tmp", "mine");
+  Computer::write(a.contacts() + "/.0F8E2C3A.tmp", "mine");
 
-  sync(a);
+  EXPECT_THAT(sync(a).out, HasSubstr("sent 0 changes"));
   sync(b);
   expectEverywhere(cards);
+  for (const Computer* c : {&a, &b})
+    EXPECT_THAT(c->run({"conflicts"}).out, HasSubstr("No conflicts")) << c->name();
+  std::set<std::string> hidden;
+  for (const auto& entry : std::filesystem::directory_iterator(a.contacts()))
+    if (!entry.path().filename().string().ends_with(".vcf"))
+      hidden.insert(entry.path().filename().string());
+  EXPECT_EQ(hidden, (std::set<std::string>{".0F8E2C3A.tmp", ".notes.tmp"}));
 }
 
 TEST_F(Interrupted, AFileEditedWhileTheSyncWritesItIsKeptAndMergedNextTime) {
@@ -172,6 +213,126 @@ TEST_F(Interrupted, AFileEditedWhileTheSyncWritesItIsKeptAndMergedNextTime) {
   const std::string merged =
       "BEGIN:VCARD\r\nVERSION:3.0\r\nUID:p1\r\nFN:Person One\r\nTEL:200\r\nEND:VCARD\r\n";
   expectEverywhere({{"p1.vcf", merged}});
+}
+
+// The steps a run can be killed at: the request the proxy holds when it is
+// killed, or (answerLost) one the server carried out while the run never
+// heard of it.
+struct KillPoint {
+  const char* name;
+  // FirstOnTheShare: A is the share's first computer; FirstSync: A joins
+  // while B's cards are there; Commit: both synced, each then edits a card
+  // and B syncs; Compaction: as Commit, A compacts the history first.
+  enum Stage { FirstOnTheShare, FirstSync, Commit, Compaction } stage;
+  vtc::test::Match request;
+  bool answerLost = false;
+  bool committed = false;  // A's changes were on the share when it was killed
+};
+
+void PrintTo(const KillPoint& point, std::ostream* out) {
+  *out << point.name;
+}
+
+constexpr const char* kCollection = "/sync/Schemas/com.korvo.Contacts";
+
+const KillPoint kKillPoints[] = {
+    {"FirstCommitOnTheShareAfterItsRecordUpdate", KillPoint::FirstOnTheShare, {"MOVE", "", 1}},
+    {"FirstSyncAfterReadingTheFolder", KillPoint::FirstSync, {"LOCK", "", 1}},
+    {"FirstSyncAfterItsDownloads", KillPoint::FirstSync, {"PUT", "", 1}},
+    {"FirstCommitAfterThePutOfItsChangelog",
+     KillPoint::FirstSync,
+     {"PROPPATCH", kCollection, 1, "PUT"}},
+    {"FirstCommitAfterItsRecordUpdate", KillPoint::FirstSync, {"MOVE", "", 1}},
+    {"FirstCommitBeforeHearingOfItsMove", KillPoint::FirstSync, {"MOVE", "", 1}, true, true},
+    {"FirstSyncBeforeWritingFiles", KillPoint::FirstSync, {"UNLOCK", kCollection, 1}, false, true},
+    {"CommitAfterThePutOfItsChangelog", KillPoint::Commit, {"PROPPATCH", kCollection, 1, "PUT"}},
+    {"CommitAfterItsRecordUpdate", KillPoint::Commit, {"MOVE", "", 1}},
+    {"CommitBeforeHearingOfItsMove", KillPoint::Commit, {"MOVE", "", 1}, true, true},
+    {"CompactionAfterThePutOfItsChangelog",
+     KillPoint::Compaction,
+     {"PROPPATCH", kCollection, 1, "PUT"}},
+    {"CompactionAfterItsRecordUpdate", KillPoint::Compaction, {"MOVE", "", 1}},
+    {"CompactionWhileDeletingTheOldHistory", KillPoint::Compaction, {"DELETE", "", 2}},
+    {"CompactionDoneBeforeTheCommitAfterIt", KillPoint::Compaction, {"PUT", "", 2}},
+};
+
+class KilledAt : public Interrupted, public ::testing::WithParamInterface<KillPoint> {
+ protected:
+  // The share's collection as a session sees it: its record is sound, and
+  // it holds no temporary changelog and nothing below minversion.
+  void expectTidyShare() {
+    vtc::Dictionary config = share.configuration();
+    config.set("sync_path", vtc::Value("/sync"));
+    auto session = NubiloRemoteSession::sessionWithUsername(ApacheShare::kUser,
+                                                            ApacheShare::kPassword, config);
+    EXPECT_TRUE(session->validPropertiesForDataclass("com.korvo.Contacts"));
+    const std::string min =
+        session->getDataclassInfo("com.korvo.Contacts").get("minversion").string();
+    for (const std::string& member : share.members(kCollection)) {
+      EXPECT_FALSE(member.ends_with(".tmp")) << member;
+      EXPECT_GE(member, min) << "below minversion";
+    }
+  }
+};
+
+INSTANTIATE_TEST_SUITE_P(Steps, KilledAt, ::testing::ValuesIn(kKillPoints),
+                         [](const auto& info) { return std::string(info.param.name); });
+
+TEST_P(KilledAt, TheNextSyncsConvergeWithNobodyActing) {
+  const KillPoint& point = GetParam();
+  std::map<std::string, std::string> cards;
+  for (int i = 0; i < 5; ++i) cards["p" + std::to_string(i) + ".vcf"] = card(i);
+  for (const auto& [name, content] : cards) Computer::write(b.contacts() + "/" + name, content);
+  cards["p9.vcf"] = card(9);
+  Computer::write(a.contacts() + "/p9.vcf", card(9));
+  if (point.stage != KillPoint::FirstOnTheShare) sync(b);
+  if (point.stage >= KillPoint::Commit) {
+    sync(a);
+    sync(b);
+    // Each edits a card of its own; B's edit is on the share first.
+    cards["p1.vcf"] = card(1, "100");
+    cards["p3.vcf"] = card(3, "300");
+    Computer::write(a.contacts() + "/p1.vcf", cards["p1.vcf"]);
+    Computer::write(b.contacts() + "/p3.vcf", cards["p3.vcf"]);
+    sync(b);
+  }
+  if (point.stage == KillPoint::Compaction)
+    a.setPreference("compaction_max_changelogs", vtc::Value(2));
+  kill(stopAt(point.request, point.answerLost));
+  const int unsent = point.committed ? 0 : 1;  // A's changes not on the share
+
+  // Every computer syncs in turn: nobody repairs, nothing is refused.
+  int sentAfter = 0;
+  for (const Computer* c : {&a, &b, &a, &b}) sentAfter += sent(sync(*c));
+  // B sends its own cards when A was the share's first computer.
+  EXPECT_EQ(sentAfter, unsent + (point.stage == KillPoint::FirstOnTheShare ? 5 : 0))
+      << "a change was sent twice";
+  expectEverywhere(cards);
+  for (const Computer* c : {&a, &b})
+    EXPECT_THAT(c->run({"conflicts"}).out, HasSubstr("No conflicts")) << c->name();
+  for (const Computer* c : {&a, &b})
+    EXPECT_THAT(sync(*c).out, HasSubstr("sent 0 changes, received 0 changes")) << c->name();
+
+  // The killed run's temporary changelog stays while its lock could last,
+  // and goes with the next sync that locks the collection after that; so
+  // do changelogs a compaction left below minversion.
+  std::vector<std::string> temporary;
+  for (const std::string& member : share.members(kCollection))
+    if (member.ends_with(".tmp")) temporary.push_back(member);
+  const std::string& held = point.request.method;
+  if ((held == "PROPPATCH" || held == "MOVE") && !point.answerLost) {
+    EXPECT_FALSE(temporary.empty()) << "the killed run left no temporary changelog";
+  }
+  const auto anHourAgo = std::filesystem::file_time_type::clock::now() - std::chrono::hours(1);
+  for (const std::string& name : temporary)
+    std::filesystem::last_write_time(share.diskPath(std::string(kCollection) + "/" + name),
+                                     anHourAgo);
+  cards["p4.vcf"] = card(4, "400");
+  Computer::write(b.contacts() + "/p4.vcf", cards["p4.vcf"]);
+  sync(b);
+  sync(a);
+  expectEverywhere(cards);
+  expectTidyShare();
 }
 
 }  // namespace

@@ -156,6 +156,31 @@ TEST_F(Living, EachFailureIsOnePlainSentenceWithAnExitStatusOfItsKind) {
   EXPECT_EQ(b.run({"add", "contacts", b.home() + "/work", "--dataclass", "work.Contacts"}).status,
             0);
   EXPECT_EQ(b.run({"setup", "ftp://host", "--user", "x"}).status, 2);
+  // A dataclass name that could reach outside the sync area is refused
+  // before anything is made; one put into the preferences by hand is
+  // ignored, and the sync goes on without it.
+  Computer::Result evil =
+      b.run({"add", "contacts", b.home() + "/evil", "--dataclass", "../../evil"});
+  EXPECT_EQ(evil.status, 2);
+  EXPECT_THAT(evil.err, HasSubstr("A dataclass name is a plain name of letters, digits, '.', '_' "
+                                  "and '-', not starting with '.' and at most 100 long; this one "
+                                  "is not: it starts with '.'."));
+  EXPECT_THAT(b.run({"add", "contacts", b.home() + "/evil", "--dataclass", "a/b"}).err,
+              HasSubstr("it contains the character '/'"));
+  Computer::write(b.home() + "/evil/e.vcf", card("e", "Eve", "6"));
+  b.setPreference(
+      "SyncCollections",
+      vtc::Value(vtc::Dictionary{
+          {"com.korvo.Contacts", vtc::Dictionary{{"Kind", "contacts"}, {"Folder", b.contacts()}}},
+          {"../../evil", vtc::Dictionary{{"Kind", "contacts"}, {"Folder", b.home() + "/evil"}}}}));
+  Computer::Result synced = b.run({"sync", "-v"});
+  EXPECT_EQ(synced.status, 0) << synced.err;
+  EXPECT_THAT(synced.out, testing::Not(HasSubstr("evil")));
+  for (const std::string& root : {share.documentRoot(), home.path()})
+    for (const auto& entry : std::filesystem::recursive_directory_iterator(root))
+      EXPECT_EQ(entry.path().filename().string().find("evil"),
+                entry.path().string() == b.home() + "/evil" ? 0 : std::string::npos)
+          << entry.path();
   Computer fresh{"Mac F"};
   Computer::Result notSetUp = fresh.run({"sync"});
   EXPECT_EQ(notSetUp.status, 2);

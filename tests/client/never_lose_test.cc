@@ -5,6 +5,11 @@
 // running the real client against a real Apache share.
 #include <gmock/gmock.h>
 
+#include <fcntl.h>
+#include <linux/fs.h>
+#include <sys/ioctl.h>
+#include <unistd.h>
+
 #include <filesystem>
 #include <sstream>
 
@@ -306,6 +311,37 @@ TEST_F(NeverLose,
   Computer::Result applied = sync(b);
   EXPECT_THAT(applied.out, HasSubstr("2 deletes confirmed on another computer"));
   EXPECT_TRUE(contactsOf(b).empty());
+}
+
+// Makes a folder immutable, or mutable again: the one way to make a folder
+// that cannot be written when the tests run as root.
+bool setImmutable(const std::string& folder, bool on) {
+  int fd = ::open(folder.c_str(), O_RDONLY | O_DIRECTORY);
+  if (fd < 0) return false;
+  int flags = 0;
+  bool ok = ::ioctl(fd, FS_IOC_GETFLAGS, &flags) == 0;
+  flags = on ? (flags | FS_IMMUTABLE_FL) : (flags & ~FS_IMMUTABLE_FL);
+  ok = ok && ::ioctl(fd, FS_IOC_SETFLAGS, &flags) == 0;
+  ::close(fd);
+  return ok;
+}
+
+TEST_F(NeverLose, AFolderThatCannotBeWrittenFailsTheSyncNamesTheFileAndIsWrittenNextTime) {
+  Computer::write(a.contacts() + "/ann.vcf", card("ann", "Ann", "1"));
+  sync(a);
+  sync(b);
+  Computer::write(a.contacts() + "/bob.vcf", card("bob", "Bob", "2"));
+  sync(a);
+  if (!setImmutable(b.contacts(), true)) GTEST_SKIP() << "this file system cannot lock a folder";
+  Computer::Result failed = b.run({"sync"});
+  setImmutable(b.contacts(), false);
+  EXPECT_EQ(failed.status, 9) << failed.out << failed.err;
+  EXPECT_THAT(failed.err, HasSubstr("could not write bob.vcf"));
+  EXPECT_THAT(b.run({"status"}).out, HasSubstr("not written bob.vcf"));
+
+  sync(b);
+  EXPECT_EQ(contactsOf(b), contactsOf(a));
+  EXPECT_THAT(b.run({"status"}).out, Not(HasSubstr("not written")));
 }
 
 }  // namespace

@@ -65,6 +65,13 @@ TEST_F(Log, WithoutAConfiguredLevelOnlyErrorsAreWrittenShortToAPrivateFile) {
 }
 
 TEST_F(Log, LevelWordsInAnyCaseAndThePerHostValueWins) {
+  // A computer with the bug-reporting tool logs Info unless a level is set.
+  vtc::paths::makeDirectories(home.path() + "/.local/share/applications");
+  std::ofstream(home.path() + "/.local/share/applications/Ticketer.desktop")
+      << "[Desktop Entry]\nName=Ticketer\n";
+  auto l = logAllLevels();
+  ASSERT_EQ(l.size(), 4u);  // levels -1 to 2
+  EXPECT_EQ(tail(l.back(), 2), "Info|level 2");
   // "verbose" is -1: only a call made at level -1 itself gets through.
   const std::pair<const char*, size_t> cases[] = {{"verbose", 1}, {"warn", 3},  {"gibberish", 3},
                                                   {"info", 4},    {"error", 2}, {"DeBuG", 5}};
@@ -79,23 +86,11 @@ TEST_F(Log, LevelWordsInAnyCaseAndThePerHostValueWins) {
   setPreference("LoggingLevel", vtc::Value("debug"), /*perHost=*/true);
   std::filesystem::remove(vtc::log::logFilePath());
   VTC_LOG_INFO("hello %@", "there");
-  auto l = lines();
+  l = lines();
   ASSERT_EQ(l.size(), 1u);
   EXPECT_NE(l[0].find("|log_test.cc:"), std::string::npos) << l[0];
   EXPECT_NE(l[0].find("TestBody()|"), std::string::npos) << l[0];
   EXPECT_EQ(tail(l[0], 3), "Info|hello there");
-}
-
-TEST_F(Log, AComputerWithTheBugReportingToolLogsInfoUnlessALevelIsSet) {
-  std::string apps = home.path() + "/.local/share/applications";
-  vtc::paths::makeDirectories(apps);
-  std::ofstream(apps + "/Ticketer.desktop") << "[Desktop Entry]\nName=Ticketer\n";
-  auto l = logAllLevels();
-  ASSERT_EQ(l.size(), 4u);  // levels -1 to 2
-  EXPECT_EQ(tail(l.back(), 2), "Info|level 2");
-  vtc::log::resetForTesting();
-  setPreference("LoggingLevel", vtc::Value("error"));
-  EXPECT_EQ(logAllLevels().size(), 2u);
 }
 
 TEST_F(Log, RollsOnlyPastFourMebibytesAndOnlyOncePerProcess) {
@@ -123,18 +118,7 @@ TEST_F(Log, RollsOnlyPastFourMebibytesAndOnlyOncePerProcess) {
   EXPECT_GT(std::filesystem::file_size(path), 4194305u);
 }
 
-TEST_F(Log, TheCEntryPointTakesCStringsAndLongLinesStayWhole) {
-  setPreference("LoggingLevel", vtc::Value("info"));
-  std::string big(1000, 'y');
-  _VTCLog("/src/a/Caller.m", 12, "-[Caller run]", 2, "%@ and %d: %@", "text", 5, big.c_str());
-  _VTCLog("/src/a/Caller.m", 13, "-[Caller run]", 1, "%@", nullptr);
-  auto l = lines();
-  ASSERT_EQ(l.size(), 2u);
-  EXPECT_EQ(tail(l[0], 2), "Info|text and 5: " + big);
-  EXPECT_EQ(tail(l[1], 2), "Warning|(null)");
-}
-
-TEST_F(Log, LongHeadsStayWholeAndInvalidUtf8BecomesQuestionMarks) {
+TEST_F(Log, TheCEntryPointAndLongLinesAndHeadsStayWholeAndInvalidUtf8BecomesQuestionMarks) {
   setPreference("LoggingLevel", vtc::Value("debug"));
   // A function name that carries the head past 511 bytes, with two-byte
   // characters all the way, so that any cut would split one.
@@ -142,10 +126,15 @@ TEST_F(Log, LongHeadsStayWholeAndInvalidUtf8BecomesQuestionMarks) {
   while (function.size() < 600) function += "\xC3\xA9";
   function += "]";
   _VTCLog("/src/a/Caller.m", 7, function.c_str(), 0, "%@", "the message");
+  const std::string big(1000, 'y');
+  _VTCLog("/src/a/Caller.m", 12, "-[Caller run]", 2, "%@ and %d: %@", "text", 5, big.c_str());
+  _VTCLog("/src/a/Caller.m", 13, "-[Caller run]", 1, "%@", nullptr);
   auto l = lines();
-  ASSERT_EQ(l.size(), 1u);
+  ASSERT_EQ(l.size(), 3u);
   EXPECT_NE(l[0].find("|Caller.m:7 " + function + "|"), std::string::npos) << l[0];
   EXPECT_EQ(tail(l[0], 3), "Error|the message");
+  EXPECT_EQ(tail(l[1], 3), "Info|text and 5: " + big);
+  EXPECT_EQ(tail(l[2], 3), "Warning|(null)");
 
   // Overlong forms, surrogates, lead bytes past U+10FFFF and stray or cut
   // sequences each become "?", byte by byte; well-formed text is kept.

@@ -11,12 +11,9 @@
 #include "VantorSyncManager/NubiloRemoteSession.h"
 #include "VantorSyncManager/PublicNames.h"
 #include "VantorSyncManager/VTCPrefsCenter.h"
-#include "localshare/ApacheShare.h"
 #include "support/Failures.h"
-#include "support/FakeTime.h"
-#include "support/LogCapture.h"
 #include "support/SharePreferences.h"
-#include "support/TestHome.h"
+#include "support/ShareTest.h"
 
 using testing::ElementsAre;
 using testing::ThrowsMessage;
@@ -31,13 +28,8 @@ vtc::Date utc(int y, unsigned m, unsigned d, int h, int min, int s, int ms = 0) 
                                               minutes(min) + seconds(s) + milliseconds(ms));
 }
 
-class Legacy : public ::testing::Test {
+class Legacy : public vtc::test::ShareTest {
  protected:
-  vtc::test::TestHome home;
-  vtc::test::LogCapture logged;
-  vtc::test::FakeTime time;
-  vtc::local::ApacheShare share;
-
   void SetUp() override { vtc::test::storeShareInPreferences(share); }
   void TearDown() override { vtc::setAssertionPolicy(vtc::AssertionPolicy::Throw); }
 
@@ -48,9 +40,7 @@ class Legacy : public ::testing::Test {
   }
   // Writes sync dates into a client's record, as its own computer would.
   void setDates(const std::string& guid, const vtc::Dictionary& dates) {
-    vtc::Dictionary config = share.configuration();
-    NubiloRemoteSession::sessionWithUsername("alice", "wonderland", config)
-        ->setInfoForClient(dates, guid);
+    openSession()->setInfoForClient(dates, guid);
   }
   static const SMClientInfo& find(const std::vector<SMClientInfo>& clients,
                                   const std::string& guid) {
@@ -122,7 +112,7 @@ TEST_F(Legacy, SessionFailuresReachTheCallerAndAClientWithoutGuidIsNotRegistered
   EXPECT_THAT([&] { session->registerClient(nameless); },
               ThrowsMessage<vtc::AssertionFailure>("registerClient: client guid is missing!"));
   EXPECT_FALSE(std::filesystem::exists(
-      share.diskPath(std::string(vtc::local::ApacheShare::kSyncPath) + "/Clients/.client")));
+      share.diskPath(std::string(vtc::local::Share::kSyncPath) + "/Clients/.client")));
 }
 
 TEST_F(Legacy, InertMembersSendNothingAndRetiredOnesReportTheirUse) {

@@ -7,6 +7,7 @@
 #include <stdlib.h>
 #include <unistd.h>
 
+#include <chrono>
 #include <ctime>
 #include <filesystem>
 #include <iostream>
@@ -70,46 +71,49 @@ class AutoSync : public ::testing::Test {
     return PreferenceStore::shared().copyValue(key, kVantorDefaultsKey, Scope::CurrentHost);
   }
   std::string enableCall(const std::vector<std::string>& names) const {
-    std::string call = "enable --now";
+    std::string call = "enable --now --no-block";
     for (const std::string& n : names) call += " " + units + n;
     return call;
   }
 };
 
-TEST_F(AutoSync, IntervalsBecomeWeeklyDailyHourlyOrEveryMinuteCalendars) {
+// Each unit's length makes the period; which calendar a period gets is
+// checked against systemd's own reading in unit_files_test.
+TEST_F(AutoSync, EachUnitGivesItsPeriodAndSubmittingNeverWaitsForTheJob) {
   const std::tm now = local();
   struct Case {
     int32_t interval, unit;
     Dictionary calendar;
   } cases[] = {
-      {1, 2, Dictionary{{"Hour", now.tm_hour}, {"Minute", now.tm_min}}},
+      {2, 0, Dictionary{{"Minute", now.tm_min}}},                         // minutes: hourly
+      {2, 1, Dictionary{{"Hour", now.tm_hour}, {"Minute", now.tm_min}}},  // hours: daily
       {2, 2, Dictionary{{"Weekday", now.tm_wday}, {"Hour", now.tm_hour}, {"Minute", now.tm_min}}},
-      {1, 1, Dictionary{{"Minute", now.tm_min}}},
-      {2, 1, Dictionary{{"Hour", now.tm_hour}, {"Minute", now.tm_min}}},  // two hours: daily
-      {61, 3, Dictionary{{"Minute", now.tm_min}}},
-      {30, 3, Dictionary{}},
+      {30, 3, Dictionary{}},  // seconds: every minute
   };
   for (const Case& c : cases) {
-    SCOPED_TRACE(testing::Message() << c.interval << " in unit " << c.unit);
-    manager.forgetCalls();
     turnOn(c.interval, c.unit);
-    EXPECT_TRUE(prefs.autoSyncOn());
-    EXPECT_EQ(calendar(), c.calendar);
-    const Dictionary d = job().dictionary();
-    EXPECT_EQ(d.get("Label").string(), kLabel);
-    EXPECT_THAT(
-        d.get("ProgramArguments").array(),
-        ElementsAre(testing::Property(&Value::string, testing::EndsWith("/nubilosyncclient")),
-                    Value("--sync"), Value("--periodic")));
-    EXPECT_EQ(d.get("LimitLoadToSessionType").string(), "Glaze");
-    EXPECT_TRUE(d.get("RunAtLoad").boolean());
-    EXPECT_THAT(Computer::read(units + kLabel + ".timer"),
-                HasSubstr("OnCalendar=" + *vtc::jobs::onCalendar(c.calendar) + "\n"));
-    EXPECT_THAT(manager.calls(),
-                ElementsAre("daemon-reload", enableCall({std::string(kLabel) + ".service",
-                                                         std::string(kLabel) + ".timer"})));
+    EXPECT_EQ(calendar(), c.calendar) << c.interval << " in unit " << c.unit;
     prefs.setAutoSyncOn(false);
   }
+
+  // The job runs at load, and its first sync fails: neither is the caller's.
+  manager.forgetCalls();
+  manager.failStartedJobs();
+  turnOn(1, 2);
+  EXPECT_TRUE(prefs.autoSyncOn());
+  const Dictionary d = job().dictionary();
+  EXPECT_EQ(d.get("Label").string(), kLabel);
+  EXPECT_THAT(d.get("ProgramArguments").array(),
+              ElementsAre(testing::Property(&Value::string, testing::EndsWith("/nubilosyncclient")),
+                          Value("--sync"), Value("--periodic")));
+  EXPECT_EQ(d.get("LimitLoadToSessionType").string(), "Glaze");
+  EXPECT_TRUE(d.get("RunAtLoad").boolean());
+  EXPECT_THAT(Computer::read(units + kLabel + ".timer"),
+              HasSubstr("OnCalendar=" + *vtc::jobs::onCalendar(calendar()) + "\n"));
+  EXPECT_THAT(manager.calls(),
+              ElementsAre("daemon-reload", enableCall({std::string(kLabel) + ".service",
+                                                       std::string(kLabel) + ".timer"})));
+  EXPECT_TRUE(logged.messages("Error").empty());
 }
 
 TEST_F(AutoSync, OnlyAChangeInTheNumberOfCalendarEntriesRewritesTheJob) {
@@ -211,7 +215,7 @@ TEST_F(AutoSync, WithoutAUserManagerFailuresAreErrorLinesAndTheJobFileStaysTheTr
   if (previousBus) setenv("DBUS_SESSION_BUS_ADDRESS", keptBus.c_str(), 1);
 }
 
-TEST_F(AutoSync, ARealUserManagerEnablesAndRemovesAJob) {
+TEST_F(AutoSync, ARealUserManagerStartsAJobThatRunsAtLoadWithoutWaitingForIt) {
   vtc::jobs::systemctlSeam().install(nullptr);
   if (vtc::jobs::systemctl({"show-environment"}).status != 0)
     GTEST_SKIP() << "no user manager here (a container or a bare login): only the no-manager "
@@ -219,22 +223,35 @@ TEST_F(AutoSync, ARealUserManagerEnablesAndRemovesAJob) {
   std::cout << "[ jobs ] a real user manager runs here\n";
   const std::string label = "com.korvo.VantorSyncTest" + std::to_string(::getpid());
   std::string error;
-  ASSERT_TRUE(
-      vtc::jobs::jobSubmit(Dictionary{{"Label", Value(label)},
-                                      {"ProgramArguments", Value(vtc::Array{"/bin/true"})},
-                                      {"StartCalendarInterval", Value(Dictionary{{"Minute", 7}})}},
-                           error))
+  // A first run that takes a while and fails, as a failing sync does.
+  const auto start = std::chrono::steady_clock::now();
+  ASSERT_TRUE(vtc::jobs::jobSubmit(
+      Dictionary{{"Label", Value(label)},
+                 {"ProgramArguments", Value(vtc::Array{"/bin/sh", "-c", "sleep 3; exit 3"})},
+                 {"RunAtLoad", true},
+                 {"StartCalendarInterval", Value(Dictionary{{"Minute", 7}})}},
+      error))
       << error;
+  EXPECT_LT(std::chrono::steady_clock::now() - start, std::chrono::seconds(2));
   EXPECT_EQ(vtc::jobs::systemctl({"is-enabled", label + ".timer"}).status, 0);
   EXPECT_TRUE(vtc::jobs::jobRemove(label, true, error)) << error;
   EXPECT_NE(vtc::jobs::systemctl({"is-enabled", label + ".timer"}).status, 0);
 }
 
 TEST_F(AutoSync, SyncOnChangeInstallsTheBookmarksJobOnceAndLeavesItWhenTurnedOff) {
-  ASSERT_TRUE(getNubiloClient());  // the engine's record that sync on change sets
-  EXPECT_FALSE(prefs.checkBookmarksPlistAndCreateIfNecessary());  // no browser
+  // The engine has no record of this client yet: the choice is kept, and
+  // takes effect once the client is registered.
   prefs.setAutomaticallySyncOn(true);
   EXPECT_TRUE(prefs.automaticallySyncOn());
+  EXPECT_TRUE(logged.messages("Error").empty());
+  auto client = getVantorClient();  // registered with the installed description
+  ASSERT_TRUE(client);
+  EXPECT_EQ(client->clientIdentifier(), kVantorSyncClientId);
+  EXPECT_TRUE(client->description().get("Dataclasses").dictionary().contains("com.korvo.Contacts"));
+  EXPECT_EQ(getNubiloClient()->objectForKey("SyncsAfterClients"), Value(true));
+  EXPECT_EQ(getVanterConfiguration().get("sync_namespace"),
+            prefs.configuration().get("sync_namespace"));
+  EXPECT_FALSE(prefs.checkBookmarksPlistAndCreateIfNecessary());  // no browser
   EXPECT_FALSE(std::filesystem::exists(vtc::autosync::bookmarksJobFile()));
 
   Computer::write(home.path() + "/.local/share/applications/com.korvo.Voyager.SyncClient.desktop",
@@ -258,6 +275,7 @@ TEST_F(AutoSync, SyncOnChangeInstallsTheBookmarksJobOnceAndLeavesItWhenTurnedOff
   EXPECT_TRUE(manager.calls().empty());
   prefs.setAutomaticallySyncOn(false);
   EXPECT_FALSE(prefs.automaticallySyncOn());
+  EXPECT_EQ(client->objectForKey("SyncsAfterClients"), Value(false));
   EXPECT_TRUE(std::filesystem::exists(vtc::autosync::bookmarksJobFile()));
 
   // A refused submission is an Error line and still a yes; a folder in the

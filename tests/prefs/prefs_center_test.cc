@@ -14,10 +14,10 @@
 #include "VantorSyncManager/PublicNames.h"
 #include "VantorSyncManager/VTCPrefsCenter.h"
 #include "common/Logging.h"
+#include "localshare/ApacheShare.h"
 #include "platform/engine/SyncEngine.h"
 #include "platform/prefs/PreferenceStore.h"
 #include "platform/secrets/CredentialStore.h"
-#include "localshare/ApacheShare.h"
 #include "support/FakeTime.h"
 #include "support/LogCapture.h"
 #include "support/SessionBus.h"
@@ -45,6 +45,7 @@ class PrefsCenter : public ::testing::Test {
 };
 
 TEST_F(PrefsCenter, FailureGuardsCountUpAFailedTagExpiresAndASuccessClearsThemAll) {
+  vtc::test::LogCapture logged;
   prefs.setSyncSuccessful(false, "Contacts");
   prefs.setSyncSuccessful(false, "Contacts");
   EXPECT_EQ(prefs.failedSyncCountForDataclass("Contacts"), 2);
@@ -58,10 +59,17 @@ TEST_F(PrefsCenter, FailureGuardsCountUpAFailedTagExpiresAndASuccessClearsThemAl
   EXPECT_EQ(counts, (std::vector<int64_t>{0, 1, 2, 0, 1}));  // a new anchor starts again
   EXPECT_EQ(perHost("anchorClog.Contacts").integer(), 13);
   prefs.setDownloadedAnchorClog(vtc::Value(12), "Calendars");
-  setPerHost("etag.Contacts", vtc::Value("\"abc\""));
-  setPerHost("etagTTL.Contacts", vtc::Value(time.now() + std::chrono::seconds(10)));
+  // A failed tag is believed for the configured time only.
+  PreferenceStore::shared().setValue("inconsistency_ttl", vtc::Value(60), kVantorDefaultsKey,
+                                     Scope::AnyHost);
+  prefs.setFailedETag("\"abc\"", "Contacts");
+  EXPECT_EQ(perHost("etagTTL.Contacts").date(), time.now() + std::chrono::seconds(60));
+  EXPECT_THAT(logged.messages("Info"),
+              testing::Contains(testing::StartsWith(
+                  "Storing failed etag \"abc\" for dataclass Contacts with TTL date of 20")));
+  time.advance(vtc::Seconds(59));
   EXPECT_EQ(prefs.failedETagForDataclass("Contacts"), "\"abc\"");
-  time.advance(vtc::Seconds(11));
+  time.advance(vtc::Seconds(2));
   EXPECT_FALSE(prefs.failedETagForDataclass("Contacts"));  // expired: not believed, but kept
   EXPECT_EQ(perHost("etag.Contacts").string(), "\"abc\"");
 
@@ -71,22 +79,6 @@ TEST_F(PrefsCenter, FailureGuardsCountUpAFailedTagExpiresAndASuccessClearsThemAl
        {"FailedCount.Contacts", "etag.Contacts", "anchorClog.Contacts", "anchorCount.Contacts"})
     EXPECT_TRUE(perHost(key).isNone()) << key;
   EXPECT_EQ(perHost("anchorClog.Calendars").integer(), 12);  // other dataclasses untouched
-}
-
-TEST_F(PrefsCenter, AStoredFailedTagIsBelievedForTheConfiguredTimeOnly) {
-  vtc::test::LogCapture logged;
-  PreferenceStore::shared().setValue("inconsistency_ttl", vtc::Value(60), kVantorDefaultsKey,
-                                     Scope::AnyHost);
-  prefs.setFailedETag("\"t1\"", "Contacts");
-  EXPECT_EQ(perHost("etag.Contacts").string(), "\"t1\"");
-  EXPECT_EQ(perHost("etagTTL.Contacts").date(), time.now() + std::chrono::seconds(60));
-  EXPECT_THAT(logged.messages("Info"),
-              testing::Contains(testing::StartsWith(
-                  "Storing failed etag \"t1\" for dataclass Contacts with TTL date of 20")));
-  time.advance(vtc::Seconds(59));
-  EXPECT_EQ(prefs.failedETagForDataclass("Contacts"), "\"t1\"");
-  time.advance(vtc::Seconds(2));
-  EXPECT_FALSE(prefs.failedETagForDataclass("Contacts"));
 }
 
 TEST_F(PrefsCenter, AClientNameIsStoredWithoutControlCharacters) {

@@ -8,9 +8,10 @@
 #include <sys/wait.h>
 #include <unistd.h>
 
+#include <ctime>
 #include <filesystem>
-#include <functional>
 #include <fstream>
+#include <functional>
 #include <thread>
 
 #include "VantorSyncManager/HostIdentity.h"
@@ -23,6 +24,7 @@
 #include "platform/plist/PlistCodec.h"
 #include "session/SyncReport.h"
 #include "support/FaultProxy.h"
+#include "support/SessionBus.h"
 #include "support/ShareTest.h"
 
 using testing::HasSubstr;
@@ -56,6 +58,16 @@ std::vector<SyncEngineChange> someChanges(int count, const std::string& tag) {
         SyncEngineChange::kAdd, tag + "-" + std::to_string(i),
         vtc::Array{vtc::Value(vtc::Dictionary{{"action", "set"}, {"name", "FN"}, {"value", tag}})});
   return changes;
+}
+
+// "yyyy-MM-dd HH:mm:ss ZZZ" in GMT.
+std::string gmtText(vtc::Date date) {
+  const std::time_t t = std::chrono::system_clock::to_time_t(date);
+  std::tm tm{};
+  gmtime_r(&t, &tm);
+  char text[64];
+  std::strftime(text, sizeof text, "%Y-%m-%d %H:%M:%S +0000", &tm);
+  return text;
 }
 
 // The failure's name and reason, or "none".
@@ -135,7 +147,6 @@ INSTANTIATE_TEST_SUITE_P(Servers, Transfer, vtc::test::kEachServer, vtc::test::s
 
 TEST_P(Commit, PublishesWithThreeRequestsBeyondTheLockAndLeavesNoTemporaryFile) {
   session->getDataclassInfo(kDataclass);
-  EXPECT_FALSE(session->commitChanges({}, kDataclass, 1, false));  // sends nothing
   session->lockDataclass(kDataclass);
   const size_t before = share.accessEntries().size();
   const std::vector<SyncEngineChange> changes = someChanges(3, "first");
@@ -150,7 +161,7 @@ TEST_P(Commit, PublishesWithThreeRequestsBeyondTheLockAndLeavesNoTemporaryFile) 
   vtc::Dictionary r = record(kDataclass);
   EXPECT_EQ(r.get("maxversion").string(), "00001");
   EXPECT_FALSE(r.find("minversion"));  // only a reset commit sets it
-  EXPECT_EQ(r.get("lastsync").string(), vtc::textOf(vtc::Value(time.now())));
+  EXPECT_EQ(r.get("lastsync").string(), gmtText(time.now()));
   EXPECT_EQ(logged.count("Info", "com.korvo.Contacts Uploading changeLog with index 1"), 1u);
 
   // What another computer reads back: the changes and the creator headers.
@@ -445,11 +456,25 @@ TEST_F(CommitFaults, TwoProcessesRacingForOneIndexHaveExactlyOneWinnerEveryRound
   std::printf("racing commits: A won %d, B won %d of %d rounds\n", wins[0], wins[1], kRounds);
 }
 
-TEST_F(Fetch, GrowingBatchesAHoleInsideTheRangeAndMappedLargeChangelogs) {
+TEST_F(Fetch, GrowingBatchesAHoleInsideTheRangeMappedLargeChangelogsAndACancel) {
+  vtc::test::SessionBus bus;
+  vtc::test::NotificationListener progress;
   populate(kDataclass, 19);
+  EXPECT_FALSE(session->commitChanges({}, kDataclass, 20, false));  // nothing, not even progress
   // The twentieth is large enough to be held in a mapped file.
   ASSERT_TRUE(session->commitChanges(noisyChanges(2000), kDataclass, 20, false));
   auto fetched = session->fetchChangeLogsForDataclass(kDataclass, 1, 20);
+  // Progress reached the user's other programs: one per commit, then the fetch's.
+  std::vector<vtc::test::NotificationListener::Received> told;
+  for (int i = 0; i < 50 && told.size() < 21; ++i)
+    for (auto& r : progress.waitFor(std::chrono::milliseconds(200))) told.push_back(r);
+  ASSERT_EQ(told.size(), 21u);
+  for (size_t i = 0; i < told.size(); ++i) {
+    EXPECT_EQ(told[i].name, NubiloSyncProgressNotification) << i;
+    EXPECT_EQ(told[i].object, kDataclass) << i;
+    EXPECT_EQ(told[i].information.empty(), i < 20) << i;
+  }
+
   ASSERT_EQ(fetched.changeLogs.size(), 20u);
   EXPECT_EQ(fetched.changeLogs.at(7)->changes(), someChanges(1, "c7"));
   EXPECT_TRUE(dynamic_cast<NubiloMappedChangelog*>(fetched.changeLogs.at(20).get()));
@@ -460,16 +485,25 @@ TEST_F(Fetch, GrowingBatchesAHoleInsideTheRangeAndMappedLargeChangelogs) {
     total +=
         static_cast<int64_t>(std::filesystem::file_size(dataclassFolder(kDataclass) + "/" + name));
   EXPECT_EQ(fetched.StorageConsumed, total);
-  for (const char* batch : {"1 to 5", "6 to 14", "15 to 20"})
-    EXPECT_EQ(logged.count("Info", std::string("Processing batched clogs from ") + batch +
-                                       " for com.korvo.Contacts"),
-              1u)
-        << batch;
   EXPECT_EQ(logged.count("Info", "Downloaded changelog 3 (" +
                                      std::to_string(std::filesystem::file_size(
                                          dataclassFolder(kDataclass) + "/00003.clog")) +
                                      " bytes) of 20 for dataclass com.korvo.Contacts"),
             1u);
+
+  // Batches grow from 5 changelogs and stop growing at 257.
+  for (int i = 21; i <= 800; ++i)
+    std::filesystem::copy_file(dataclassFolder(kDataclass) + "/00001.clog",
+                               dataclassFolder(kDataclass) + vtc::format("/%05i.clog", i));
+  EXPECT_EQ(session->fetchChangeLogsForDataclass(kDataclass, 1, 800).changeLogs.size(), 800u);
+  const std::pair<const char*, size_t> batches[] = {{"1 to 5", 2},     {"6 to 14", 2},
+                                                    {"15 to 20", 1},   {"259 to 515", 1},
+                                                    {"516 to 772", 1}, {"773 to 800", 1}};
+  for (const auto& [batch, fetches] : batches)
+    EXPECT_EQ(logged.count("Info", std::string("Processing batched clogs from ") + batch +
+                                       " for com.korvo.Contacts"),
+              fetches)
+        << batch;
 
   // A single index; a 404 there is a failed download. Inside a range it is
   // a hole in the stream.
@@ -488,14 +522,21 @@ TEST_F(Fetch, GrowingBatchesAHoleInsideTheRangeAndMappedLargeChangelogs) {
   // Each 404 was asked once more after a pause, through the sleeper.
   EXPECT_EQ(time.sleeps(), std::vector<double>(4, 30.0));
 
-  // Negative bounds fetch nothing; a cancelled session stops every batch.
+  // Negative bounds fetch nothing. A cancel while the third downloads ends
+  // the fetch after that download; no later batch asks for anything.
   EXPECT_TRUE(session->fetchChangeLogsForDataclass(kDataclass, -1, 4).changeLogs.empty());
-  session->cancel();
+  proxy.clear();
   const size_t gets = proxy.count("GET");
+  proxy.delay({"GET", session->changeLogPathForDataclass(kDataclass, 3), 1}, 300);
+  std::thread canceller([&] {
+    vtc::local::waitUntil([&] { return proxy.count("GET") == gets + 3; });
+    session->cancel();
+  });
   auto cancelled = session->fetchChangeLogsForDataclass(kDataclass, 1, 4);
-  EXPECT_TRUE(cancelled.changeLogs.empty());
-  EXPECT_EQ(cancelled.StorageConsumed, 0);
-  EXPECT_EQ(proxy.count("GET"), gets);
+  canceller.join();
+  EXPECT_EQ(cancelled.changeLogs.size(), 3u);
+  EXPECT_EQ(proxy.count("GET"), gets + 3);
+  EXPECT_TRUE(session->fetchChangeLogsForDataclass(kDataclass, 1, 2).changeLogs.empty());
 }
 
 TEST_F(Fetch, EachDownloadFailingInEachWayRaisesItsKind) {
@@ -531,13 +572,18 @@ TEST_F(Fetch, EachDownloadFailingInEachWayRaisesItsKind) {
       EXPECT_EQ(result.changeLogs.size(), 5u);
     }
   }
-  // The failures were reported as final, under the fetch's own message.
-  EXPECT_THAT(traces.withDomain("com.korvo.sync.nubilosession.retrytransaction.final"),
-              testing::Not(testing::IsEmpty()));
   proxy.clear();
   proxy.answer({"GET", third, 0}, 500);
   EXPECT_EQ(failureOf([&] { quick->fetchChangeLogForDataclass(kDataclass, 3); }).first,
             NubiloFailedToDownloadChangelogException);
+  // The two refusals of the batched fetch and the single one were reported
+  // as final under the fetch's own messages (a dropped connection under the
+  // request's).
+  std::vector<std::string> finals;
+  for (const auto& r : traces.withDomain("com.korvo.sync.nubilosession.retrytransaction.final"))
+    finals.push_back(vtc::test::TraceCapture::field(r, "MESSAGE"));
+  EXPECT_EQ(std::ranges::count(finals, "Failed to get attributes on changelog"), 2);
+  EXPECT_EQ(std::ranges::count(finals, "Failed download changelog"), 1);
 
   // A changelog of no bytes, answered 200, is an empty one: damage, whichever
   // fetch meets it, and nothing of it is left in the temporary folder.
@@ -580,7 +626,22 @@ TEST_P(Transfer, DirectoriesOfChangelogsAndTakingBackTheNewestCommit) {
   std::filesystem::copy_file(local + "/" + kDataclass + "/00002.clog",
                              upload + "/nested/00022.clog");
   std::ofstream(upload + "/notes.txt") << "not a changelog";
+  // Each entry takes as long as a whole lock lasts: both locks are renewed
+  // before each, once half the lock duration has passed (the two PUTs come
+  // after the two first locks and the first renewal, then two entries apart).
+  const size_t before = proxy.requests().size();
+  time.advanceOnEveryReading(vtc::Seconds(240));
   session->putChangeLogsFromDirectory(upload, kDataclass, "needstruth", false);
+  time.advanceOnEveryReading(vtc::Seconds(0));
+  const auto seen = proxy.requests();
+  std::vector<int> locksBeforeEachPut{0};
+  for (size_t i = before; i < seen.size(); ++i) {
+    const std::string& method = seen[i].method;
+    if (method == "LOCK") ++locksBeforeEachPut.back();
+    if (method == "PUT") locksBeforeEachPut.push_back(0);
+  }
+  locksBeforeEachPut.pop_back();
+  EXPECT_EQ(locksBeforeEachPut, (std::vector<int>{4, 4}));
   vtc::Dictionary r = record(kDataclass);
   EXPECT_EQ(r.get("minversion").string(), "00010");
   EXPECT_EQ(r.get("maxversion").string(), "00022");
@@ -610,6 +671,13 @@ TEST_P(Transfer, DirectoriesOfChangelogsAndTakingBackTheNewestCommit) {
             "needstruth");
   session->setInfoForDataclass(vtc::Dictionary{{"maxversion", kNBRemoveProp}}, kDataclass);
   EXPECT_FALSE(session->removeLastChangelogForDataclass(kDataclass));
+
+  // Cleared first: only what was uploaded is there, and the range is its own.
+  session->putChangeLogsFromDirectory(upload, kDataclass, "normal", true);
+  EXPECT_EQ(logged.count("Info", "Clearing changelogs for dataclass: com.korvo.Contacts"), 1u);
+  EXPECT_EQ(filesOf(kDataclass), (std::vector<std::string>{"00021.clog", "00022.clog"}));
+  EXPECT_EQ(record(kDataclass).get("minversion").string(), "00021");
+  EXPECT_EQ(record(kDataclass).get("maxversion").string(), "00022");
 }
 
 TEST_P(Transfer, ReportsAreFlattenedAndStoredUnderTheMachinesUUID) {
@@ -619,6 +687,8 @@ TEST_P(Transfer, ReportsAreFlattenedAndStoredUnderTheMachinesUUID) {
       {"SyncType", "manual"},
       {"Contacts", vtc::Dictionary{{"ClogCount", 3},
                                    {"SyncStart", start},
+                                   {"SyncEnd", std::chrono::system_clock::from_time_t(1299230430)},
+                                   {"SyncDuration", 0.1},
                                    {"SyncMode", "slow"},
                                    {"Error", "NubiloLockFailureException"}}},
       {"Calendars", vtc::Dictionary{}},
@@ -631,7 +701,9 @@ TEST_P(Transfer, ReportsAreFlattenedAndStoredUnderTheMachinesUUID) {
                              {"SyncStatus:duration", "2.5"},
                              {"RespondingServer", "apache-1"},
                              {"MachineGUID", "UUID-1"},
-                             {"Contacts:startTime", vtc::textOf(vtc::Value(start))},
+                             {"Contacts:startTime", gmtText(start)},
+                             {"Contacts:endTime", "2011-03-04 09:20:30 +0000"},
+                             {"Contacts:duration", "0.1"},  // the shortest text of the number
                              {"Contacts:clogCount", "3"},
                              {"Contacts:syncMode", "slow"},
                              {"Contacts:code", "NubiloLockFailureException"},
@@ -639,13 +711,23 @@ TEST_P(Transfer, ReportsAreFlattenedAndStoredUnderTheMachinesUUID) {
   EXPECT_EQ(vtc::flattenedSyncReport({}, std::nullopt, std::nullopt),
             (vtc::Dictionary{{"appName", "Granite"}, {"Version", "1"}, {"SyncStatus:code", "0"}}));
 
-  // The machine id keyed with the application's id: never the id itself.
+  // Without a host UUID the report names no machine and is stored under
+  // the client's guid.
   std::ofstream(home.path() + "/machine-id") << "0123456789abcdef0123456789abcdef\n";
+  vtc::forgetHostUUIDForTesting();
   vtc::os::setIdentityFileForTesting(home.path() + "/missing");
   EXPECT_FALSE(getHostUUIDString());
   EXPECT_THAT(logged.messages("Warning"),
               testing::Contains("getHostUUIDString: unable to determine UUID for host. "
                                 "Error: 2"));
+  session->sendReportingInfo(summary);
+  auto anonymous =
+      vtc::plist::readFile(share.diskPath(session->syncPath() + "/Reports/GUID-A.plist"));
+  ASSERT_TRUE(anonymous);
+  EXPECT_FALSE(anonymous->dictionary().find("MachineGUID"));
+  EXPECT_EQ(anonymous->dictionary().get("Contacts:clogCount").string(), "3");
+
+  // The machine id keyed with the application's id: never the id itself.
   vtc::os::setIdentityFileForTesting(home.path() + "/machine-id");
   EXPECT_EQ(getHostUUIDString(), "741A1DFD-7F8E-4733-9325-6F6DBE2C9B34");
   vtc::os::setIdentityFileForTesting(home.path() + "/missing");  // kept once found
@@ -665,7 +747,6 @@ TEST_P(Transfer, ReportsAreFlattenedAndStoredUnderTheMachinesUUID) {
   }
 
   session->sendReportingInfo(summary);
-  session->sendReportingInfo(summary);  // the second finds the collection
   auto stored = vtc::plist::readFile(
       share.diskPath(session->syncPath() + "/Reports/741A1DFD-7F8E-4733-9325-6F6DBE2C9B34.plist"));
   ASSERT_TRUE(stored);
@@ -673,6 +754,7 @@ TEST_P(Transfer, ReportsAreFlattenedAndStoredUnderTheMachinesUUID) {
   EXPECT_EQ(stored->dictionary().get("RespondingServer").string(),
             session->respondingServer().value_or("?"));
   vtc::os::setIdentityFileForTesting("");
+  vtc::forgetHostUUIDForTesting();
 }
 
 }  // namespace

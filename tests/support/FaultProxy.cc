@@ -79,6 +79,10 @@ FaultProxy::Rule FaultProxy::decide(const std::string& request) {
   std::lock_guard<std::mutex> lock(mutex_);
   Rule chosen;
   for (Rule& rule : rules_) {
+    if (!rule.match.after.empty() && !rule.counting) {
+      rule.counting = rule.match.after == method;
+      continue;
+    }
     if (!rule.match.method.empty() && rule.match.method != method) continue;
     if (!rule.match.path.empty() && davpath::canonical(rule.match.path) != davpath::canonical(path))
       continue;
@@ -96,6 +100,7 @@ void FaultProxy::serve(int client) {
   int server = connectLoopback(targetPort_);
   std::string pending;
   bool swallowing = false;  // after a time-out nothing more is forwarded
+  bool deaf = false;        // after a lost answer nothing more reaches the client
   bool open = server >= 0;
   char buf[65536];
   while (open) {
@@ -104,7 +109,7 @@ void FaultProxy::serve(int client) {
     if ((fds[0].revents | fds[1].revents) & (POLLERR | POLLNVAL)) break;  // a broken socket
     if (fds[1].revents & (POLLIN | POLLHUP)) {
       ssize_t n = ::recv(server, buf, sizeof buf, 0);
-      if (n <= 0 || !sendAll(client, {buf, static_cast<size_t>(n)})) break;
+      if (n <= 0 || (!deaf && !sendAll(client, {buf, static_cast<size_t>(n)}))) break;
     }
     if (fds[0].revents & (POLLIN | POLLHUP)) {
       ssize_t n = ::recv(client, buf, sizeof buf, 0);
@@ -119,7 +124,10 @@ void FaultProxy::serve(int client) {
                  rule.answer->head.find("Content-Length:") != std::string::npos;
         else if (rule.action == "timed out")
           swallowing = true;
-        else if (rule.action == "dropped")
+        else if (rule.action == "answer lost") {
+          open = sendAll(server, std::string_view(pending).substr(0, length));
+          swallowing = deaf = true;
+        } else if (rule.action == "dropped")
           open = false;
         else if (rule.status != 0)
           open = sendAll(client, answerWith(rule.status));

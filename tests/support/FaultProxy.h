@@ -1,9 +1,11 @@
 // A fault-injecting HTTP proxy between the library and a server on
 // 127.0.0.1. It forwards everything byte for byte, except requests that a
 // rule matches: those time out (swallowed, never answered), lose their
-// connection, or get an answer of the test's choosing (a status, or any
-// bytes at any pace: HostileServer.h). Requests are matched by method and
-// unescaped path, on every occurrence or only the nth.
+// connection, get an answer of the test's choosing (a status, or any bytes
+// at any pace: HostileServer.h), or reach the server with its answer lost
+// on the way back. Requests are matched by method and unescaped path, on
+// every occurrence or only the nth, counted from the start or from the
+// first request of another method.
 // Rules and records may be touched from any thread while the proxy serves.
 #pragma once
 
@@ -18,9 +20,12 @@
 namespace vtc::test {
 
 struct Match {
+  Match(std::string m = {}, std::string p = {}, int n = 0, std::string a = {})
+      : method(std::move(m)), path(std::move(p)), occurrence(n), after(std::move(a)) {}
   std::string method;  // empty: any method
   std::string path;    // empty: any path; else the unescaped path (a trailing "/" is ignored)
   int occurrence = 0;  // 0: every matching request; n: only the nth (1-based)
+  std::string after;   // non-empty: counting starts after the first request of this method
 };
 
 class FaultProxy {
@@ -28,7 +33,8 @@ class FaultProxy {
   struct Seen {
     std::string method;
     std::string path;
-    std::string action;  // "forwarded", "timed out", "dropped", "delayed" or "answered <status>"
+    // "forwarded", "timed out", "dropped", "delayed", "answer lost" or "answered <status>"
+    std::string action;
   };
 
   explicit FaultProxy(int targetPort);
@@ -38,21 +44,25 @@ class FaultProxy {
 
   int port() const { return port_; }
 
-  void timeOut(Match match) { add({std::move(match), "timed out", 0, 0, 0, nullptr}); }
-  void dropConnection(Match match) { add({std::move(match), "dropped", 0, 0, 0, nullptr}); }
+  void timeOut(Match match) { add({std::move(match), "timed out", 0, 0, 0, nullptr, false}); }
+  void dropConnection(Match match) { add({std::move(match), "dropped", 0, 0, 0, nullptr, false}); }
+  // Forwards the request, so that the server carries it out, and swallows
+  // its answer and everything after it, as a client killed before it read
+  // the answer.
+  void loseAnswer(Match match) { add({std::move(match), "answer lost", 0, 0, 0, nullptr, false}); }
   // Answers with this status and no body instead of forwarding; a 401
   // carries a Basic challenge.
   void answer(Match match, int status) {
-    add({std::move(match), "answered " + std::to_string(status), status, 0, 0, nullptr});
+    add({std::move(match), "answered " + std::to_string(status), status, 0, 0, nullptr, false});
   }
   // Answers with exactly these bytes instead of forwarding.
   void respond(Match match, HostileAnswer answer) {
     add({std::move(match), "answered by the test", 0, 0, 0,
-         std::make_shared<HostileAnswer>(std::move(answer))});
+         std::make_shared<HostileAnswer>(std::move(answer)), false});
   }
   // Holds the request this long, then forwards it.
   void delay(Match match, int milliseconds) {
-    add({std::move(match), "delayed", 0, 0, milliseconds, nullptr});
+    add({std::move(match), "delayed", 0, 0, milliseconds, nullptr, false});
   }
   void clear();
 
@@ -68,6 +78,7 @@ class FaultProxy {
     int seen = 0;    // matching requests so far
     int delayMs = 0;
     std::shared_ptr<const HostileAnswer> answer;
+    bool counting = false;  // the request named by match.after was seen
   };
 
   void add(Rule rule);

@@ -1,7 +1,9 @@
-// A private mosquitto push server for one test: its own configuration under
-// a temporary folder, two accounts (the share's member and another, kept
-// hashed in a password file) each confined to its own topics by the per-user
-// rule that the README shows, optionally TLS with a self-signed certificate
+// A private mosquitto push server for one test, started from the guide's
+// own files (docs/mosquitto.conf and docs/mosquitto.acl) with its port,
+// password file and certificate in a temporary folder: three accounts (the
+// share's member, one whose name holds a "+", given the lines the guide
+// shows for such names, and another, kept hashed in a password file), each
+// confined to its own topics; optionally TLS with a self-signed certificate
 // for 127.0.0.1. Started in the foreground on a free 127.0.0.1 port, stopped
 // by its PID; it can be started again on the same port.
 #pragma once
@@ -20,8 +22,11 @@ class MqttBroker {
   // The account besides the share's member.
   static constexpr const char* kOtherUser = "mallory";
   static constexpr const char* kOtherPassword = "another secret";
-  // The rule each account is held to.
-  static constexpr const char* kAccessRule = "pattern readwrite korvo/nubilo/syncdav/%u/#";
+  // The guide's example of a name that no pattern rule applies to; its
+  // password is the share member's.
+  static constexpr const char* kPlusUser = "alice+sync@example.org";
+  // A file of the guide, docs/NAME in the source tree.
+  static std::string guideFile(const std::string& name);
 
   MqttBroker() : MqttBroker(Options{}) {}
   explicit MqttBroker(Options options);

@@ -1,5 +1,7 @@
 #include "support/UserManagerStandIn.h"
 
+#include <algorithm>
+
 #include "platform/jobs/Crontab.h"
 #include "platform/jobs/UserManager.h"
 
@@ -22,6 +24,13 @@ UserManagerStandIn::UserManagerStandIn() {
     process::CommandResult r;
     r.status = status_;
     r.err = message_;
+    const auto has = [&](const char* a) { return std::ranges::count(arguments, a) > 0; };
+    const bool starts = has("start") || (has("enable") && has("--now"));
+    if (r.status == 0 && jobsFail_ && starts && !has("--no-block")) {
+      r.status = 1;
+      r.err = "Job for " + arguments.back() +
+              " failed because the control process exited with error code.\n";
+    }
     return r;
   });
   jobs::crontabSeam().install(

@@ -20,6 +20,10 @@ class UserManagerStandIn {
   void forgetCalls();
   // Later calls fail with this status and message.
   void refuse(int status, const std::string& message);
+  // The jobs started from now on fail, as a sync that fails does: a start
+  // that waits for its job (`--now` without `--no-block`) fails with it, as
+  // the real manager's does.
+  void failStartedJobs() { jobsFail_ = true; }
 
   // The crontab; none means the user has none. Without a crontab program
   // every crontab call fails as a missing program does.
@@ -33,6 +37,7 @@ class UserManagerStandIn {
   std::vector<std::string> crontabCalls_;
   int status_ = 0;
   std::string message_;
+  bool jobsFail_ = false;
 };
 
 }  // namespace vtc::test

@@ -10,13 +10,10 @@
 #include "platform/dav/TesselSession.h"
 #include "platform/prefs/PreferenceStore.h"
 #include "platform/secrets/CredentialStore.h"
-#include "localshare/ApacheShare.h"
-#include "support/FakeTime.h"
 #include "support/FaultProxy.h"
-#include "support/LogCapture.h"
 #include "support/SessionBus.h"
 #include "support/SharePreferences.h"
-#include "support/TestHome.h"
+#include "support/ShareTest.h"
 
 using testing::ElementsAre;
 using testing::StartsWith;
@@ -24,13 +21,9 @@ using testing::UnorderedElementsAre;
 
 namespace {
 
-class Maintenance : public ::testing::Test {
+class Maintenance : public vtc::test::ShareTest {
  protected:
-  vtc::test::TestHome home;
-  vtc::test::LogCapture logged;
-  vtc::test::FakeTime time;
   vtc::test::SessionBus bus;
-  vtc::local::ApacheShare share;
   vtc::test::FaultProxy proxy{share.port()};
 
   void SetUp() override {
@@ -44,11 +37,6 @@ class Maintenance : public ::testing::Test {
     vtc::prefs::PreferenceStore::shared().setValue("KitbagMember", vtc::Value("alice"),
                                                    kVantorDefaultsKey, vtc::prefs::Scope::AnyHost);
   }
-  // A session of our own, straight to the share.
-  std::unique_ptr<NubiloRemoteSession> direct() const {
-    vtc::Dictionary config = share.configuration();
-    return NubiloRemoteSession::sessionWithUsername("alice", "wonderland", config);
-  }
   // The Error lines written by the function itself (the session may add its own).
   std::vector<std::string> errors(const std::string& ending) const {
     std::vector<std::string> out = logged.messages("Error");
@@ -59,7 +47,7 @@ class Maintenance : public ::testing::Test {
 
 TEST_F(Maintenance, DataclassesAreRemovedEachInTurnAndOneFailedRemovalIsReported) {
   storeAccount();
-  auto mine = direct();
+  auto mine = openSession();  // straight to the share
   for (const char* dc : {"A", "B", "C"}) mine->getDataclassInfo(dc);
   mine->tesselSession().makeCollectionAtPath(mine->schemasPath() + "/Stray", false);
   EXPECT_THAT(*registeredDataclasses(),
@@ -98,7 +86,7 @@ TEST_F(Maintenance, WithoutAStoredAccountEveryFunctionLogsAndGivesItsNeutralResu
 
 TEST_F(Maintenance, StorageIsWorkedOutOnceAndThenTakenFromThePreferences) {
   storeAccount();
-  auto mine = direct();
+  auto mine = openSession();  // straight to the share
   mine->getDataclassInfo("Contacts");
   mine->tesselSession().putData({'a', 'b', 'c'}, mine->changeLogPathForDataclass("Contacts", 1));
   mine->tesselSession().putData({'d', 'e', 'f', 'g'},

@@ -120,9 +120,10 @@ class TesselSession {
   // attribute dictionaries. The collection is asked for with its trailing "/".
   DavTransaction listCollectionAtPath(const std::string& path);
 
-  // Stores a flattened sync report as "<reportsPath>/<MachineGUID>.plist"
-  // (the collection is made on first use).
-  DavTransaction _sendReportingInfo(const vtc::Dictionary& report, const std::string& reportsPath);
+  // Stores a flattened sync report as "<reportsPath>/<name>.plist" (the
+  // collection is made on first use).
+  DavTransaction _sendReportingInfo(const vtc::Dictionary& report, const std::string& reportsPath,
+                                    const std::string& name);
 
   const std::string& owner() const { return owner_; }
   // The SHA-256 digest of the HTTPS server's certificate; empty over HTTP.

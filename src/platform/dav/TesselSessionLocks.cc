@@ -12,12 +12,12 @@
 #include <ctime>
 
 #include "VantorSyncManager/PublicNames.h"
-#include "VantorSyncManager/StringAdditions.h"
 #include "common/Clock.h"
 #include "platform/dav/DavConnection.h"
 #include "platform/dav/DavPaths.h"
 #include "platform/dav/LockRecord.h"
 #include "platform/dav/TesselSession.h"
+#include "platform/dav/XmlTree.h"
 
 namespace {
 
@@ -278,7 +278,7 @@ DavTransaction TesselSession::_unlockResourceAtPath(const std::string& path) {
 }
 
 DavTransaction TesselSession::lockResourceAtPath(const std::string& path) {
-  return _lockResourceAtPath(path, vtc::kDefaultLockSeconds, stringByXMLQuoting(owner_));
+  return _lockResourceAtPath(path, vtc::kDefaultLockSeconds, vtc::xmlEscape(owner_));
 }
 
 DavTransaction TesselSession::unlockResourceAtPath(const std::string& path) {

@@ -2,7 +2,6 @@
 
 #include <algorithm>
 
-#include "VantorSyncManager/StringAdditions.h"
 #include "common/Format.h"
 #include "common/Limits.h"
 
@@ -95,7 +94,27 @@ int XmlTreeBuilder::endElement(void* userdata, int, const char*, const char*) {
 }
 
 std::string xmlEscape(std::string_view text) {
-  return stringByXMLQuoting(text);
+  std::string out;
+  out.reserve(text.size() + 16);
+  for (char c : text) {
+    switch (c) {
+      case '&':
+        out += "&amp;";
+        break;
+      case '<':
+        out += "&lt;";
+        break;
+      case '>':
+        out += "&gt;";
+        break;
+      case '"':
+        out += "&quot;";
+        break;
+      default:
+        out += c;
+    }
+  }
+  return out;
 }
 
 }  // namespace vtc

@@ -53,7 +53,9 @@ class XmlTreeBuilder {
   std::vector<XmlElement*> stack_;
 };
 
-// The text with &, <, > and quotes escaped for XML content and attributes.
+// The text with "&", "<", ">" and the double quote replaced by their XML
+// entities (ampersand first), for content and double-quoted attributes; the
+// apostrophe is left as it is.
 std::string xmlEscape(std::string_view text);
 
 }  // namespace vtc

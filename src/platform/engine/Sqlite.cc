@@ -1,10 +1,19 @@
 #include "platform/engine/Sqlite.h"
 
+#include <new>
+
 namespace vtc::engine {
 
 namespace {
 
+// Memory this computer cannot give is no damage of the database: it
+// travels as std::bad_alloc, never as an EngineError.
+void throwIfOutOfMemory(int code) {
+  if (code == SQLITE_NOMEM) throw std::bad_alloc();
+}
+
 [[noreturn]] void fail(sqlite3* db, const std::string& what) {
+  throwIfOutOfMemory(sqlite3_errcode(db));
   throw EngineError(what + ": " + sqlite3_errmsg(db));
 }
 
@@ -84,8 +93,13 @@ bool Statement::isNull(int column) const {
 }
 
 Database::Database(const std::string& path) {
-  if (sqlite3_open_v2(path.c_str(), &db_, SQLITE_OPEN_READWRITE | SQLITE_OPEN_CREATE, nullptr) !=
-      SQLITE_OK) {
+  const int opened =
+      sqlite3_open_v2(path.c_str(), &db_, SQLITE_OPEN_READWRITE | SQLITE_OPEN_CREATE, nullptr);
+  if (opened != SQLITE_OK) {
+    if (opened == SQLITE_NOMEM) {
+      sqlite3_close(db_);
+      throw std::bad_alloc();
+    }
     std::string why = db_ ? sqlite3_errmsg(db_) : "out of memory";
     sqlite3_close(db_);
     throw EngineError("cannot open the sync engine database " + path + ": " + why);
@@ -100,9 +114,11 @@ Database::~Database() {
 
 void Database::exec(const char* sql) {
   char* error = nullptr;
-  if (sqlite3_exec(db_, sql, nullptr, nullptr, &error) != SQLITE_OK) {
+  const int done = sqlite3_exec(db_, sql, nullptr, nullptr, &error);
+  if (done != SQLITE_OK) {
     std::string why = error ? error : sqlite3_errmsg(db_);
     sqlite3_free(error);
+    throwIfOutOfMemory(done);
     throw EngineError(std::string("sync engine database: ") + why);
   }
 }
@@ -114,6 +130,7 @@ void Database::copyFrom(const std::string& path) {
     throw EngineError(std::string("cannot copy the sync engine database: ") + sqlite3_errmsg(db_));
   const int stepped = sqlite3_backup_step(backup, -1);
   sqlite3_backup_finish(backup);
+  throwIfOutOfMemory(stepped);
   if (stepped != SQLITE_DONE)
     throw EngineError("cannot copy the sync engine database " + path + ": " +
                       sqlite3_errstr(stepped));

@@ -1,5 +1,6 @@
 // Thin RAII over SQLite: a connection and prepared statements whose errors
-// raise EngineError with SQLite's own words.
+// raise EngineError with SQLite's own words, except SQLite running out of
+// memory, which raises std::bad_alloc.
 #pragma once
 
 #include <sqlite3.h>

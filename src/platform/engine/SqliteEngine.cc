@@ -4,7 +4,6 @@
 
 #include <sys/stat.h>
 
-#include "VantorSyncManager/VTCPrefsCenter.h"
 #include "common/Clock.h"
 #include "common/Logging.h"
 #include "platform/fs/LocalPaths.h"
@@ -78,7 +77,7 @@ std::string SyncEngine::bundleVersion() {
 }
 
 std::unique_ptr<SyncEngine> SyncEngine::open() {
-  std::string folder = VTCPrefsCenter::applicationSupportDirectory().value_or(
+  std::string folder = paths::supportFolder().value_or(
       paths::join(paths::applicationSupportDirectory(), "NubiloSyncClient"));
   paths::makeDirectories(folder, 0700);
   return open(paths::join(folder, "SyncEngine.sqlite"));
@@ -89,7 +88,7 @@ std::unique_ptr<SyncEngine> SyncEngine::open(const std::string& path) {
 }
 
 std::unique_ptr<SyncEngine> SyncEngine::openInMemoryCopy() {
-  std::string folder = VTCPrefsCenter::applicationSupportDirectory().value_or(
+  std::string folder = paths::supportFolder().value_or(
       paths::join(paths::applicationSupportDirectory(), "NubiloSyncClient"));
   paths::makeDirectories(folder, 0700);
   return std::make_unique<SqliteEngine>(paths::join(folder, "SyncEngine.sqlite"), true);
@@ -139,6 +138,12 @@ void SqliteEngine::registerClient(const std::string& client, const Dictionary& d
               "INSERT INTO clients (id, description, settings) VALUES (?1, ?2, ?3) "
               "ON CONFLICT(id) DO UPDATE SET description = excluded.description");
   s.bind(1, client).bind(2, encode(Value(description))).bind(3, encode(Value(Dictionary{}))).run();
+}
+
+bool SqliteEngine::hasClient(const std::string& client) {
+  Statement s(db_.handle(), "SELECT 1 FROM clients WHERE id = ?1");
+  s.bind(1, client);
+  return s.step();
 }
 
 Dictionary SqliteEngine::clientSettings(const std::string& client) {

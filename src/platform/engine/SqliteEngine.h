@@ -19,6 +19,7 @@ class SqliteEngine final : public SyncEngine {
 
   std::string version() override;
   void registerClient(const std::string& client, const Dictionary& description) override;
+  bool hasClient(const std::string& client) override;
   Value objectForKey(const std::string& client, const std::string& key) override;
   void setObjectForKey(const std::string& client, const std::string& key,
                        const Value& value) override;

@@ -3,7 +3,8 @@
 // SyncEngineChange lists, then pushes back what other computers committed.
 // One SQLite database in the support folder, shared by every process of the
 // user (WAL, busy timeout). Failures raise vtc::engine::EngineError; invalid
-// changes std::invalid_argument. An object is used from one thread.
+// changes std::invalid_argument; memory SQLite cannot get std::bad_alloc.
+// An object is used from one thread.
 #pragma once
 
 #include <cstdint>
@@ -152,6 +153,8 @@ class SyncEngine {
 
   // Client records: registered with a description, with settings by key.
   virtual void registerClient(const std::string& client, const Dictionary& description) = 0;
+  // Whether the client has been registered.
+  virtual bool hasClient(const std::string& client) = 0;
   virtual Value objectForKey(const std::string& client, const std::string& key) = 0;
   virtual void setObjectForKey(const std::string& client, const std::string& key,
                                const Value& value) = 0;

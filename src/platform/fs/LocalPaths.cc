@@ -5,7 +5,10 @@
 #include <unistd.h>
 
 #include <cerrno>
+#include <cstdio>
 #include <cstdlib>
+#include <cstring>
+#include <mutex>
 #include <vector>
 
 namespace vtc::paths {
@@ -69,6 +72,31 @@ bool makeDirectories(const std::string& path, int mode) {
   }
   if (::mkdir(path.c_str(), static_cast<mode_t>(mode)) == 0) return true;
   return errno == EEXIST && ::stat(path.c_str(), &st) == 0 && S_ISDIR(st.st_mode);
+}
+
+std::optional<std::string> supportFolder() {
+  // Kept per home: tests change homes within a process.
+  static std::mutex mutex;
+  static std::optional<std::string> cached;
+  static std::string cachedBase;
+  std::lock_guard<std::mutex> lock(mutex);
+  std::string base = applicationSupportDirectory();
+  if (cached && base == cachedBase) return cached;
+  cachedBase = base;
+  cached.reset();
+  if (base.empty()) return std::nullopt;
+  std::string path = join(base, "NubiloSyncClient");
+  struct stat st {};
+  if (::stat(path.c_str(), &st) == 0) {
+    if (S_ISDIR(st.st_mode)) return cached = path;
+    if (::unlink(path.c_str()) != 0) return std::nullopt;
+  }
+  if (!makeDirectories(path, 0700)) {
+    std::fprintf(stderr, "createDirectoryAtPath:%s failed %s\n", path.c_str(),
+                 std::strerror(errno));
+    return std::nullopt;
+  }
+  return cached = path;
 }
 
 }  // namespace vtc::paths

@@ -3,6 +3,7 @@
 // folders.
 #pragma once
 
+#include <optional>
 #include <string>
 #include <string_view>
 
@@ -21,6 +22,12 @@ std::string cachesDirectory();              // $XDG_CACHE_HOME or ~/.cache
 std::string applicationSupportDirectory();  // $XDG_DATA_HOME or ~/.local/share
 std::string configDirectory();              // $XDG_CONFIG_HOME or ~/.config
 std::string temporaryDirectory();           // $TMPDIR or /tmp
+
+// The library's own folder, applicationSupportDirectory()/NubiloSyncClient:
+// made owner-only on first use (a file in its place is removed first) and
+// kept for the home it was made in. None, with a line on standard error,
+// when it cannot be made.
+std::optional<std::string> supportFolder();
 
 // Creates path and its missing parents with the given mode; true when the
 // folder exists afterwards.

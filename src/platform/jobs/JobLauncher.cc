@@ -47,8 +47,10 @@ bool jobSubmit(const Dictionary& description, std::string& error) {
   if (!call({"daemon-reload"}, error)) return false;
   if (units->enabled.empty()) return true;
   // Enabled by path: a manager whose own configuration folder is elsewhere
-  // links them in.
-  std::vector<std::string> enable{"enable", "--now"};
+  // links them in. The start is queued, not waited for: a job that runs at
+  // load (a whole sync) never runs in the caller, and its failure is no
+  // failure to submit it.
+  std::vector<std::string> enable{"enable", "--now", "--no-block"};
   for (const std::string& name : units->enabled) enable.push_back(paths::join(folder, name));
   return call(enable, error);
 }

@@ -10,9 +10,10 @@
 
 namespace vtc::jobs {
 
-// Writes the description's units, reloads the user manager and enables and
-// starts them (`enable --now`). On failure error holds a sentence and false
-// is returned; units already written stay.
+// Writes the description's units, reloads the user manager and enables them
+// with their start queued (`enable --now --no-block`): the job never runs in
+// the caller, and how it ends is no part of the answer. On failure error
+// holds a sentence and false is returned; units already written stay.
 bool jobSubmit(const Dictionary& description, std::string& error);
 
 // Disables and stops the label's units (waiting for them to stop unless

@@ -2,7 +2,6 @@
 
 #include <unistd.h>
 
-#include "VantorSyncManager/VTCPrefsCenter.h"
 #include "platform/fs/LocalPaths.h"
 #include "platform/plist/PlistCodec.h"
 
@@ -19,7 +18,7 @@ std::vector<std::string> strings(const Value& array) {
 }  // namespace
 
 std::optional<std::string> registrationsFile() {
-  std::optional<std::string> folder = VTCPrefsCenter::applicationSupportDirectory();
+  std::optional<std::string> folder = paths::supportFolder();
   if (!folder) return std::nullopt;
   return paths::join(*folder, "PushRegistrations.plist");
 }

@@ -3,6 +3,7 @@
 // pushing at once.
 #include <gmock/gmock.h>
 
+#include <sqlite3.h>
 #include <sys/wait.h>
 #include <unistd.h>
 
@@ -318,12 +319,17 @@ TEST_F(Engine, TwoProcessesPushingAtOnceLoseNothing) {
   EXPECT_EQ(sync("net").size(), 200u);
 }
 
-TEST_F(Engine, ADamagedDatabaseIsReportedAndLeftInPlace) {
+TEST_F(Engine, ADamagedDatabaseIsReportedAndLeftInPlaceAndMissingMemoryIsNoDamage) {
   std::string broken = home.path() + "/broken.sqlite";
   std::ofstream(broken) << std::string(8192, 'x');
   EXPECT_THAT([&] { SyncEngine::open(broken); },
               ::testing::ThrowsMessage<vtc::engine::EngineError>(HasSubstr("left in place")));
   EXPECT_EQ(std::filesystem::file_size(broken), 8192u);
+
+  sqlite3_hard_heap_limit64(1);  // every allocation of SQLite fails from here
+  EXPECT_THROW(sync("app.a"), std::bad_alloc);
+  sqlite3_hard_heap_limit64(0);
+  EXPECT_TRUE(sync("app.a").empty());
 }
 
 }  // namespace
