@@ -68,7 +68,7 @@ int runCommandLine(int argc, char** argv) {
       ->delimiter(',');
   app.set_version_flag("--version", "nubilosyncclient " + std::string(kClientVersion));
   app.add_flag("-q,--quiet", quiet, "Print nothing but errors");
-  app.add_flag("-v,--verbose", verbose, "Say more");
+  app.add_flag("-v,--verbose", verbose, "Say more: a line per folder and per item synced");
 
   SetupRequest setup;
   std::string passwordCommand;
@@ -121,7 +121,8 @@ int runCommandLine(int argc, char** argv) {
   repair->add_option("NAME", repaired, "The dataclass")->required();
   repair->footer("Example: nubilosyncclient repair com.korvo.Contacts");
 
-  auto* conflicts = app.add_subcommand("conflicts", "List the kept losing values of conflicts");
+  auto* conflicts = app.add_subcommand(
+      "conflicts", "List conflicts by the item's name, those of the other computers too");
   std::string conflictId;
   auto* restoreConflict =
       conflicts->add_subcommand("restore", "Make a losing value the current one (sent next sync)");
