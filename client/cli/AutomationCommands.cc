@@ -6,6 +6,7 @@
 
 #include "client/cli/Commands.h"
 #include "client/run/Automation.h"
+#include "client/run/ClientSchedule.h"
 #include "client/run/PushListener.h"
 #include "client/run/SyncFailure.h"
 #include "platform/push/PushService.h"
@@ -37,12 +38,16 @@ int scheduleCommand(bool on, const std::optional<std::string>& every, Output& ou
   }
   std::optional<ScheduleEvery> interval;
   if (every) interval = ScheduleEvery::parse(*every);
-  const std::string cadence = turnScheduleOn(interval);
-  if (output.verbosity > 0)
-    output.out << "Scheduled syncs are on: " << cadence
-               << " (schedules step by minute, hour, day or week), and once at each login.\n";
-  noteWithoutUserManager(std::string(autosync::kPeriodicLabel) + ".timer",
-                         "the schedule starts with the next login that has one.", output);
+  const ScheduleOutcome outcome = turnScheduleOn(interval);
+  if (output.verbosity > 0) {
+    output.out << "Scheduled syncs are on: " << outcome.cadence
+               << "; a sync missed while this computer slept or was off runs when it is back.\n";
+    if (!outcome.started)
+      output.out << "No systemd user manager runs here (or it refused "
+                 << std::string(kScheduleUnit) + ".timer"
+                 << "); the schedule starts with the next session that has one. On a computer "
+                    "without logins, `loginctl enable-linger` keeps one running.\n";
+  }
   return 0;
 }
 

@@ -12,12 +12,18 @@
 #include "client/cli/Commands.h"
 #include "client/cli/TerminalText.h"
 #include "client/run/Automation.h"
+#include "client/run/FailureText.h"
 #include "client/run/SyncFailure.h"
 #include "common/Clock.h"
 
 namespace vtc::client {
 
 namespace {
+
+#ifndef VSM_CLIENT_VERSION
+#define VSM_CLIENT_VERSION "unknown"
+#endif
+constexpr const char* kClientVersion = VSM_CLIENT_VERSION;
 
 // NUBILO_WAIT_SCALE multiplies every wait of the protocol (lock back-off,
 // the pause before asking again for a missing file): tests that run the
@@ -60,8 +66,9 @@ int runCommandLine(int argc, char** argv) {
   app.add_flag("--periodic", periodic, "With --sync: started by the schedule");
   app.add_option("--dataclasses", launchDataclasses, "With --sync: only these, comma-separated")
       ->delimiter(',');
+  app.set_version_flag("--version", "nubilosyncclient " + std::string(kClientVersion));
   app.add_flag("-q,--quiet", quiet, "Print nothing but errors");
-  app.add_flag("-v,--verbose", verbose, "Say more");
+  app.add_flag("-v,--verbose", verbose, "Say more: a line per folder and per item synced");
 
   SetupRequest setup;
   std::string passwordCommand;
@@ -126,16 +133,22 @@ int runCommandLine(int argc, char** argv) {
   repair->add_option("NAME", repaired, "The dataclass")->required();
   repair->footer("Example: nubilosyncclient repair com.korvo.Contacts");
 
-  auto* conflicts = app.add_subcommand("conflicts", "List the kept losing values of conflicts");
+  auto* conflicts = app.add_subcommand(
+      "conflicts", "List conflicts by the item's name, those of the other computers too");
   std::string conflictId;
   auto* restoreConflict =
       conflicts->add_subcommand("restore", "Make a losing value the current one (sent next sync)");
   restoreConflict->add_option("ID", conflictId, "As `conflicts` lists it")->required();
   auto* dropConflict = conflicts->add_subcommand("drop", "Forget a kept losing value");
-  dropConflict->add_option("ID", conflictId, "As `conflicts` lists it")->required();
+  bool dropAll = false;
+  auto* dropId = dropConflict->add_option("ID", conflictId, "As `conflicts` lists it");
+  auto* dropEvery = dropConflict->add_flag("--all", dropAll, "Forget every kept losing value");
+  dropId->excludes(dropEvery);
+  dropConflict->require_option(1);
   conflicts->footer("Example: nubilosyncclient conflicts restore 2cb0ddcd");
   restoreConflict->footer("Example: nubilosyncclient conflicts restore 2cb0ddcd");
-  dropConflict->footer("Example: nubilosyncclient conflicts drop 2cb0ddcd");
+  dropConflict->footer(
+      "Examples: nubilosyncclient conflicts drop 2cb0ddcd; nubilosyncclient conflicts drop --all");
   bool statusJson = false;
   auto* status = app.add_subcommand("status", "Say what this computer syncs and how it went");
   status->add_flag("--json", statusJson, "One JSON document, for scripts");
@@ -144,6 +157,26 @@ int runCommandLine(int argc, char** argv) {
       "Examples:\n  nubilosyncclient setup https://dav.example.org/sync --user alice\n"
       "  nubilosyncclient add contacts ~/.local/share/contacts/people\n"
       "  nubilosyncclient sync\n  nubilosyncclient status\n\nSee nubilosyncclient(1).");
+
+  std::string setting, settingValue;
+  auto* config = app.add_subcommand("config", "Show or change this computer's settings");
+  auto* configGet = config->add_subcommand("get", "Show one setting");
+  configGet->add_option("NAME", setting, "name or log-level")->required();
+  auto* configSet = config->add_subcommand("set", "Change one setting");
+  configSet->add_option("NAME", setting, "name or log-level")->required();
+  configSet->add_option("VALUE", settingValue, "Its new value")->required();
+  config->footer(
+      "Settings:\n  name       this computer's name, as the other computers see it\n"
+      "  log-level  error, warn, info or debug\n"
+      "Example: nubilosyncclient config set log-level info");
+
+  std::string forgotten;
+  bool forceForget = false;
+  auto* forget = app.add_subcommand(
+      "forget", "Drop a computer that is gone from the account (its record and its locks)");
+  forget->add_option("COMPUTER", forgotten, "Its name, as `status` lists it")->required();
+  forget->add_flag("--force", forceForget, "Also when it synced within the last week");
+  forget->footer("Example: nubilosyncclient forget \"Old laptop\"");
 
   std::string scheduleSwitch, every;
   auto* schedule = app.add_subcommand("schedule", "Sync by itself on a schedule, or stop");
@@ -159,8 +192,8 @@ int runCommandLine(int argc, char** argv) {
       ->required()
       ->check(CLI::IsMember({"on", "off"}));
   pushing->footer("Example: nubilosyncclient push on");
-  auto* listen =
-      app.add_subcommand("listen", "Receive pushes and sync on them (what the login service runs)");
+  auto* listen = app.add_subcommand(
+      "listen", "Receive pushes and sync on them (`push on` starts this at each login)");
   listen->footer("Example: nubilosyncclient listen");
 
   try {
@@ -206,6 +239,12 @@ int runCommandLine(int argc, char** argv) {
                                 ? std::nullopt
                                 : std::optional<std::string>(encryptPassphraseCommand),
                             output);
+    if (*config)
+      return configCommand(*configGet   ? "get"
+                           : *configSet ? "set"
+                                        : "",
+                           setting, settingValue, output);
+    if (*forget) return forgetCommand(forgotten, forceForget, output);
     if (*schedule)
       return scheduleCommand(scheduleSwitch == "on",
                              every.empty() ? std::nullopt : std::optional<std::string>(every),
@@ -224,8 +263,8 @@ int runCommandLine(int argc, char** argv) {
     std::cerr << "nubilosyncclient: " << shownSafely(e.what()) << "\n";
     return e.exitStatus();
   } catch (const NubiloException& e) {
-    std::cerr << "nubilosyncclient: " << shownSafely(e.reason()) << "\n";
-    return static_cast<int>(FailureKind::Other);
+    std::cerr << "nubilosyncclient: " << shownSafely(failureSentence("the account", e)) << "\n";
+    return static_cast<int>(failureKind(e));
   } catch (const std::bad_alloc&) {
     std::cerr << "nubilosyncclient: this computer could not give the command the memory it "
                  "needed; nothing more was done.\n";

@@ -52,6 +52,13 @@ int conflictsCommand(const std::string& action, const std::string& id, Output& o
 int statusCommand(bool json, Output& output);
 int scheduleCommand(bool on, const std::optional<std::string>& every, Output& output);
 int pushCommand(bool on, Output& output);
+// action: "" (list every setting), "get" or "set".
+int configCommand(const std::string& action, const std::string& name, const std::string& value,
+                  Output& output);
+// Where the log is, as a user would type it.
+std::string logFileShown();
+std::string configuredLogLevel();
+int forgetCommand(const std::string& computer, bool force, Output& output);
 // Runs until SIGTERM or SIGINT.
 int listenCommand(Output& output);
 

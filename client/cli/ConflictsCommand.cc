@@ -1,6 +1,10 @@
 // `conflicts`, `conflicts restore ID`, `conflicts drop ID`: the losing
 // values kept when two computers changed the same field.
+#include <algorithm>
 #include <ostream>
+
+#include "VantorSyncManager/NubiloException.h"
+#include "VantorSyncManager/VTCPrefsCenter.h"
 
 #include "client/cli/Commands.h"
 #include "client/cli/StatusText.h"
@@ -9,10 +13,14 @@
 #include "client/items/Meaning.h"
 #include "client/merge/RecordMerge.h"
 #include "client/merge/Restore.h"
+#include "client/run/Account.h"
+#include "client/run/AccountKey.h"
 #include "client/run/Collections.h"
 #include "client/run/ConflictStore.h"
 #include "client/run/DataclassSync.h"
+#include "client/run/FailureText.h"
 #include "client/run/FolderWrite.h"
+#include "client/run/SharedConflicts.h"
 #include "client/run/SyncFailure.h"
 #include "client/run/SyncOwner.h"
 #include "client/stores/VdirCollection.h"
@@ -22,35 +30,78 @@ namespace vtc::client {
 
 namespace {
 
-// A unit's lines on one line: folding undone, line ends dropped.
 std::string shown(const Value& value) {
-  if (value.isNone()) return "(removed)";
-  if (value.isDictionary()) return "(the whole item as it was here)";
-  std::string text(rawOf(value)), out;
-  for (size_t i = 0; i < text.size(); ++i) {
-    if (text[i] == '\r') continue;
-    if (text[i] == '\n') {
-      if (i + 1 < text.size() && (text[i + 1] == ' ' || text[i + 1] == '\t'))
-        ++i;  // a folded line goes on
-      else if (i + 1 < text.size())
-        out += " | ";
-      continue;
-    }
-    out += text[i];
-  }
-  return shownSafely(out);
+  return shownSafely(conflictValueLine(value));
 }
 
-// What the conflict is about: a property, an occurrence, or the item.
 std::string subject(const KeptConflict& c) {
-  if (c.field == merge::kRecordField) return "the item";
-  if (nameOf(c.field) == merge::kComponentName) {
-    const std::string_view scope = scopeOf(c.field);
-    const size_t first = scope.find('/'), second = scope.find('/', first + 1);
-    const std::string_view rid = scope.substr(first + 1, second - first - 1);
-    return rid.empty() ? "the series" : "the occurrence of " + std::string(rid);
+  return conflictSubject(c.field);
+}
+
+// Both values side by side, each under the computer it came from.
+void sideBySide(const std::string& keptHead, const std::string& kept, const std::string& lostHead,
+                const std::string& lost, std::ostream& out) {
+  const size_t width = std::min<size_t>(40, std::max({keptHead.size(), kept.size(), size_t{12}}));
+  auto padded = [&](const std::string& text) {
+    return text.size() >= width ? text : text + std::string(width - text.size(), ' ');
+  };
+  out << "          " << padded(keptHead) << " | " << lostHead << "\n"
+      << "          " << padded(kept) << " | " << lost << "\n";
+}
+
+// "Ann Smith: TEL  (ann.vcf, com.korvo.Contacts)"
+std::string heading(const std::string& name, const std::string& file, const std::string& what,
+                    const std::string& dataclass) {
+  const std::string shownName = shownSafely(name.empty() ? file : name);
+  return shownName + ": " + shownSafely(what) + "  (" +
+         (name.empty() || name == file ? "" : shownSafely(file) + ", ") + shownSafely(dataclass) +
+         ")";
+}
+
+// What the other computers of the account keep, as their records on the
+// share tell it; a share that cannot be asked is said in one line.
+void listOthers(Output& output) {
+  std::vector<SharedConflict> others;
+  try {
+    VTCPrefsCenter& prefs = VTCPrefsCenter::defaultCenter();
+    if (!prefs.syncTurnedOn()) return;
+    const auto [member, password] = storedCredentials();
+    auto session = openSession(member, password, prefs.configuration());
+    session->setAccountSeal(accountSeal(member));
+    const std::string own = prefs.clientGuid().value_or("");
+    for (const Value& client : session->getAllClientInfo()) {
+      const Dictionary& c = client.dictionary();
+      if (c.get("guid").string() == own) continue;
+      std::string text = c.get(kSharedConflictsKey).string();
+      if (const sealing::AccountSeal* seal = session->accountSeal()) {
+        // A list that does not open with this account's key is left out.
+        text = seal->openText(text, sealing::kSharedConflictsPurpose).value_or("");
+      }
+      for (SharedConflict& shared : readSharedConflicts(c.get("clientname").string(), text))
+        others.push_back(std::move(shared));
+    }
+  } catch (const SyncFailure& e) {
+    if (output.verbosity > 0)
+      output.err << "nubilosyncclient: the other computers' conflicts are not shown: "
+                 << shownSafely(e.what()) << "\n";
+    return;
+  } catch (const NubiloException& e) {
+    if (output.verbosity > 0)
+      output.err << "nubilosyncclient: the other computers' conflicts are not shown: "
+                 << shownSafely(failureSentence("the account", e)) << "\n";
+    return;
   }
-  return std::string(nameOf(c.field));
+  std::string computer;
+  for (const SharedConflict& c : others) {
+    if (c.computer != computer) {
+      computer = c.computer;
+      output.out << "\nKept on " << shownSafely(computer) << " (restore or drop them there):\n";
+    }
+    output.out << "  " << heading(c.name, c.file, c.field, c.dataclass) << "\n";
+    sideBySide("kept (from " + shownSafely(c.keptComputer) + ")", shownSafely(c.kept),
+               "lost (from " + shownSafely(c.lostComputer) + ", " + shownSafely(c.date) + ")",
+               shownSafely(c.lost), output.out);
+  }
 }
 
 KeptConflict findOrFail(const ConflictStore& store, const std::string& id) {
@@ -110,6 +161,14 @@ void restore(const KeptConflict& c) {
 
 int conflictsCommand(const std::string& action, const std::string& id, Output& output) {
   ConflictStore store;
+  if (action == "drop" && id.empty()) {
+    const auto all = store.list();
+    for (const KeptConflict& c : all) store.drop(c.id);
+    if (output.verbosity > 0)
+      output.out << "Dropped " << all.size() << (all.size() == 1 ? " conflict" : " conflicts")
+                 << "; the values that stand are unchanged.\n";
+    return 0;
+  }
   if (action == "restore" || action == "drop") {
     const KeptConflict c = findOrFail(store, id);
     if (action == "restore") restore(c);
@@ -122,25 +181,19 @@ int conflictsCommand(const std::string& action, const std::string& id, Output& o
     return 0;
   }
   const auto conflicts = store.list();
-  if (conflicts.empty()) {
-    if (output.verbosity > 0) output.out << "No conflicts are kept.\n";
-    return 0;
-  }
+  if (conflicts.empty() && output.verbosity > 0) output.out << "No conflicts are kept here.\n";
   for (const KeptConflict& c : conflicts) {
-    output.out << c.id << "  " << c.dataclass << "  " << shownSafely(c.file) << "  "
-               << shownSafely(subject(c))
-               << (c.name.empty() || c.name == c.file ? "" : "  (" + shownSafely(c.name) + ")")
-               << "\n";
+    output.out << c.id << "  " << heading(c.name, c.file, subject(c), c.dataclass) << "\n";
     if (c.field == merge::kRecordField && c.lost.isNone())
-      output.out << "    deleted here, and kept because " << shownSafely(c.keptComputer)
+      output.out << "          deleted here, and kept because " << shownSafely(c.keptComputer)
                  << " edited it; `nubilosyncclient conflicts restore " << c.id
                  << "` deletes it again\n";
     else
-      output.out << "    kept: " << shown(c.kept) << "  (from " << shownSafely(c.keptComputer)
-                 << ")\n"
-                 << "    lost: " << shown(c.lost) << "  (from " << shownSafely(c.lostComputer)
-                 << ", " << localTime(c.date) << ")\n";
+      sideBySide("kept (from " + shownSafely(c.keptComputer) + ")", shown(c.kept),
+                 "lost (from " + shownSafely(c.lostComputer) + ", " + localTime(c.date) + ")",
+                 shown(c.lost), output.out);
   }
+  listOthers(output);
   return 0;
 }
 

@@ -6,6 +6,7 @@
 #include "client/run/Automation.h"
 #include "client/run/Collections.h"
 #include "client/run/SyncFailure.h"
+#include "platform/fs/LocalPaths.h"
 
 namespace vtc::client {
 
@@ -18,7 +19,8 @@ int addCommand(const std::string& kindWordGiven, const std::string& folder,
   // Before anything is made: the name becomes paths on the share and here.
   if (dataclass) requirePlainDataclassName(*dataclass);
   std::error_code error;
-  std::filesystem::path path = std::filesystem::absolute(folder, error);
+  // A "~" that reached us (quoted, or from a script) means the home, as in a shell.
+  std::filesystem::path path = std::filesystem::absolute(paths::expandTilde(folder), error);
   if (error) throw SyncFailure(FailureKind::Usage, "\"" + folder + "\" is not a usable path.");
   path = path.lexically_normal();
   if (path.has_filename() == false) path = path.parent_path();

@@ -29,7 +29,7 @@ void ProgressLine::step(const std::string& dataclass, const char* what, size_t d
   if (total > 0) line += format(" %zu/%zu", done, total);
   if (bytes > 0) line += ", " + bytesText(bytes);
   const double elapsed = std::chrono::duration<double>(now - stepStarted_).count();
-  if (total > 0 && done > 0 && elapsed > 0.5) {
+  if (total > 0 && done > 0 && elapsed > 0.2) {
     const double left = elapsed * static_cast<double>(total - done) / static_cast<double>(done);
     line += format(", about %.0f s left", left);
   }

@@ -19,6 +19,7 @@
 #include "client/run/Account.h"
 #include "client/run/AccountKey.h"
 #include "client/run/Automation.h"
+#include "client/run/Collections.h"
 #include "client/run/ServerQualification.h"
 #include "client/run/SyncAreaFinding.h"
 #include "client/run/SyncFailure.h"
@@ -28,6 +29,7 @@
 #include "common/Uuid.h"
 #include "platform/dav/DavPaths.h"
 #include "platform/dav/TesselSession.h"
+#include "platform/fs/LocalPaths.h"
 #include "platform/sealing/KeyRecord.h"
 #include "prefs/ClientConfiguration.h"
 
@@ -170,7 +172,8 @@ Dictionary setupConfiguration(const SetupRequest& request, const ServerAddress& 
   configuration.merge(server.configurationKeys());
   if (request.caFile) {
     std::error_code error;
-    const std::filesystem::path path = std::filesystem::absolute(*request.caFile, error);
+    const std::filesystem::path path =
+        std::filesystem::absolute(paths::expandTilde(*request.caFile), error);
     if (error || !std::filesystem::is_regular_file(path))
       throw SyncFailure(FailureKind::Usage,
                         "There is no certificate file " + *request.caFile + ".");
@@ -290,10 +293,15 @@ int setupCommand(const SetupRequest& request, Output& output) {
   session->patchClientInfo(record);
   storeAccount(setup, guid, name);
   if (push) storePushServer(*push);
-  if (output.verbosity > 0)
+  if (output.verbosity > 0) {
     output.out << "Set up " << request.member << " at " << server.url() << " for this computer, "
-               << name << ".\nAdd a folder with `nubilosyncclient add contacts FOLDER` or "
-               << "`nubilosyncclient add calendars FOLDER`, then run `nubilosyncclient sync`.\n";
+               << name << ".\n";
+    if (configuredCollections().empty())
+      output.out << "Add a folder with `nubilosyncclient add contacts FOLDER` or "
+                 << "`nubilosyncclient add calendars FOLDER`, then run `nubilosyncclient sync`.\n";
+    else
+      output.out << "Its folders stay as they were; run `nubilosyncclient sync`.\n";
+  }
   return 0;
 }
 

@@ -15,7 +15,9 @@
 namespace vtc::client {
 
 int statusCommand(bool json, Output& output) {
-  const StatusReport status = gatherStatus();
+  StatusReport status = gatherStatus();
+  status.logFile = logFileShown();
+  status.logLevel = configuredLogLevel();
   if (json) {
     output.out << statusAsJson(status) << "\n";
   } else {

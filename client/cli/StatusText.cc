@@ -95,7 +95,9 @@ void printStatus(const StatusReport& s, std::ostream& out) {
       << (s.scheduleOn ? s.cadence + ", next " + localTime(s.nextScheduledSync)
                        : std::string("off"))
       << "\nPush: " << (s.pushOn ? "on" : "off")
-      << (s.pushServer.empty() ? "" : " (" + s.pushServer + ")") << "\n";
+      << (s.pushServer.empty() ? "" : " (" + s.pushServer + ")") << "\n"
+      << "Log: " << s.logFile << " (" << s.logLevel
+      << "; raise it with `nubilosyncclient config set log-level info`)\n";
   if (s.dataclasses.empty())
     out << "No folder is synced; add one with `nubilosyncclient add contacts|calendars FOLDER`.\n";
   for (const DataclassStatus& d : s.dataclasses) {
@@ -139,6 +141,7 @@ std::string statusAsJson(const StatusReport& s) {
   doc["schedule"] = {
       {"on", s.scheduleOn}, {"cadence", s.cadence}, {"next", optionalDate(s.nextScheduledSync)}};
   doc["push"] = {{"on", s.pushOn}, {"server", s.pushServer}};
+  doc["log"] = {{"file", s.logFile}, {"level", s.logLevel}};
   doc["dataclasses"] = nlohmann::json::array();
   for (const DataclassStatus& d : s.dataclasses)
     doc["dataclasses"].push_back({{"name", d.name},

@@ -6,8 +6,10 @@
 #include "VantorSyncManager/NubiloException.h"
 #include "VantorSyncManager/PublicNames.h"
 #include "VantorSyncManager/VTCPrefsCenter.h"
+#include "client/run/FailureText.h"
 #include "client/run/SyncFailure.h"
 #include "platform/dav/DavConnection.h"
+#include "platform/network/Reachability.h"
 #include "platform/prefs/PreferenceStore.h"
 #include "platform/secrets/CredentialStore.h"
 #include "platform/secrets/StoredAccount.h"
@@ -141,15 +143,33 @@ std::string serverOf(const Dictionary& configuration) {
          std::to_string(configuration.get("host_port").integer());
 }
 
-SyncFailure passwordRefused(const std::string& where, const std::string& member) {
-  return SyncFailure(FailureKind::Login,
-                     "The server at " + where + " refused the password for " + member +
-                         "; store the right one with `nubilosyncclient setup`.");
+// atSetup: the password was just given; else it is the stored one, which
+// setup stores again.
+SyncFailure passwordRefused(const std::string& where, const std::string& member, bool atSetup) {
+  return SyncFailure(
+      FailureKind::Login,
+      "The server at " + where + " refused the password for " + member +
+          (atSetup ? "; check the member name and the password, then run setup again."
+                   : "; if it changed, store the new one with `nubilosyncclient setup " +
+                         storedServerURL() + " --user " + member + "`."));
 }
 
-SyncFailure unreachable(const std::string& where) {
+SyncFailure unreachable(const std::string& where, const std::string& why = {}) {
   return SyncFailure(FailureKind::Unreachable, "Cannot reach the server at " + where +
+                                                   (why.empty() ? "" : " (" + why + ")") +
                                                    "; check the address and the network.");
+}
+
+// The server is asked for a connection first, briefly: one that is down is
+// told at once, not after the retries the session gives a passing fault.
+void requireReachable(const Dictionary& configuration, const std::string& where) {
+  const int64_t port = configuration.get("host_port").integer();
+  if (auto why = network::whyUnreachable(configuration.get("host_name").string(),
+                                         static_cast<int>(port > 0 ? port : 443), 5.0)) {
+    std::string reason = *why;
+    if (!reason.empty()) reason[0] = static_cast<char>(std::tolower(reason[0]));
+    throw unreachable(where, reason);
+  }
 }
 
 }  // namespace
@@ -158,6 +178,7 @@ std::unique_ptr<NubiloRemoteSession> openSession(const std::string& member,
                                                  const std::string& password,
                                                  Dictionary configuration) {
   const std::string where = serverOf(configuration);
+  requireReachable(configuration, where);
   configuration.set("Name", Value(member));
   auto account =
       MemberAccount::accountWithName(member, password, configuration.get("user_agent").string());
@@ -168,10 +189,9 @@ std::unique_ptr<NubiloRemoteSession> openSession(const std::string& member,
       throw certificateFailure(*connection->certificateRefusal(),
                                ServerAddress::fromConfiguration(configuration), member,
                                connection->certificateDigest());
-    if (e.name() == NubiloLoginFailureException) throw passwordRefused(where, member);
+    if (e.name() == NubiloLoginFailureException) throw passwordRefused(where, member, false);
     if (e.name() == NubiloNetworkFailureException) throw unreachable(where);
-    throw SyncFailure(FailureKind::Other,
-                      "The server at " + where + " did not accept the session: " + e.reason());
+    throw SyncFailure(failureKind(e), failureSentence("the account", e));
   }
 }
 
@@ -192,7 +212,7 @@ void checkShareRoot(const std::string& member, const std::string& password,
     throw certificateFailure(*connection->certificateRefusal(), server, member,
                              connection->certificateDigest());
   const int status = t.httpStatusCode();
-  if (status == 401) throw passwordRefused(where, member);
+  if (status == 401) throw passwordRefused(where, member, true);
   if (t.transactionState() != kTransactionCompleted) throw unreachable(where);
   if (status == 207) return;
   std::string answer = "answered " + std::to_string(status) + " to PROPFIND at " + root;

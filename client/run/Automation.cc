@@ -7,6 +7,7 @@
 #include "VantorSyncManager/PublicNames.h"
 #include "VantorSyncManager/VTCPrefsCenter.h"
 #include "client/run/Account.h"
+#include "client/run/ClientSchedule.h"
 #include "client/run/Collections.h"
 #include "client/run/SyncFailure.h"
 #include "common/Clock.h"
@@ -23,25 +24,6 @@
 namespace vtc::client {
 
 namespace {
-
-const char* const kDays[] = {"Sunday",   "Monday", "Tuesday",  "Wednesday",
-                             "Thursday", "Friday", "Saturday", "Sunday"};
-
-Dictionary scheduledCalendar() {
-  const Value job = plist::readFile(autosync::periodicJobFile()).value_or(Value());
-  return job.dictionary().get("StartCalendarInterval").dictionary();
-}
-
-std::string cadenceOf(const Dictionary& calendar) {
-  const std::string at =
-      format("%02lld:%02lld", calendar.get("Hour").integer(), calendar.get("Minute").integer());
-  if (const Value* day = calendar.find("Weekday"))
-    return std::string("weekly on ") + kDays[day->integer() % 8] + " at " + at;
-  if (calendar.contains("Hour")) return "daily at " + at;
-  if (calendar.contains("Minute"))
-    return format("hourly at %02lld minutes past", calendar.get("Minute").integer());
-  return "every minute";
-}
 
 void requirePushServer() {
   if (!push::configuredBroker())
@@ -70,32 +52,33 @@ ScheduleEvery ScheduleEvery::parse(const std::string& text) {
 AutomationState automationState() {
   VTCPrefsCenter& prefs = VTCPrefsCenter::defaultCenter();
   AutomationState state;
-  state.scheduleOn = prefs.autoSyncOn();
-  if (state.scheduleOn) {
-    const Dictionary calendar = scheduledCalendar();
-    state.cadence = cadenceOf(calendar);
-    state.nextScheduledSync = jobs::nextCalendarDate(calendar, currentClock().now());
+  if (const auto every = installedSchedule()) {
+    state.scheduleOn = true;
+    state.cadence = cadenceOf(*every);
+    std::optional<Date> last;
+    for (const Collection& c : configuredCollections())
+      if (auto attempt = prefs.lastAttemptedSyncDateForDataclass(c.dataclass))
+        last = last ? std::max(*last, *attempt) : *attempt;
+    state.nextScheduledSync = nextRun(*every, currentClock().now(), last);
   }
   if (auto broker = push::configuredBroker()) state.pushServer = broker->url();
   state.pushOn = pushOnFor(storedMemberName());
   return state;
 }
 
-std::string turnScheduleOn(const std::optional<ScheduleEvery>& every) {
+ScheduleOutcome turnScheduleOn(const std::optional<ScheduleEvery>& every) {
   VTCPrefsCenter& prefs = VTCPrefsCenter::defaultCenter();
-  if (every) {
-    prefs.setAutoSyncUnit(every->unit);
-    prefs.setAutoSyncInterval(every->interval);
-  } else if (prefs.autoSyncInterval() <= 0) {
-    prefs.setAutoSyncUnit(0);
-    prefs.setAutoSyncInterval(prefs.automaticallySyncInterval());
-  }
-  prefs.setAutoSyncOn(true);
-  return cadenceOf(scheduledCalendar());
+  // The library's own periodic job would sync a second time: it stays off.
+  if (prefs.autoSyncOn()) prefs.setAutoSyncOn(false);
+  const ScheduleEvery interval = every ? *every : installedSchedule().value_or(ScheduleEvery{1, 1});
+  const bool started = installSchedule(interval);
+  return {cadenceOf(interval), started};
 }
 
 void turnScheduleOff() {
-  VTCPrefsCenter::defaultCenter().setAutoSyncOn(false);
+  VTCPrefsCenter& prefs = VTCPrefsCenter::defaultCenter();
+  if (prefs.autoSyncOn()) prefs.setAutoSyncOn(false);
+  removeSchedule();
 }
 
 std::string checkedPushServer(const std::string& url) {

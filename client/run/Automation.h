@@ -22,7 +22,7 @@ struct ScheduleEvery {
 
 struct AutomationState {
   bool scheduleOn = false;
-  std::string cadence;  // "daily at 14:05"; empty when the schedule is off
+  std::string cadence;  // "every 30 minutes"; empty when the schedule is off
   std::optional<Date> nextScheduledSync;
   bool pushOn = false;
   std::string pushServer;  // as set up; empty when none is
@@ -31,10 +31,14 @@ struct AutomationState {
 // What status shows; asks nothing of the servers.
 AutomationState automationState();
 
-// Turns the schedule on, with the interval given or else the stored one
-// (the configuration's automatic interval when none is stored). Returns the
-// cadence it runs at.
-std::string turnScheduleOn(const std::optional<ScheduleEvery>& every);
+// Turns the client's schedule on (ClientSchedule.h), with the interval
+// given or else the one it had (hourly when none): the cadence it runs at,
+// and whether the user manager started it.
+struct ScheduleOutcome {
+  std::string cadence;
+  bool started = false;
+};
+ScheduleOutcome turnScheduleOn(const std::optional<ScheduleEvery>& every);
 void turnScheduleOff();
 
 // Checks a push server address (mqtt[s]://HOST[:PORT]) and gives it in its

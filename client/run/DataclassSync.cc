@@ -9,6 +9,7 @@
 #include "VantorSyncManager/VTCPrefsCenter.h"
 #include "client/items/ItemRecord.h"
 #include "client/run/FailureText.h"
+#include "client/run/ForeignLocks.h"
 #include "client/run/Housekeeping.h"
 #include "client/run/SyncFailure.h"
 #include "common/Clock.h"
@@ -264,8 +265,12 @@ DataclassOutcome DataclassSync::run(const std::optional<DataclassRecord>& listed
       keepConflicts(plan);
       store(local, plan, incoming);
       if (options_.repair) repair(record);
-      if (needsTruth)
-        session_.setStatus("normal", session_.configuration().get("guid").string(), dataclass);
+      if (needsTruth) try {
+          session_.setStatus("normal", session_.configuration().get("guid").string(), dataclass);
+        } catch (const NubiloException& e) {
+          // Committed and stored: the next sync notes it again.
+          VTC_LOG_WARNING("Could not note %@ as taken in: %@", dataclass, e.reason());
+        }
     }
   } catch (...) {
     if (locked_) {
@@ -302,9 +307,13 @@ void DataclassSync::lockReleasingOwnLeftovers(const std::function<void()>& lockO
     const std::string path = e.userInfo().get(kNBURI).string();
     for (const Value& held : e.userInfo().get("DAV:lockdiscovery").array()) {
       const Dictionary& lock = held.dictionary();
-      if (own.empty() || lock.get("clientid").string() != own) continue;
-      VTC_LOG_WARNING("Giving back a lock of this computer left on %@", path);
+      const bool mine = !own.empty() && lock.get("clientid").string() == own;
+      // Another computer's lock that its run stopped renewing is taken over.
+      if (!mine && !abandonedLock(lock, session_.lockDuration())) continue;
+      VTC_LOG_WARNING("Giving back a lock of %@ left on %@",
+                      mine ? std::string("this computer") : lock.get("clientname").string(), path);
       session_.tesselSession().unlockResourceWithToken(path, lock.get("token").string());
+      if (!mine) outcome_.notes.push_back(takeoverSentence(collection_.dataclass, lock));
       released = true;
     }
     if (!released) throw;

@@ -77,6 +77,7 @@ struct DataclassOutcome {
   bool compacted = false;
   std::optional<int64_t> committedIndex;
   std::vector<ItemActivity> items;  // every item sent or written, in identity order
+  std::vector<std::string> notes;   // sentences the user is told (a lock taken over)
   // Items were left over: skipped, set aside or not written.
   bool leftOver() const {
     return !invalidFiles.empty() || !setAside.empty() || !writeFailures.empty();

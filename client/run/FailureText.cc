@@ -24,6 +24,37 @@ bool showsDamage(const NubiloException& e) {
   return status && (*status == 404 || *status == 200);
 }
 
+namespace {
+
+// Who holds the lock, since when and for how long at most, as the share's
+// lock discovery tells it.
+std::string lockSentence(const std::string& dataclass, const NubiloException& e) {
+  const Array& held = e.userInfo().get("DAV:lockdiscovery").array();
+  if (held.empty())
+    return dataclass +
+           " is locked by another computer that is syncing it; try again in a few "
+           "minutes.";
+  const Dictionary& lock = held.front().dictionary();
+  std::string holder = lock.get("clientname").string();
+  if (holder.empty()) holder = "another computer";
+  std::string sentence = dataclass + " is locked by " + holder + ", which is syncing it";
+  const std::string since = lock.get("acquiredate").string();
+  if (!since.empty()) sentence += " (since " + since.substr(0, 19) + ")";
+  static const std::regex seconds("^Second-([0-9]{1,9})$");
+  std::smatch m;
+  const std::string timeout = lock.get("timeout").string();
+  if (std::regex_match(timeout, m, seconds)) {
+    const long left = std::stol(m[1]);
+    sentence += "; its lock ends within " +
+                (left < 120 ? std::to_string(left) + " seconds"
+                            : std::to_string((left + 59) / 60) + " minutes") +
+                " at the latest, even if " + holder + " stopped";
+  }
+  return sentence + "; try again then.";
+}
+
+}  // namespace
+
 std::string failureSentence(const std::string& dataclass, const NubiloException& e) {
   const auto status = httpStatusIn(e);
   const std::string answered = status ? " (HTTP " + std::to_string(*status) + ")" : "";
@@ -49,8 +80,7 @@ std::string failureSentence(const std::string& dataclass, const NubiloException&
   if (e.name() == NubiloNetworkFailureException)
     return "The server stopped answering while syncing " + dataclass +
            "; the next sync carries on from where this one stopped.";
-  if (e.name() == NubiloLockFailureException)
-    return dataclass + " is locked by another computer that is syncing it; try again shortly.";
+  if (e.name() == NubiloLockFailureException) return lockSentence(dataclass, e);
   if (e.name() == NubiloTesselFullException)
     return "The share is full, so " + dataclass +
            " could not be sent; free some space on it and sync again.";

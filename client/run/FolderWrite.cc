@@ -98,9 +98,10 @@ FolderWriteResult FolderWriter::write() {
   // Made durable together at the end, before the engine hears of them.
   folder.deferFlushes(true);
   size_t done = 0;
+  int64_t bytesWritten = 0;
   for (const std::string& id : takes) {
     if (progress && (done++ & 63) == 0)
-      progress->step(dataclass, "writing files", done - 1, takes.size(), 0);
+      progress->step(dataclass, "writing files", done - 1, takes.size(), bytesWritten);
     auto have = fileOf.find(id);
     const std::string* currentFile = have == fileOf.end() ? nullptr : &have->second;
     auto record = truth.find(id);
@@ -157,6 +158,7 @@ FolderWriteResult FolderWriter::write() {
       result.failures.push_back(target + ": " + strerror(errno));
       continue;
     }
+    bytesWritten += static_cast<int64_t>(bytes->size());
     // A file that holds its record's truth byte for byte keeps none of its own.
     update.state.items.emplace_back(
         target, engine::StoredItem{{state.size, state.modifiedNanoseconds, state.changedNanoseconds,

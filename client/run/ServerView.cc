@@ -36,6 +36,10 @@ DataclassRecord DataclassRecord::fromRecord(const Dictionary& record) {
       r.truthDigest = text.substr(colon + 1);
     }
   }
+  for (auto [key, field] : {std::pair{"collectionname", &r.collectionName},
+                            std::pair{"collectioncolor", &r.collectionColor}})
+    if (const Value* v = record.find(key); v && v->isString() && !v->string().empty())
+      *field = v->string();
   // A server whose collections carry no entity tag: the record's own values
   // change with every commit, reset and repair, so they stand in for one.
   if (r.etag.empty() || r.etag == kNoETag)
@@ -45,9 +49,11 @@ DataclassRecord DataclassRecord::fromRecord(const Dictionary& record) {
 }
 
 ServerView ServerView::read(NubiloRemoteSession& session) {
-  DavTransaction t =
-      session._issuePropFindWithRetryAtPath(davpath::collection(session.schemasPath()),
-                                            kDAVOneDepth, session.dataclassRecordProperties());
+  std::vector<std::string> properties = session.dataclassRecordProperties();
+  for (const char* meta : {"collectionname", "collectioncolor"})
+    properties.push_back(session.syncNamespace() + meta);
+  DavTransaction t = session._issuePropFindWithRetryAtPath(
+      davpath::collection(session.schemasPath()), kDAVOneDepth, properties);
   if (!t.isSuccessful())
     throw NubiloException(NubiloTransactionFailureException,
                           format("The dataclass records could not be read %@", t));

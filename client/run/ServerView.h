@@ -21,6 +21,8 @@ struct DataclassRecord {
   // minversion holds, and a digest of that truth (see truthDigest).
   std::optional<int64_t> truthIndex;
   std::string truthDigest;
+  // The vdir folder's name and colour (CollectionMeta.h), when set.
+  std::optional<std::string> collectionName, collectionColor;
 
   static DataclassRecord fromRecord(const Dictionary& record);  // getDataclassInfo's form
 };

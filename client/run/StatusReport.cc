@@ -11,6 +11,7 @@
 #include "client/run/Automation.h"
 #include "client/run/Collections.h"
 #include "client/run/DataclassSync.h"
+#include "client/run/FailureText.h"
 #include "client/run/ServerView.h"
 #include "client/run/SupportFolder.h"
 #include "platform/dav/DavPaths.h"
@@ -153,9 +154,8 @@ StatusReport gatherStatus() {
     status.serverError = e.what();
     status.serverErrorKind = e.kind();
   } catch (const NubiloException& e) {
-    status.serverError = "The share could not be asked: " + e.reason();
-    status.serverErrorKind =
-        e.name() == NubiloNetworkFailureException ? FailureKind::Unreachable : FailureKind::Other;
+    status.serverError = failureSentence("the account", e);
+    status.serverErrorKind = failureKind(e);
   }
   return status;
 }

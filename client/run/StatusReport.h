@@ -48,6 +48,8 @@ struct StatusReport {
   std::optional<Date> nextScheduledSync;
   bool pushOn = false;
   std::string pushServer;
+  std::string logFile;   // where the log is, "~/..."
+  std::string logLevel;  // error, warn, info or debug
   std::vector<DataclassStatus> dataclasses;
   std::vector<ComputerStatus> computers;
   std::vector<KeptConflict> conflicts;

@@ -4,6 +4,8 @@
 #include <unistd.h>
 
 #include <chrono>
+#include <memory>
+#include <tuple>
 
 #include "VantorSyncManager/Diagnostics.h"
 #include "VantorSyncManager/HostIdentity.h"
@@ -13,7 +15,10 @@
 #include "VantorSyncManager/VTCPrefsCenter.h"
 #include "client/run/Account.h"
 #include "client/run/Automation.h"
+#include "client/run/CollectionMeta.h"
 #include "client/run/FailureText.h"
+#include "client/run/LockRenewal.h"
+#include "client/run/SharedConflicts.h"
 #include "client/run/StatusReport.h"
 #include "client/run/SyncOwner.h"
 #include "common/Clock.h"
@@ -56,6 +61,17 @@ void rememberOutcome(const DataclassOutcome& o, const std::string* sentence) {
 
 }  // namespace
 
+std::string notSyncedSentence(const std::string& name) {
+  std::string names;
+  for (const Collection& c : configuredCollections())
+    names += (names.empty() ? "" : ", ") + c.dataclass;
+  if (names.empty())
+    return name +
+           " is not synced on this computer, nor is any other folder; add one with "
+           "`nubilosyncclient add contacts|calendars FOLDER`.";
+  return name + " is not synced on this computer; its synced folders are " + names + ".";
+}
+
 int RunResult::exitStatus() const {
   if (!failures.empty()) return static_cast<int>(failures.front().kind);
   for (const DataclassOutcome& o : outcomes)
@@ -75,11 +91,7 @@ RunResult runSync(const RunRequest& request) {
   } else {
     for (const std::string& name : request.dataclasses) {
       auto c = configuredCollection(name);
-      if (!c)
-        throw SyncFailure(FailureKind::Usage,
-                          name +
-                              " is not synced on this computer; add a folder for it with "
-                              "`nubilosyncclient add contacts|calendars FOLDER`.");
+      if (!c) throw SyncFailure(FailureKind::Usage, notSyncedSentence(name));
       collections.push_back(*c);
     }
   }
@@ -91,14 +103,31 @@ RunResult runSync(const RunRequest& request) {
   auto owner = SyncOwner::acquire();
   const Date runStart = currentClock().now();
   const SecretHold holdingPassword;
-  const auto [member, password] = storedCredentials();
   RunResult result;
-  const ServerAddress server = ServerAddress::fromConfiguration(prefs.configuration());
-  if (server.scheme != "https")
-    if (auto warning = network::passwordInClearWarning(member, server.host, server.url(), "HTTP"))
-      result.warnings.push_back(*warning);
-  auto session = openSession(member, password, prefs.configuration());
-  session->setAccountSeal(accountSeal(member));
+  std::string member, password;
+  std::unique_ptr<NubiloRemoteSession> session;
+  try {
+    std::tie(member, password) = storedCredentials();
+    const ServerAddress server = ServerAddress::fromConfiguration(prefs.configuration());
+    if (server.scheme != "https")
+      if (auto warning = network::passwordInClearWarning(member, server.host, server.url(), "HTTP"))
+        result.warnings.push_back(*warning);
+    session = openSession(member, password, prefs.configuration());
+    session->setAccountSeal(accountSeal(member));
+  } catch (const SyncFailure& e) {
+    // A run that never reached the share is still this computer's last
+    // attempt: status tells when and why.
+    if (!request.dryRun)
+      for (const Collection& c : collections) {
+        prefs.setLastAttemptedSyncDateForDataclass(c.dataclass);
+        prefs.setSyncSuccessful(false, c.dataclass);
+        DataclassOutcome none;
+        none.dataclass = c.dataclass;
+        const std::string sentence = e.what();
+        rememberOutcome(none, &sentence);
+      }
+    throw;
+  }
   HeldLocks locks(*session);
   if (!request.dryRun) locks.releaseLeftovers();
   auto engine =
@@ -115,7 +144,8 @@ RunResult runSync(const RunRequest& request) {
   options.maxDeletePercent = request.maxDeletePercent;
   options.deletesConfirmed = request.deletesConfirmed;
   options.repair = request.repair;
-  options.progress = request.progress;
+  LockRenewal renewal(*session, request.progress);
+  options.progress = &renewal;
   options.computerName = prefs.clientName().value_or("this computer");
   ConflictStore conflicts;
 
@@ -154,6 +184,12 @@ RunResult runSync(const RunRequest& request) {
       }
       if (failure) outcome = sync.outcome();
       usedServer = usedServer || outcome.usedServer;
+      if (!request.dryRun && !failure) {
+        const auto listed = view.record(collection.dataclass);
+        syncCollectionMeta(*session, collection,
+                           listed ? CollectionMeta{listed->collectionName, listed->collectionColor}
+                                  : CollectionMeta{});
+      }
       if (!request.dryRun) {
         prefs.setSyncSuccessful(!failure, collection.dataclass);
         rememberOutcome(outcome, failure ? &failure->sentence : nullptr);
@@ -161,7 +197,7 @@ RunResult runSync(const RunRequest& request) {
       summary.set(collection.dataclass,
                   Value(summaryEntry(outcome, start, currentClock().now(),
                                      failure ? &failure->sentence : nullptr)));
-      if (request.progress) request.progress->done(collection.dataclass);
+      renewal.done(collection.dataclass);
       result.outcomes.push_back(outcome);
       if (failure) {
         result.failures.push_back(*failure);
@@ -186,12 +222,32 @@ RunResult runSync(const RunRequest& request) {
                      Value(static_cast<int64_t>(o.receivedChanges)));
     }
     VTCLogStatistics(statistics);
-    session->sendReportingInfo(summary);
-    // For the other computers' status: when this one last synced, and which
-    // report is its own. Not judged: it only informs.
-    Dictionary record{{"lastsync", textOf(Value(currentClock().now()))}};
+    try {
+      session->sendReportingInfo(summary);
+    } catch (const NubiloException& e) {
+      // The changes are committed; a report that did not go out is no failure.
+      VTC_LOG_WARNING("The sync report could not be written: %@", e.reason());
+    }
+  }
+  if (!request.dryRun && result.failures.empty()) {
+    // For the other computers' status: when this one last synced (an idle
+    // sync too), and which report is its own. Not judged: it only informs.
+    // An encrypted account's share sees the name and the conflicts sealed.
+    std::string name = options.computerName;
+    std::string shared = sharedConflictsText(conflicts.list());
+    if (const sealing::AccountSeal* seal = session->accountSeal()) {
+      name = seal->sealText(name, sealing::kClientNamePurpose);
+      shared = seal->sealText(shared, sealing::kSharedConflictsPurpose);
+    }
+    Dictionary record{{"lastsync", textOf(Value(currentClock().now()))},
+                      {"clientname", Value(name)},
+                      {kSharedConflictsKey, Value(shared)}};
     if (auto machine = getHostUUIDString()) record.set("machineguid", Value(*machine));
-    session->patchClientInfo(record);
+    try {
+      session->patchClientInfo(record);
+    } catch (const NubiloException& e) {
+      VTC_LOG_WARNING("This computer's last sync could not be noted on the share: %@", e.reason());
+    }
   }
   if (!request.dryRun && result.failures.empty())
     prefs.setLastSuccessfulSyncDate(currentClock().now());

@@ -43,4 +43,8 @@ struct RunResult {
 // recorded in the result and the next dataclass is synced.
 RunResult runSync(const RunRequest& request);
 
+// The sentence for a dataclass name that no folder here syncs: the names
+// that are synced.
+std::string notSyncedSentence(const std::string& name);
+
 }  // namespace vtc::client

@@ -161,8 +161,10 @@ vtc::Dictionary VTCPrefsCenter::defaultConfiguration() {
     configuration.merge(*signedLayer);
   } else if (syncing && !noServer) {
     VTC_LOG_ERROR("Failed to validate signature on config file, using default configuration");
-  } else {
-    VTC_LOG_INFO("Syncing not enabled and no cached config file, using default configuration");
+  } else if (!noServer) {
+    VTC_LOG_INFO(
+        "Syncing is off and no configuration was downloaded before; the built-in "
+        "configuration applies");
   }
 
   vtc::Dictionary perHost = store.copyMultiple({}, kVantorDefaultsKey, Scope::CurrentHost);

@@ -25,7 +25,7 @@ bool NubiloRemoteSession::createSyncPaths() {
   if (const auto& headers = t._responseHeaders()) {
     const vtc::Value* server = headers->find("X-Responding-Server");
     _respondingServer = server ? std::optional<std::string>(server->string()) : std::nullopt;
-    VTC_LOG_INFO("Responding server: %@", _respondingServer);
+    if (_respondingServer) VTC_LOG_INFO("Responding server: %@", *_respondingServer);
   }
   if (t.transactionState() == vtc::kTransactionCompleted) return t.isSuccessful();
 

@@ -14,6 +14,7 @@
 #include "support/TestHome.h"
 
 using testing::HasSubstr;
+using testing::Not;
 using vtc::local::ApacheShare;
 using vtc::local::Computer;
 
@@ -125,13 +126,13 @@ TEST_F(Living, ARestoredConflictTakesEffectOnTheOtherComputerAndADroppedOneIsGon
 }
 
 TEST_F(Living, EachFailureIsOnePlainSentenceWithAnExitStatusOfItsKind) {
-  // A refused login says how to store the right password, once.
+  // A refused login says to check the password, once.
   Computer wrong{"Mac W"};
   Computer::Result login = wrong.run({"setup", url, "--user", ApacheShare::kUser,
                                       "--password-command", "printf nope", "--allow-insecure"});
   EXPECT_EQ(login.status, 3);
-  EXPECT_THAT(login.err, HasSubstr("refused the password for alice; store the right one with "
-                                   "`nubilosyncclient setup`"));
+  EXPECT_THAT(login.err, HasSubstr("refused the password for alice; check the member name and "
+                                   "the password"));
   const size_t requests = share.accessEntries().size();
   a.setPreference("PasswordCommand", vtc::Value("printf nope"));  // a password changed elsewhere
   EXPECT_EQ(a.run({"sync"}).status, 3);
@@ -211,6 +212,114 @@ TEST_F(Living, APasswordFromStandardInputGoesToTheSecretServiceAndNowhereElse) {
         << entry.path();
   }
   EXPECT_THAT(c.run({"status", "--json"}).out, testing::Not(HasSubstr(ApacheShare::kPassword)));
+}
+
+}  // namespace
+
+namespace {
+
+TEST_F(Living, VersionSettingsAndForgettingAComputerThatIsGone) {
+  Computer::Result version = a.run({"--version"});
+  EXPECT_EQ(version.status, 0);
+  EXPECT_THAT(version.out, testing::MatchesRegex("nubilosyncclient [0-9]+\\.[0-9]+\n"));
+
+  // This computer's name and the log's level, without a property list.
+  EXPECT_EQ(a.run({"config", "get", "name"}).out, "Mac A\n");
+  EXPECT_EQ(a.run({"config", "set", "name", "Ann's laptop"}).status, 0);
+  Computer::Result level = a.run({"config", "set", "log-level", "info"});
+  EXPECT_EQ(level.status, 0) << level.err;
+  EXPECT_EQ(level.out,
+            "The log (~/Library/Logs/Sync/nubilosync.log) now records what each sync does, "
+            "warnings and errors.\n");
+  EXPECT_EQ(a.run({"config"}).out, "name Ann's laptop\nlog-level info\n");
+  EXPECT_EQ(a.run({"config", "set", "colour", "red"}).status, 2);
+  EXPECT_EQ(a.run({"config", "set", "log-level", "loud"}).status, 2);
+  ASSERT_EQ(a.run({"sync"}).status, 0);
+  EXPECT_THAT(Computer::read(a.home() + "/Library/Logs/Sync/nubilosync.log"), HasSubstr("|Info|"));
+  EXPECT_THAT(a.run({"status"}).out,
+              HasSubstr("Log: ~/Library/Logs/Sync/nubilosync.log (info; raise it with"));
+  EXPECT_THAT(b.run({"status"}).out, HasSubstr("Ann's laptop: last sync 20"));
+
+  // A computer seen lately is kept unless forced; a forgotten one is gone.
+  Computer c{"Old desktop"};
+  c.join(url, ApacheShare::kUser, ApacheShare::kPassword);
+  ASSERT_EQ(c.run({"sync"}).status, 0);
+  Computer::Result refused = b.run({"forget", "Old desktop"});
+  EXPECT_EQ(refused.status, 2);
+  EXPECT_THAT(refused.err, HasSubstr("within the last week; if it is gone for good, forget it "
+                                     "with `nubilosyncclient forget --force Old desktop`"));
+  EXPECT_EQ(b.run({"forget", "Nobody"}).status, 2);
+  Computer::Result forgot = b.run({"forget", "--force", "Old desktop"});
+  EXPECT_EQ(forgot.status, 0) << forgot.err;
+  EXPECT_EQ(forgot.out, "Forgot Old desktop; if it syncs again, it joins as a new computer.\n");
+  EXPECT_THAT(b.run({"status"}).out, Not(HasSubstr("Old desktop")));
+  EXPECT_EQ(status(b)["computers"].size(), 2u);
+}
+
+}  // namespace
+
+namespace {
+
+TEST_F(Living, ConflictsAreListedByNameWithBothValuesOnEveryComputerAndDroppedAllAtOnce) {
+  Computer::write(a.contacts() + "/ann.vcf", card("ann", "Ann Smith", "1"));
+  ASSERT_EQ(a.run({"sync"}).status, 0);
+  ASSERT_EQ(b.run({"sync"}).status, 0);
+  Computer::write(a.contacts() + "/ann.vcf", card("ann", "Ann Smith", "100"));
+  Computer::write(b.contacts() + "/ann.vcf", card("ann", "Ann Smith", "200"));
+  ASSERT_EQ(a.run({"sync"}).status, 0);
+  ASSERT_EQ(b.run({"sync"}).status, 0);
+  ASSERT_EQ(a.run({"sync"}).status, 0);
+
+  // Where the losing value is kept: by name, both values side by side.
+  Computer::Result here = b.runOnTerminal({"conflicts"});
+  EXPECT_EQ(here.status, 0) << here.out;
+  EXPECT_THAT(here.out,
+              testing::ContainsRegex(
+                  "[0-9a-f]{8}  Ann Smith: TEL  \\(ann\\.vcf, com\\.korvo\\.Contacts\\)"));
+  EXPECT_THAT(here.out, testing::ContainsRegex("kept \\(from Mac A\\) +\\| lost \\(from Mac B, "
+                                               "20[0-9-]{8} [0-9:]{8}\\)"));
+  EXPECT_THAT(here.out, testing::ContainsRegex("TEL:100 +\\| TEL:200"));
+  // On the other computer: the same conflict, named as kept on Mac B.
+  Computer::Result there = a.run({"conflicts"});
+  EXPECT_EQ(there.status, 0) << there.err;
+  EXPECT_THAT(there.out, HasSubstr("No conflicts are kept here.\n\nKept on Mac B (restore or drop "
+                                   "them there):\n  Ann Smith: TEL  (ann.vcf, "
+                                   "com.korvo.Contacts)\n"));
+  EXPECT_THAT(there.out, testing::ContainsRegex("TEL:100 +\\| TEL:200"));
+
+  Computer::Result dropped = b.run({"conflicts", "drop", "--all"});
+  EXPECT_EQ(dropped.out, "Dropped 1 conflict; the values that stand are unchanged.\n");
+  EXPECT_EQ(b.run({"conflicts", "drop"}).status, 2);
+  ASSERT_EQ(b.run({"sync"}).status, 0);
+  EXPECT_EQ(a.run({"conflicts"}).out, "No conflicts are kept here.\n");
+}
+
+}  // namespace
+
+namespace {
+
+TEST_F(Living, AFolderNameAndColourTravelWithTheCollectionAndATildeMeansTheHome) {
+  Computer::write(a.contacts() + "/displayname", "Family\n");
+  Computer::write(a.contacts() + "/color", "#ff8800\n");
+  Computer::write(a.contacts() + "/ann.vcf", card("ann", "Ann", "1"));
+  ASSERT_EQ(a.run({"sync"}).status, 0);
+  ASSERT_EQ(b.run({"sync"}).status, 0);
+  EXPECT_EQ(Computer::read(b.contacts() + "/displayname"), "Family\n");
+  EXPECT_EQ(Computer::read(b.contacts() + "/color"), "#ff8800\n");
+  EXPECT_EQ(contacts(status(b))["items"], 1);  // properties, not records
+
+  // A change on either side travels; a colour removed is removed.
+  Computer::write(b.contacts() + "/displayname", "Family and friends\n");
+  std::filesystem::remove(b.contacts() + "/color");
+  ASSERT_EQ(b.run({"sync"}).status, 0);
+  ASSERT_EQ(a.run({"sync"}).status, 0);
+  EXPECT_EQ(Computer::read(a.contacts() + "/displayname"), "Family and friends\n");
+  EXPECT_FALSE(std::filesystem::exists(a.contacts() + "/color"));
+
+  Computer::Result added = a.run({"add", "contacts", "~/work", "--dataclass", "work.Contacts"});
+  EXPECT_EQ(added.status, 0) << added.err;
+  EXPECT_THAT(added.out, HasSubstr(a.home() + "/work"));
+  EXPECT_TRUE(std::filesystem::is_directory(a.home() + "/work"));
 }
 
 }  // namespace

@@ -218,7 +218,7 @@ TEST_F(Push, TheListenerSurvivesARestartOfThePushServerAndCatchesUpOnWhatItMisse
 TEST_F(Push, StatusShowsScheduleAndPushAndNoPasswordIsInAUnitFileCommandLineOrLogLine) {
   Computer::Result scheduled = a.run({"schedule", "on", "--every", "1h"});
   ASSERT_EQ(scheduled.status, 0) << scheduled.err;
-  EXPECT_THAT(scheduled.out, HasSubstr("Scheduled syncs are on: hourly at "));
+  EXPECT_THAT(scheduled.out, HasSubstr("Scheduled syncs are on: every hour"));
   listen();
   Computer::write(a.contacts() + "/ann.vcf", card("ann", "0"));
   syncA();
@@ -228,8 +228,8 @@ TEST_F(Push, StatusShowsScheduleAndPushAndNoPasswordIsInAUnitFileCommandLineOrLo
   EXPECT_THAT(listenerCommandLine, HasSubstr("listen"));
 
   Computer::Result statusA = a.run({"status"}), statusB = b.run({"status"});
-  EXPECT_THAT(statusA.out, testing::ContainsRegex("Schedule: hourly at [0-9]{2} minutes past, "
-                                                  "next [0-9]{4}-[0-9]{2}-[0-9]{2} "));
+  EXPECT_THAT(statusA.out, testing::ContainsRegex("Schedule: every hour, next "
+                                                  "[0-9]{4}-[0-9]{2}-[0-9]{2} [0-9]{2}:00:00"));
   EXPECT_THAT(statusA.out, HasSubstr("Push: off (" + broker.url() + ")"));
   EXPECT_THAT(statusB.out, HasSubstr("Schedule: off\nPush: on (" + broker.url() + ")"));
 
@@ -247,9 +247,8 @@ TEST_F(Push, StatusShowsScheduleAndPushAndNoPasswordIsInAUnitFileCommandLineOrLo
         texts[c->home() + recorded] = Computer::read(c->home() + recorded);
   }
   for (const std::string& needed :
-       {a.home() + "/.config/systemd/user/com.korvo.NubiloSyncClientAgent.timer",
+       {a.home() + "/.config/systemd/user/nubilosyncclient.timer",
         b.home() + "/.config/systemd/user/com.korvo.NubiloPushListener.service",
-        a.home() + "/Library/LaunchAgents/com.korvo.NubiloSyncClientAgent.plist",
         b.home() + "/.local/share/NubiloSyncClient/PushRegistrations.plist",
         a.home() + "/.systemctl-calls", b.home() + "/.systemctl-calls",
         a.home() + "/Library/Logs/Sync/nubilosync.log",

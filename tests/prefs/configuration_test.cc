@@ -9,12 +9,12 @@
 #include "VantorSyncManager/NubiloSignedDocument.h"
 #include "VantorSyncManager/PublicNames.h"
 #include "VantorSyncManager/VTCPrefsCenter.h"
+#include "localshare/ApacheShare.h"
 #include "platform/network/InterfaceAddresses.h"
 #include "platform/os/SystemVersion.h"
 #include "platform/plist/PlistCodec.h"
 #include "platform/prefs/PreferenceStore.h"
 #include "prefs/ClientConfiguration.h"
-#include "localshare/ApacheShare.h"
 #include "support/FakeTime.h"
 #include "support/KeyPair.h"
 #include "support/LogCapture.h"
@@ -136,7 +136,8 @@ TEST_F(Configuration, WithSyncingOffABadSignatureOrAFailedDownloadTheOtherLayers
   EXPECT_TRUE(share.accessEntries().empty());
   EXPECT_EQ(logged.messages("Info"),
             std::vector<std::string>{
-                "Syncing not enabled and no cached config file, using default configuration"});
+                "Syncing is off and no configuration was downloaded before; the built-in "
+                "configuration applies"});
 
   prefs.setSyncTurnedOn(true);
   EXPECT_EQ(prefs.defaultConfiguration().get("host_name").string(), "sync.nubilo.example");

@@ -25,6 +25,7 @@ inline constexpr const char* kSealedTextPrefix = "sealed:";
 inline constexpr const char* kClientNamePurpose = "client name";
 inline constexpr const char* kTruthDigestPurpose = "truth digest";
 inline constexpr const char* kReportPurpose = "report";
+inline constexpr const char* kSharedConflictsPurpose = "shared conflicts";
 
 class AccountSeal {
  public:
